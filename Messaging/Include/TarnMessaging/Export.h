@@ -1,0 +1,5 @@
+// Export macro of the TarnMessaging shared library: it is built with hidden
+// visibility, and only declarations carrying TARN_MESSAGING_API are public.
+#pragma once
+
+#define TARN_MESSAGING_API __attribute__((visibility("default")))

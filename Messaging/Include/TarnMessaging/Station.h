@@ -1,0 +1,42 @@
+// Tarn::Station: a named relay, both a Broadcaster (listeners attach to it)
+// and a Listener (it can be attached to another broadcaster, and broadcasts
+// again everything it hears).
+//
+//   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &statusLine);
+//   Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, Progress(1, 2));
+//
+// Stations are normally made, found and deleted by the station registry
+// (StationRegistry.h) and reached by name through StationUtils. A station the
+// registry holds is deleted only by the registry.
+//
+// Threading: as Broadcaster and Listener. The destructor takes the registry's
+// lock for one lookup and, off the main thread, may wait while the main
+// thread delivers to the station as a listener.
+#pragma once
+
+#include <TarnMessaging/Broadcaster.h>
+#include <TarnMessaging/Export.h>
+#include <TarnMessaging/Listener.h>
+
+#include <kivcore/ImmutableString.h>
+
+namespace Tarn {
+
+class TARN_MESSAGING_API Station : public Broadcaster, public Listener {
+public:
+  explicit Station(const kivcore::utility::ImmutableString& inStationID);
+  ~Station() override;
+
+  // Broadcasts to the station's listeners (Broadcaster::BroadcastMessage).
+  void BroadcastMessage(const Message& inMessage) override;
+  // Relays a message heard as a listener to the station's own listeners,
+  // straight through Broadcaster::BroadcastMessage.
+  void ListenToMessage(const Message& inMessage) override;
+
+  kivcore::utility::ImmutableString GetStationID() const { return mStationID; }
+
+private:
+  const kivcore::utility::ImmutableString mStationID;
+};
+
+}  // namespace Tarn

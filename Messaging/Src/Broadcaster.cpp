@@ -1,0 +1,379 @@
+#include <TarnMessaging/Broadcaster.h>
+#include <TarnMessaging/Message.h>
+
+#include "ContractCheck.h"
+
+#include <kivcore/Error.h>
+#include <kivcore/MainThread.h>
+
+#include <boost/bind/bind.hpp>
+#include <boost/function.hpp>
+#include <boost/make_shared.hpp>
+
+#include <cstdint>
+#include <functional>
+#include <limits>
+#include <new>
+
+namespace Tarn {
+
+using kivcore::threads::Gate;
+using kivcore::threads::RecursiveMutex;
+
+namespace {
+
+constexpr const char* kAddListenerName = "Tarn::Broadcaster::AddListener";
+constexpr const char* kRemoveListenerName = "Tarn::Broadcaster::RemoveListener";
+constexpr const char* kHasListenerName = "Tarn::Broadcaster::HasListener";
+
+template <class WeakPtr>
+bool OwnerEquivalent(const WeakPtr& inA, const WeakPtr& inB) noexcept {
+  return !inA.owner_before(inB) && !inB.owner_before(inA);
+}
+
+// Unlocks on every way out of a locked region, exceptions included.
+class Unlocker {
+public:
+  explicit Unlocker(RecursiveMutex& inMutex) noexcept : mMutex(&inMutex) {}
+  ~Unlocker() { Release(); }
+  void Release() noexcept {
+    if (mMutex != nullptr) mMutex->Unlock();
+    mMutex = nullptr;
+  }
+  Unlocker(const Unlocker&) = delete;
+  Unlocker& operator=(const Unlocker&) = delete;
+
+private:
+  RecursiveMutex* mMutex;
+};
+
+}  // namespace
+
+// ---------------------------------------------------------------------------
+// ListenerEntry
+
+bool ListenerEntry::operator==(const ListenerEntry& inOther) const noexcept {
+  return mListener == inOther.mListener && mSafeListener.get() == inOther.mSafeListener.get() &&
+         OwnerEquivalent(mBoostWeakListener, inOther.mBoostWeakListener) &&
+         OwnerEquivalent(mStdWeakListener, inOther.mStdWeakListener);
+}
+
+bool ListenerEntry::operator<(const ListenerEntry& inOther) const noexcept {
+  const auto listener = reinterpret_cast<std::uintptr_t>(mListener);
+  const auto otherListener = reinterpret_cast<std::uintptr_t>(inOther.mListener);
+  if (listener != otherListener) return listener < otherListener;
+  if (mSafeListener.owner_before(inOther.mSafeListener)) return true;
+  if (inOther.mSafeListener.owner_before(mSafeListener)) return false;
+  if (mBoostWeakListener.owner_before(inOther.mBoostWeakListener)) return true;
+  if (inOther.mBoostWeakListener.owner_before(mBoostWeakListener)) return false;
+  return mStdWeakListener.owner_before(inOther.mStdWeakListener);
+}
+
+bool ListenerEntry::IsLive() const {
+  if (mListener != nullptr) return true;
+  // The temporary references are dropped at once; if they were the last, the
+  // listener goes away here.
+  if (mSafeListener && ResolveSafeListener(mSafeListener) != nullptr) return true;
+  if (!mBoostWeakListener.expired() && mBoostWeakListener.lock()) return true;
+  if (!mStdWeakListener.expired() && mStdWeakListener.lock()) return true;
+  return false;
+}
+
+// ---------------------------------------------------------------------------
+// Construction and destruction
+
+struct Broadcaster::BroadcastMessageRecord {
+  const ListenerEntry& mEntry;
+  const Message& mMessage;
+};
+
+Broadcaster::Broadcaster() = default;
+
+Broadcaster::Broadcaster(const Broadcaster& inOther) : mBroadcasting(inOther.IsBroadcasting()) {}
+
+Broadcaster::~Broadcaster() {
+  for (const ListenerEntry& entry : mListeners) {
+    if (entry.mListener != nullptr) entry.mListener->RemoveBroadcaster(this);
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Registry
+
+std::int32_t Broadcaster::FindEntry(const ListenerEntry& inEntry) const noexcept {
+  std::int32_t position = 0;
+  for (const ListenerEntry& entry : mListeners) {
+    if (entry == inEntry) return position;
+    ++position;
+  }
+  return -1;
+}
+
+bool Broadcaster::AddEntry(const ListenerEntry& inEntry) {
+  mMutex.Lock("Broadcaster::AddListener");
+  Unlocker unlock(mMutex);
+  {
+    mMutex.Lock("Broadcaster::HasListener");
+    Unlocker unlockSearch(mMutex);
+    if (FindEntry(inEntry) >= 0) return false;
+  }
+  // Positions are 32-bit; a registry that could not be indexed counts as
+  // exhausted storage.
+  if (mListeners.size() >= static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) throw std::bad_alloc();
+  mListeners.push_front(inEntry);
+  // The new entry lies in front of every running broadcast's cursor: each
+  // cursor moves with the entry it stands on, and none of those broadcasts
+  // will serve the newcomer.
+  for (std::int32_t& cursor : mBroadcastCursors) ++cursor;
+  return true;
+}
+
+void Broadcaster::AddListener(Listener* inListener) {
+  TARN_CONTRACT_CHECK(inListener != NULL, kAddListenerName);
+  if (inListener == nullptr) return;  // nothing to register and no back-link to make
+  ListenerEntry entry;
+  entry.mListener = inListener;
+  if (!AddEntry(entry)) return;
+  try {
+    inListener->AddBroadcaster(this);
+  } catch (...) {
+    // Without its back-link the listener could not detach itself when it
+    // dies; take the registration back.
+    RemoveEntry(entry);
+    throw;
+  }
+}
+
+void Broadcaster::AddListener(InterfaceRef<ISafeListener> inListener) {
+  TARN_CONTRACT_CHECK(inListener != NULL, kAddListenerName);
+  if (inListener != nullptr) {
+    TARN_CONTRACT_CHECK(IWeakReferenceCapableRef(inListener) != NULL, kAddListenerName);
+  }
+  ListenerEntry entry;
+  entry.mSafeListener = GetSafeListenerHandle(inListener);
+  AddEntry(entry);
+}
+
+void Broadcaster::AddListener(const boost::weak_ptr<Listener>& inListener) {
+  TARN_CONTRACT_CHECK(inListener.lock() != NULL, kAddListenerName);
+  ListenerEntry entry;
+  entry.mBoostWeakListener = inListener;
+  AddEntry(entry);
+}
+
+void Broadcaster::AddListener(const std::weak_ptr<Listener>& inListener) {
+  TARN_CONTRACT_CHECK(inListener.lock() != NULL, kAddListenerName);
+  ListenerEntry entry;
+  entry.mStdWeakListener = inListener;
+  AddEntry(entry);
+}
+
+void Broadcaster::RemoveListener(Listener* inListener, bool inUpdateListener) {
+  TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
+  if (inListener == nullptr) return;  // never follow a null pointer
+  ListenerEntry entry;
+  entry.mListener = inListener;
+  RemoveEntry(entry);
+  if (inUpdateListener) inListener->RemoveBroadcaster(this);
+}
+
+void Broadcaster::RemoveListener(InterfaceRef<ISafeListener> inListener) {
+  TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
+  ListenerEntry entry;
+  entry.mSafeListener = GetSafeListenerHandle(inListener);
+  RemoveEntry(entry);
+}
+
+void Broadcaster::RemoveListener(const boost::weak_ptr<Listener>& inListener) {
+  TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
+  ListenerEntry entry;
+  entry.mBoostWeakListener = inListener;
+  RemoveEntry(entry);
+}
+
+void Broadcaster::RemoveListener(const std::weak_ptr<Listener>& inListener) {
+  TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
+  ListenerEntry entry;
+  entry.mStdWeakListener = inListener;
+  RemoveEntry(entry);
+}
+
+void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
+  boost::shared_ptr<Gate> gate;
+  bool ownsGateRecord = false;
+  ListenerEntry gateKey;
+
+  mMutex.Lock("Broadcaster::RemoveListener1");
+  Unlocker unlock(mMutex);
+
+  const std::int32_t position = FindEntry(inListener);
+  if (position < 0) {
+    // A first remover on another thread may have taken the entry out and
+    // still be waiting for the delivery in progress. Returning now would let
+    // this caller destroy the listener while its handler runs, so a worker
+    // waits on the same gate instead.
+    if (!mGateMap.empty() && !kivcore::threads::CurrentThreadIsMainThread()) {
+      const auto waiting = mGateMap.find(inListener);
+      if (waiting != mGateMap.end()) gate = waiting->second.mGate;
+    }
+    unlock.Release();
+    if (gate) gate->PassThrough(-1);
+    return;
+  }
+
+  TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
+
+  // Broadcasts whose cursor stands on the entry are delivering to it now.
+  std::int32_t deliveries = 0;
+  for (const std::int32_t cursor : mBroadcastCursors) {
+    if (cursor == position) ++deliveries;
+  }
+
+  if (deliveries > 0 && !kivcore::threads::CurrentThreadIsMainThread()) {
+    // The gate is made (and may fail) before anything changes, so that an
+    // exhausted allocator leaves the registry as it was. The main thread never
+    // waits: its deliveries in progress are on its own stack.
+    auto existing = mGateMap.find(mListeners[static_cast<std::size_t>(position)]);
+    if (existing != mGateMap.end()) {
+      // An earlier removal of an equal entry still waits (the listener was
+      // added again meanwhile): share its gate and add our deliveries to its
+      // count, so that neither remover returns early or waits for ever.
+      gate = existing->second.mGate;
+      existing->second.mCount += deliveries;
+    } else {
+      gate = boost::allocate_shared<Gate>(kivcore::utility::SmallBlockAllocator::STLAllocator<Gate>(), false);
+      gateKey = mListeners[static_cast<std::size_t>(position)];
+      mGateMap.emplace(gateKey, GateRecord{gate, deliveries});
+      ownsGateRecord = true;
+    }
+  }
+
+  // A cursor on the removed entry steps back to the entry before it, so its
+  // broadcast goes on with the entry that followed the removed one; cursors
+  // beyond it step back with the entries they stand on.
+  for (std::int32_t& cursor : mBroadcastCursors) {
+    if (cursor >= position) --cursor;
+  }
+  mListeners.erase(mListeners.begin() + position);
+  unlock.Release();
+
+  if (!gate) return;
+  gate->PassThrough(-1);
+  if (!ownsGateRecord) return;
+  mMutex.Lock("Broadcaster::RemoveListener2");
+  Unlocker unlockCleanup(mMutex);
+  const auto record = mGateMap.find(gateKey);
+  if (record != mGateMap.end() && record->second.mGate == gate) mGateMap.erase(record);
+}
+
+bool Broadcaster::HasListener(Listener* inListener) {
+  TARN_CONTRACT_CHECK(inListener, kHasListenerName);
+  ListenerEntry entry;
+  entry.mListener = inListener;
+  mMutex.Lock("Broadcaster::HasListener");
+  Unlocker unlock(mMutex);
+  return FindEntry(entry) >= 0;
+}
+
+bool Broadcaster::HasListeners() {
+  mMutex.Lock("Broadcaster::HasListener");
+  Unlocker unlock(mMutex);
+  return !mListeners.empty();
+}
+
+// ---------------------------------------------------------------------------
+// Delivery
+
+int Broadcaster::DeliverToListener(const BroadcastMessageRecord& inRecord) {
+  const ListenerEntry& entry = inRecord.mEntry;
+  // An entry has one field set; the strong references taken below keep a
+  // weakly held listener alive for its own delivery.
+  if (entry.mListener != nullptr) {
+    if (entry.mListener->IsListening()) entry.mListener->ProcessMessage(inRecord.mMessage);
+    return 0;
+  }
+  if (entry.mSafeListener) {
+    const ISafeListenerRef listener = ResolveSafeListener(entry.mSafeListener);
+    if (listener != nullptr) listener->ListenToMessage(inRecord.mMessage);
+    return 0;
+  }
+  if (const boost::shared_ptr<Listener> listener = entry.mBoostWeakListener.lock()) {
+    listener->ProcessMessage(inRecord.mMessage);
+    return 0;
+  }
+  if (const std::shared_ptr<Listener> listener = entry.mStdWeakListener.lock()) {
+    listener->ProcessMessage(inRecord.mMessage);
+  }
+  return 0;
+}
+
+void Broadcaster::BroadcastMessage(const Message& inMessage) {
+  if (!IsBroadcasting() || !kivcore::threads::CurrentThreadIsMainThread()) return;
+
+  kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
+  ListenerEntry current;
+  bool served = false;  // whether `current` holds the entry of a delivery just made
+  bool cursorPushed = false;
+
+  for (;;) {
+    mMutex.Lock("Broadcaster::BroadcastMessage1");
+    Unlocker unlock(mMutex);
+    try {
+      // A remover on another thread may be waiting for the delivery just
+      // made; this broadcast's share of its count ends here.
+      if (served && !mGateMap.empty()) {
+        const auto waiting = mGateMap.find(current);
+        if (waiting != mGateMap.end() && --waiting->second.mCount == 0) waiting->second.mGate->Open();
+      }
+      if (!cursorPushed) {
+        mBroadcastCursors.push_back(-1);
+        cursorPushed = true;
+      }
+      // The cursor is re-read through back() on every step: a nested broadcast
+      // pushes behind it (and may move the vector), and removals shift it.
+      ++mBroadcastCursors.back();
+      while (mBroadcastCursors.back() < static_cast<std::int32_t>(mListeners.size())) {
+        const ListenerEntry& atCursor = mListeners[static_cast<std::size_t>(mBroadcastCursors.back())];
+        if (atCursor.mListener != nullptr) break;  // plain pointers are always live
+        // Test a copy: dropping the test's temporary reference may destroy the
+        // listener, whose destructor may change this registry (and move the
+        // cursor with the entry it stands on).
+        const ListenerEntry candidate = atCursor;
+        if (candidate.IsLive()) break;
+        // Prune as the cursor passes: the removal steps this cursor back one.
+        RemoveEntry(candidate);
+        ++mBroadcastCursors.back();
+      }
+      if (mBroadcastCursors.back() >= static_cast<std::int32_t>(mListeners.size())) {
+        mBroadcastCursors.pop_back();
+        cursorPushed = false;
+        break;
+      }
+      current = mListeners[static_cast<std::size_t>(mBroadcastCursors.back())];
+      served = true;
+    } catch (...) {
+      if (cursorPushed) mBroadcastCursors.pop_back();
+      throw;
+    }
+    unlock.Release();
+
+    // No lock is held while the listener runs.
+    const BroadcastMessageRecord record{current, inMessage};
+    errors->GuardedCall(boost::function<int()>(boost::bind(&Broadcaster::DeliverToListener, boost::cref(record))));
+  }
+  current = ListenerEntry();
+
+  // Closing sweep: once no broadcast of this broadcaster runs any more, a
+  // remover whose count no pass decremented (its entry was removed on the
+  // main thread from under a cursor, which then stood on the entry before)
+  // is released here.
+  mMutex.Lock("Broadcaster::BroadcastMessage2");
+  Unlocker unlock(mMutex);
+  if (mBroadcastCursors.empty() && !mGateMap.empty()) {
+    for (auto& element : mGateMap) {
+      if (element.second.mCount != 0) element.second.mGate->Open();
+    }
+  }
+}
+
+}  // namespace Tarn

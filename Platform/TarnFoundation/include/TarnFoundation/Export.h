@@ -1,0 +1,4 @@
+// Export macro of the TarnFoundation shared library (hidden by default).
+#pragma once
+
+#define TARNFOUNDATION_API __attribute__((visibility("default")))

@@ -1,0 +1,60 @@
+// kivcore::config initializer registry: libraries enrol an init and a
+// terminate function at load time with a static InitializerRegistrar; the
+// host later runs them all. Nothing runs at load.
+//
+//   static kivcore::config::InitializerRegistrar sRegistrar(
+//       "My::Library", kivcore::config::EInitializerContextFlags(10),
+//       [](const kivcore::proplist::PropList&) { return Init(); },
+//       [] { Term(); }, {});
+//   // host, at start-up and shutdown:
+//   kivcore::config::InitializerRegistry::InitializeAll(props);
+//   kivcore::config::InitializerRegistry::TerminateAll();
+//
+// Threading: registration, InitializeAll and TerminateAll are serialised by
+// one lock; the init and terminate functions run with it released.
+#pragma once
+
+#include <kivcore/Export.h>
+#include <kivcore/PropList.h>
+
+#include <array>
+#include <functional>
+#include <string>
+
+namespace kivcore::config {
+
+// Context bits an initializer declares; their meaning is the host's.
+enum class EInitializerContextFlags : unsigned int {};
+
+using InitializerFunction = std::function<bool(const proplist::PropList&)>;
+using TerminatorFunction = std::function<void()>;
+using InitializerDependencies = std::array<const char*, 16>;
+
+class KIVCORE_API InitializerRegistrar {
+public:
+  // Enrols the pair under inName; inDependencies lists names (null entries
+  // are unused) of initializers that must run first.
+  InitializerRegistrar(const char* inName, EInitializerContextFlags inFlags, InitializerFunction inInit,
+                       TerminatorFunction inTerminate, const InitializerDependencies& inDependencies);
+  // Withdraws the registration (a library being unloaded).
+  ~InitializerRegistrar();
+  InitializerRegistrar(const InitializerRegistrar&) = delete;
+  InitializerRegistrar& operator=(const InitializerRegistrar&) = delete;
+
+private:
+  unsigned long mId;
+};
+
+class KIVCORE_API InitializerRegistry {
+public:
+  // Runs every registered init not yet run, in registration order (an
+  // initializer whose named dependency is registered later waits for it).
+  // Stops at the first that returns false or throws, and returns false then.
+  static bool InitializeAll(const proplist::PropList& inProperties);
+  // Runs the terminate function of every initialized entry, in reverse order.
+  static void TerminateAll();
+  // Whether an initializer of this name is registered, and its flags.
+  static bool IsRegistered(const std::string& inName, unsigned int* outFlags = nullptr);
+};
+
+}  // namespace kivcore::config

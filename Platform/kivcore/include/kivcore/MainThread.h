@@ -1,0 +1,72 @@
+// kivcore::threads main-thread services: which thread is the application's
+// main (UI) thread, and the queue of calls it runs for other threads.
+//
+//   auto adaptor = RegisterCurrentThreadAsMainThread();   // on the UI thread
+//   // any thread:
+//   AsyncCallFromMainThread([] { UpdateUI(); }, 0);
+//   // UI thread, in its event loop:
+//   if (adaptor->WaitForPendingCalls(50)) adaptor->RunPendingCalls();
+//
+// Threading: a thread is the main thread while anybody holds the adaptor that
+// registered it; once the last holder lets go, no thread is. Calls may be
+// queued from any thread at any time; a call queued while no main thread is
+// registered waits for the next one. RunPendingCalls runs, on the calling
+// thread and in queue order, the calls queued before it started; calls queued
+// while it runs wait for the next run. The wakeup handler runs on the queuing
+// thread, outside every lock of the queue.
+#pragma once
+
+#include <kivcore/Export.h>
+
+#include <boost/function.hpp>
+#include <boost/shared_ptr.hpp>
+
+#include <cstddef>
+#include <functional>
+
+namespace kivcore::threads {
+
+class KIVCORE_API AsyncEventLoopAdaptor {
+public:
+  AsyncEventLoopAdaptor(const AsyncEventLoopAdaptor&) = delete;
+  AsyncEventLoopAdaptor& operator=(const AsyncEventLoopAdaptor&) = delete;
+  ~AsyncEventLoopAdaptor();
+
+  // Runs every call queued before this call started, in queue order, on the
+  // calling thread. When a call throws, the calls after it stay queued (at
+  // the front, in order) and the exception propagates.
+  void RunPendingCalls();
+
+  // Returns true at once when calls are queued; otherwise blocks until one
+  // is queued (true) or inTimeoutMilliseconds have passed (false); -1 waits
+  // without limit.
+  bool WaitForPendingCalls(int inTimeoutMilliseconds);
+
+  // Called on the queuing thread whenever a call is queued, so that a host
+  // event loop can schedule RunPendingCalls. An empty handler removes it.
+  void SetWakeupHandler(std::function<void()> inHandler);
+
+  // Number of calls queued and not yet taken by RunPendingCalls.
+  std::size_t PendingCallCount() const;
+
+private:
+  friend KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> RegisterCurrentThreadAsMainThread();
+  AsyncEventLoopAdaptor() = default;
+};
+
+// Makes the calling thread the main thread and returns the adaptor that keeps
+// it so. A main thread registered earlier and still held is replaced by the
+// caller; all holders share one adaptor.
+KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> RegisterCurrentThreadAsMainThread();
+
+// The registered main thread's adaptor, or empty when none is registered.
+KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> GetRegisteredMainThread();
+
+// True only on the registered main thread. One atomic load and a comparison.
+KIVCORE_API bool CurrentThreadIsMainThread() noexcept;
+
+// Queues a copy of inCall to run once on the main thread. inFlags is
+// reserved (pass 0). Returns true when the call was queued.
+KIVCORE_API bool AsyncCallFromMainThread(const boost::function<void()>& inCall, unsigned int inFlags);
+
+}  // namespace kivcore::threads

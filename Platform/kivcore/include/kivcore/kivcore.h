@@ -1,0 +1,15 @@
+// The whole kivcore API: strings, small-block allocation, locks and gates,
+// main-thread services, the initializer registry, error reporting and the
+// debug hooks.
+#pragma once
+
+#include <kivcore/Debug.h>
+#include <kivcore/Error.h>
+#include <kivcore/Gate.h>
+#include <kivcore/Guid.h>
+#include <kivcore/ImmutableString.h>
+#include <kivcore/InitializerRegistry.h>
+#include <kivcore/MainThread.h>
+#include <kivcore/PropList.h>
+#include <kivcore/RecursiveMutex.h>
+#include <kivcore/SmallBlockAllocator.h>

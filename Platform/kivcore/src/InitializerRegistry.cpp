@@ -1,0 +1,179 @@
+// The initializer registry: registrars enrol entries at load time, the host
+// runs them with InitializeAll and TerminateAll.
+//
+// Two locks. gRunMutex serialises InitializeAll and TerminateAll against
+// each other and is held while init and terminate functions run; it is
+// recursive so that such a function may itself call InitializeAll. The
+// registry's data mutex guards the entry list and is never held while a
+// function runs, so a function may construct or destroy registrars (a
+// library loaded or unloaded during start-up).
+#include <kivcore/InitializerRegistry.h>
+
+#include <algorithm>
+#include <exception>
+#include <mutex>
+#include <vector>
+
+namespace kivcore::config {
+
+namespace {
+
+enum class EntryState { kRegistered, kRunning, kInitialized };
+
+struct Entry {
+  unsigned long id;
+  std::string name;
+  unsigned int flags;
+  InitializerFunction init;
+  TerminatorFunction terminate;
+  std::vector<std::string> dependencies;
+  EntryState state = EntryState::kRegistered;
+  unsigned long initOrder = 0;  // when it was initialized, for reverse termination
+};
+
+struct Registry {
+  std::mutex mutex;
+  std::vector<Entry> entries;  // registration order; guarded by mutex
+  unsigned long nextId = 1;    // guarded by mutex
+  unsigned long nextInitOrder = 1;  // guarded by mutex
+  std::recursive_mutex runMutex;
+};
+
+// Never destroyed: registrars of other modules are destroyed at their unload,
+// which may come after this library's static destruction has begun.
+Registry& TheRegistry() {
+  static Registry* registry = new Registry;
+  return *registry;
+}
+
+// Whether every dependency of inEntry that is registered has been
+// initialized. A dependency that is not registered at all does not hold the
+// entry back. Caller holds the registry mutex.
+bool DependenciesReady(const Registry& inRegistry, const Entry& inEntry) {
+  for (const std::string& dependency : inEntry.dependencies) {
+    for (const Entry& other : inRegistry.entries) {
+      if (other.name == dependency && other.state != EntryState::kInitialized) return false;
+    }
+  }
+  return true;
+}
+
+Entry* FindById(Registry& ioRegistry, unsigned long inId) {
+  for (Entry& entry : ioRegistry.entries)
+    if (entry.id == inId) return &entry;
+  return nullptr;
+}
+
+}  // namespace
+
+InitializerRegistrar::InitializerRegistrar(const char* inName, EInitializerContextFlags inFlags,
+                                           InitializerFunction inInit, TerminatorFunction inTerminate,
+                                           const InitializerDependencies& inDependencies) {
+  Entry entry;
+  entry.name = inName != nullptr ? inName : "";
+  entry.flags = static_cast<unsigned int>(inFlags);
+  entry.init = std::move(inInit);
+  entry.terminate = std::move(inTerminate);
+  for (const char* dependency : inDependencies)
+    if (dependency != nullptr) entry.dependencies.emplace_back(dependency);
+
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  entry.id = mId = registry.nextId++;
+  registry.entries.push_back(std::move(entry));
+}
+
+InitializerRegistrar::~InitializerRegistrar() {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  auto found = std::find_if(registry.entries.begin(), registry.entries.end(),
+                            [this](const Entry& inEntry) { return inEntry.id == mId; });
+  if (found != registry.entries.end()) registry.entries.erase(found);
+}
+
+bool InitializerRegistry::InitializeAll(const proplist::PropList& inProperties) {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::recursive_mutex> run(registry.runMutex);
+  for (;;) {
+    unsigned long id = 0;
+    InitializerFunction init;
+    bool pending = false;
+    {
+      std::lock_guard<std::mutex> lock(registry.mutex);
+      for (Entry& entry : registry.entries) {
+        if (entry.state != EntryState::kRegistered) continue;
+        pending = true;
+        if (!DependenciesReady(registry, entry)) continue;
+        id = entry.id;
+        init = entry.init;  // a copy: the entry may move or go while init runs
+        entry.state = EntryState::kRunning;
+        break;
+      }
+    }
+    // Nothing left, or only entries whose dependencies can never be met (a
+    // cycle): the latter count as a failure.
+    if (id == 0) return !pending;
+
+    bool succeeded = false;
+    try {
+      succeeded = !init || init(inProperties);
+    } catch (...) {
+      succeeded = false;
+    }
+
+    std::lock_guard<std::mutex> lock(registry.mutex);
+    Entry* entry = FindById(registry, id);
+    if (entry == nullptr) {
+      if (!succeeded) return false;
+      continue;  // withdrawn while it ran
+    }
+    if (!succeeded) {
+      entry->state = EntryState::kRegistered;
+      return false;
+    }
+    entry->state = EntryState::kInitialized;
+    entry->initOrder = registry.nextInitOrder++;
+  }
+}
+
+void InitializerRegistry::TerminateAll() {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::recursive_mutex> run(registry.runMutex);
+  std::exception_ptr firstFailure;
+  for (;;) {
+    TerminatorFunction terminate;
+    {
+      std::lock_guard<std::mutex> lock(registry.mutex);
+      Entry* latest = nullptr;
+      for (Entry& entry : registry.entries) {
+        if (entry.state == EntryState::kInitialized && (latest == nullptr || entry.initOrder > latest->initOrder))
+          latest = &entry;
+      }
+      if (latest == nullptr) break;
+      latest->state = EntryState::kRegistered;
+      terminate = latest->terminate;
+    }
+    // Every initialized entry is terminated even when one fails; the first
+    // failure is reported once all have run.
+    try {
+      if (terminate) terminate();
+    } catch (...) {
+      if (!firstFailure) firstFailure = std::current_exception();
+    }
+  }
+  if (firstFailure) std::rethrow_exception(firstFailure);
+}
+
+bool InitializerRegistry::IsRegistered(const std::string& inName, unsigned int* outFlags) {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  for (const Entry& entry : registry.entries) {
+    if (entry.name == inName) {
+      if (outFlags != nullptr) *outFlags = entry.flags;
+      return true;
+    }
+  }
+  return false;
+}
+
+}  // namespace kivcore::config
