@@ -101,10 +101,9 @@ Broadcaster::~Broadcaster() {
 // Registry
 
 std::int32_t Broadcaster::FindEntry(const ListenerEntry& inEntry) const noexcept {
-  std::int32_t position = 0;
-  for (const ListenerEntry& entry : mListeners) {
-    if (entry == inEntry) return position;
-    ++position;
+  const std::int32_t count = EntryCount();
+  for (std::int32_t position = 0; position < count; ++position) {
+    if (EntryAt(position) == inEntry) return position;
   }
   return -1;
 }
@@ -120,7 +119,7 @@ bool Broadcaster::AddEntry(const ListenerEntry& inEntry) {
   // Positions are 32-bit; a registry that could not be indexed counts as
   // exhausted storage.
   if (mListeners.size() >= static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) throw std::bad_alloc();
-  mListeners.push_front(inEntry);
+  mListeners.push_back(inEntry);  // the new front
   // The new entry lies in front of every running broadcast's cursor: each
   // cursor moves with the entry it stands on, and none of those broadcasts
   // will serve the newcomer.
@@ -233,7 +232,7 @@ void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
     // The gate is made (and may fail) before anything changes, so that an
     // exhausted allocator leaves the registry as it was. The main thread never
     // waits: its deliveries in progress are on its own stack.
-    auto existing = mGateMap.find(mListeners[static_cast<std::size_t>(position)]);
+    auto existing = mGateMap.find(EntryAt(position));
     if (existing != mGateMap.end()) {
       // An earlier removal of an equal entry still waits (the listener was
       // added again meanwhile): share its gate and add our deliveries to its
@@ -242,7 +241,7 @@ void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
       existing->second.mCount += deliveries;
     } else {
       gate = boost::allocate_shared<Gate>(kivcore::utility::SmallBlockAllocator::STLAllocator<Gate>(), false);
-      gateKey = mListeners[static_cast<std::size_t>(position)];
+      gateKey = EntryAt(position);
       mGateMap.emplace(gateKey, GateRecord{gate, deliveries});
       ownsGateRecord = true;
     }
@@ -254,7 +253,7 @@ void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
   for (std::int32_t& cursor : mBroadcastCursors) {
     if (cursor >= position) --cursor;
   }
-  mListeners.erase(mListeners.begin() + position);
+  mListeners.erase(mListeners.end() - 1 - position);
   unlock.Release();
 
   if (!gate) return;
@@ -311,9 +310,13 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
   if (!IsBroadcasting() || !kivcore::threads::CurrentThreadIsMainThread()) return;
 
   kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
-  ListenerEntry current;
-  bool served = false;  // whether `current` holds the entry of a delivery just made
+  ListenerEntry current;  // the entry being served, then the one served last
+  bool served = false;    // whether `current` holds the entry of a delivery just made
   bool cursorPushed = false;
+  // Built once: the record refers to `current`, which each pass refills. The
+  // bound call fits inside the boost::function, so nothing is allocated.
+  const BroadcastMessageRecord record{current, inMessage};
+  const boost::function<int()> delivery(boost::bind(&Broadcaster::DeliverToListener, boost::cref(record)));
 
   for (;;) {
     mMutex.Lock("Broadcaster::BroadcastMessage1");
@@ -331,25 +334,32 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
       }
       // The cursor is re-read through back() on every step: a nested broadcast
       // pushes behind it (and may move the vector), and removals shift it.
-      ++mBroadcastCursors.back();
-      while (mBroadcastCursors.back() < static_cast<std::int32_t>(mListeners.size())) {
-        const ListenerEntry& atCursor = mListeners[static_cast<std::size_t>(mBroadcastCursors.back())];
+      std::int32_t cursor = ++mBroadcastCursors.back();
+      while (cursor < EntryCount()) {
+        const ListenerEntry& atCursor = EntryAt(cursor);
         if (atCursor.mListener != nullptr) break;  // plain pointers are always live
         // Test a copy: dropping the test's temporary reference may destroy the
         // listener, whose destructor may change this registry (and move the
         // cursor with the entry it stands on).
         const ListenerEntry candidate = atCursor;
-        if (candidate.IsLive()) break;
+        if (candidate.IsLive()) {
+          cursor = mBroadcastCursors.back();
+          if (cursor < EntryCount() && EntryAt(cursor) == candidate) break;
+          // The candidate itself was removed meanwhile, which stepped the
+          // cursor back onto the entry before it: move on past it.
+          cursor = ++mBroadcastCursors.back();
+          continue;
+        }
         // Prune as the cursor passes: the removal steps this cursor back one.
         RemoveEntry(candidate);
-        ++mBroadcastCursors.back();
+        cursor = ++mBroadcastCursors.back();
       }
-      if (mBroadcastCursors.back() >= static_cast<std::int32_t>(mListeners.size())) {
+      if (cursor >= EntryCount()) {
         mBroadcastCursors.pop_back();
         cursorPushed = false;
         break;
       }
-      current = mListeners[static_cast<std::size_t>(mBroadcastCursors.back())];
+      current = EntryAt(cursor);
       served = true;
     } catch (...) {
       if (cursorPushed) mBroadcastCursors.pop_back();
@@ -358,8 +368,7 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
     unlock.Release();
 
     // No lock is held while the listener runs.
-    const BroadcastMessageRecord record{current, inMessage};
-    errors->GuardedCall(boost::function<int()>(boost::bind(&Broadcaster::DeliverToListener, boost::cref(record))));
+    errors->GuardedCall(delivery);
   }
   current = ListenerEntry();
 

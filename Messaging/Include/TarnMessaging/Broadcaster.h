@@ -47,7 +47,6 @@
 
 #include <atomic>
 #include <cstdint>
-#include <deque>
 #include <map>
 #include <memory>
 #include <utility>
@@ -129,7 +128,9 @@ private:
     boost::shared_ptr<kivcore::threads::Gate> mGate;
     std::int32_t mCount;  // deliveries to the removed entry still running
   };
-  using EntryQueue = std::deque<ListenerEntry, Alloc<ListenerEntry>>;
+  // Stored oldest first, so that adding the newest entry is an append and
+  // reading position p (0 = newest) is one subtraction: index size-1-p.
+  using EntryQueue = std::vector<ListenerEntry, Alloc<ListenerEntry>>;
   using GateMap = std::map<ListenerEntry, GateRecord, std::less<ListenerEntry>,
                            Alloc<std::pair<const ListenerEntry, GateRecord>>>;
   using CursorVector = std::vector<std::int32_t, Alloc<std::int32_t>>;
@@ -142,11 +143,17 @@ private:
   bool AddEntry(const ListenerEntry& inEntry);
   // The one removal path (also used to prune dead entries).
   void RemoveEntry(const ListenerEntry& inEntry);
-  // Linear search from the front; -1 when absent. mMutex must be held.
+  // Linear search from the front (newest); the position, or -1 when absent.
+  // mMutex must be held.
   std::int32_t FindEntry(const ListenerEntry& inEntry) const noexcept;
+  // The entry at a position counted from the front. mMutex must be held.
+  const ListenerEntry& EntryAt(std::int32_t inPosition) const noexcept {
+    return mListeners[mListeners.size() - 1 - static_cast<std::size_t>(inPosition)];
+  }
+  std::int32_t EntryCount() const noexcept { return static_cast<std::int32_t>(mListeners.size()); }
 
   kivcore::threads::RecursiveMutex mMutex;
-  EntryQueue mListeners;           // guarded by mMutex; front = newest
+  EntryQueue mListeners;           // guarded by mMutex; position 0 (the front) = newest
   GateMap mGateMap;                // guarded by mMutex; removals waiting on a delivery
   CursorVector mBroadcastCursors;  // guarded by mMutex; one per running broadcast, outermost first
   std::atomic<bool> mBroadcasting{true};  // unguarded; read by the main thread
