@@ -146,11 +146,11 @@ TEST(ImmutableStringValue, MovingTransfersTheReferenceWithoutCopying) {
   {
     ImmutableString source = ImmutableString::CreateDynamic("value.moved");
     ImmutableString target(std::move(source));
-    EXPECT_TRUE(source.empty());  // NOLINT(bugprone-use-after-move): moved-from state is specified
+    EXPECT_TRUE(source.empty());  // a moved-from string is empty
     EXPECT_STREQ("value.moved", target.c_str());
     ImmutableString assigned;
     assigned = std::move(target);
-    EXPECT_TRUE(target.empty());  // NOLINT(bugprone-use-after-move)
+    EXPECT_TRUE(target.empty());
     EXPECT_EQ(before + 1, ImmutableString::InternedCount());
   }
   EXPECT_EQ(before, ImmutableString::InternedCount());

@@ -67,7 +67,9 @@ struct Chunk {
 };
 constexpr std::size_t kChunkHeader = (sizeof(Chunk) + kGranule - 1) / kGranule * kGranule;
 
-struct Pool {
+// One cache line each, so that threads working in different size classes do
+// not contend for the same line.
+struct alignas(64) Pool {
   std::mutex mutex;
   Block* freeList = nullptr;  // guarded by mutex
   char* carveNext = nullptr;  // unused tail of the newest chunk; guarded by mutex
