@@ -206,54 +206,58 @@ void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
   Unlocker unlock(mMutex);
 
   const std::int32_t position = FindEntry(inListener);
-  if (position < 0) {
-    // A first remover on another thread may have taken the entry out and
-    // still be waiting for the delivery in progress. Returning now would let
-    // this caller destroy the listener while its handler runs, so a worker
-    // waits on the same gate instead.
-    if (!mGateMap.empty() && !kivcore::threads::CurrentThreadIsMainThread()) {
-      const auto waiting = mGateMap.find(inListener);
-      if (waiting != mGateMap.end()) gate = waiting->second.mGate;
+  if (position >= 0) {
+    TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
+  }
+
+  // A removal on another thread must not return while a delivery to this
+  // listener runs on the main thread: the caller may destroy the listener
+  // next. Deliveries are found by what each running broadcast is serving, not
+  // only by where its cursor stands, so that this also holds when the entry
+  // is already gone (a handler removed itself, or an earlier remover took it
+  // out and still waits). The main thread never waits: its deliveries in
+  // progress are on its own stack.
+  if (!kivcore::threads::CurrentThreadIsMainThread()) {
+    std::int32_t uncounted = 0;
+    for (const DeliverySlot& slot : mDeliveries) {
+      if (slot.mEntry != nullptr && !slot.mCounted && *slot.mEntry == inListener) ++uncounted;
     }
-    unlock.Release();
-    if (gate) gate->PassThrough(-1);
-    return;
-  }
-
-  TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
-
-  // Broadcasts whose cursor stands on the entry are delivering to it now.
-  std::int32_t deliveries = 0;
-  for (const std::int32_t cursor : mBroadcastCursors) {
-    if (cursor == position) ++deliveries;
-  }
-
-  if (deliveries > 0 && !kivcore::threads::CurrentThreadIsMainThread()) {
-    // The gate is made (and may fail) before anything changes, so that an
-    // exhausted allocator leaves the registry as it was. The main thread never
-    // waits: its deliveries in progress are on its own stack.
-    auto existing = mGateMap.find(EntryAt(position));
-    if (existing != mGateMap.end()) {
-      // An earlier removal of an equal entry still waits (the listener was
-      // added again meanwhile): share its gate and add our deliveries to its
-      // count, so that neither remover returns early or waits for ever.
+    auto existing = mGateMap.find(inListener);
+    if (existing != mGateMap.end() && !existing->second.mGate->IsOpen()) {
+      // An earlier removal still waits: share its gate, and let it also wait
+      // for the deliveries it did not count.
       gate = existing->second.mGate;
-      existing->second.mCount += deliveries;
-    } else {
+      existing->second.mCount += uncounted;
+    } else if (uncounted > 0) {
+      // Made (and possibly failing) before anything changes, so that an
+      // exhausted allocator leaves the registry as it was.
       gate = boost::allocate_shared<Gate>(kivcore::utility::SmallBlockAllocator::STLAllocator<Gate>(), false);
-      gateKey = EntryAt(position);
-      mGateMap.emplace(gateKey, GateRecord{gate, deliveries});
+      gateKey = position >= 0 ? EntryAt(position) : inListener;
+      if (existing != mGateMap.end()) {
+        // The earlier remover's gate is open and it is about to leave; it
+        // erases the record only while the record still holds its gate.
+        existing->second = GateRecord{gate, uncounted};
+      } else {
+        mGateMap.emplace(gateKey, GateRecord{gate, uncounted});
+      }
       ownsGateRecord = true;
     }
+    if (gate) {
+      for (DeliverySlot& slot : mDeliveries) {
+        if (slot.mEntry != nullptr && *slot.mEntry == inListener) slot.mCounted = true;
+      }
+    }
   }
 
-  // A cursor on the removed entry steps back to the entry before it, so its
-  // broadcast goes on with the entry that followed the removed one; cursors
-  // beyond it step back with the entries they stand on.
-  for (std::int32_t& cursor : mBroadcastCursors) {
-    if (cursor >= position) --cursor;
+  if (position >= 0) {
+    // A cursor on the removed entry steps back to the entry before it, so its
+    // broadcast goes on with the entry that followed the removed one; cursors
+    // beyond it step back with the entries they stand on.
+    for (std::int32_t& cursor : mBroadcastCursors) {
+      if (cursor >= position) --cursor;
+    }
+    mListeners.erase(mListeners.end() - 1 - position);
   }
-  mListeners.erase(mListeners.end() - 1 - position);
   unlock.Release();
 
   if (!gate) return;
@@ -311,7 +315,7 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
 
   kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
   ListenerEntry current;  // the entry being served, then the one served last
-  bool served = false;    // whether `current` holds the entry of a delivery just made
+  bool currentIsPlain = true;  // `current` has no weak field set
   bool cursorPushed = false;
   // Built once: the record refers to `current`, which each pass refills. The
   // bound call fits inside the boost::function, so nothing is allocated.
@@ -322,22 +326,41 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
     mMutex.Lock("Broadcaster::BroadcastMessage1");
     Unlocker unlock(mMutex);
     try {
-      // A remover on another thread may be waiting for the delivery just
-      // made; this broadcast's share of its count ends here.
-      if (served && !mGateMap.empty()) {
-        const auto waiting = mGateMap.find(current);
-        if (waiting != mGateMap.end() && --waiting->second.mCount == 0) waiting->second.mGate->Open();
-      }
       if (!cursorPushed) {
+        // Room for the delivery slot first, so that neither push can fail
+        // after the other succeeded.
+        mDeliveries.reserve(mBroadcastCursors.size() + 1);
         mBroadcastCursors.push_back(-1);
+        mDeliveries.push_back(DeliverySlot{nullptr, false});
         cursorPushed = true;
+      } else {
+        // A remover on another thread may be waiting for the delivery just
+        // made; this broadcast's share of its count ends here.
+        DeliverySlot& slot = mDeliveries.back();
+        if (slot.mCounted) {
+          const auto waiting = mGateMap.find(current);
+          if (waiting != mGateMap.end() && --waiting->second.mCount == 0) waiting->second.mGate->Open();
+        }
+        slot = DeliverySlot{nullptr, false};
       }
       // The cursor is re-read through back() on every step: a nested broadcast
       // pushes behind it (and may move the vector), and removals shift it.
       std::int32_t cursor = ++mBroadcastCursors.back();
+      bool plainCopied = false;
       while (cursor < EntryCount()) {
         const ListenerEntry& atCursor = EntryAt(cursor);
-        if (atCursor.mListener != nullptr) break;  // plain pointers are always live
+        if (atCursor.mListener != nullptr) {
+          // Plain pointers are always live. Copying one into a copy whose weak
+          // fields are empty is a pointer store: no reference-count traffic.
+          if (currentIsPlain) {
+            current.mListener = atCursor.mListener;
+          } else {
+            current = atCursor;
+            currentIsPlain = true;
+          }
+          plainCopied = true;
+          break;
+        }
         // Test a copy: dropping the test's temporary reference may destroy the
         // listener, whose destructor may change this registry (and move the
         // cursor with the entry it stands on).
@@ -356,13 +379,20 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
       }
       if (cursor >= EntryCount()) {
         mBroadcastCursors.pop_back();
+        mDeliveries.pop_back();
         cursorPushed = false;
         break;
       }
-      current = EntryAt(cursor);
-      served = true;
+      if (!plainCopied) {
+        current = EntryAt(cursor);
+        currentIsPlain = current.mListener != nullptr;
+      }
+      mDeliveries.back().mEntry = &current;
     } catch (...) {
-      if (cursorPushed) mBroadcastCursors.pop_back();
+      if (cursorPushed) {
+        mBroadcastCursors.pop_back();
+        mDeliveries.pop_back();
+      }
       throw;
     }
     unlock.Release();
@@ -372,10 +402,8 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
   }
   current = ListenerEntry();
 
-  // Closing sweep: once no broadcast of this broadcaster runs any more, a
-  // remover whose count no pass decremented (its entry was removed on the
-  // main thread from under a cursor, which then stood on the entry before)
-  // is released here.
+  // Closing sweep: once no broadcast of this broadcaster runs any more, no
+  // delivery can be in progress, so any remover still waiting is released.
   mMutex.Lock("Broadcaster::BroadcastMessage2");
   Unlocker unlock(mMutex);
   if (mBroadcastCursors.empty() && !mGateMap.empty()) {

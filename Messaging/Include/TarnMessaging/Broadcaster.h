@@ -134,6 +134,12 @@ private:
   using GateMap = std::map<ListenerEntry, GateRecord, std::less<ListenerEntry>,
                            Alloc<std::pair<const ListenerEntry, GateRecord>>>;
   using CursorVector = std::vector<std::int32_t, Alloc<std::int32_t>>;
+  // What one running broadcast is delivering right now, beside its cursor.
+  struct DeliverySlot {
+    const ListenerEntry* mEntry;  // the broadcast's copy of the entry it serves; null between deliveries
+    bool mCounted;                // a waiting remover counts this delivery in its gate record
+  };
+  using DeliveryVector = std::vector<DeliverySlot, Alloc<DeliverySlot>>;
 
   struct BroadcastMessageRecord;
   static int DeliverToListener(const BroadcastMessageRecord& inRecord);
@@ -156,6 +162,7 @@ private:
   EntryQueue mListeners;           // guarded by mMutex; position 0 (the front) = newest
   GateMap mGateMap;                // guarded by mMutex; removals waiting on a delivery
   CursorVector mBroadcastCursors;  // guarded by mMutex; one per running broadcast, outermost first
+  DeliveryVector mDeliveries;      // guarded by mMutex; parallel to mBroadcastCursors
   std::atomic<bool> mBroadcasting{true};  // unguarded; read by the main thread
 };
 

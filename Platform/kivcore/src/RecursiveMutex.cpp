@@ -1,39 +1,48 @@
-// RecursiveMutex: a plain mutex plus the holder's thread id and a depth.
-//
-// Only the holder ever stores its own id in mOwner, so a thread that reads
-// its own id there holds the mutex, and one that does not cannot be the
-// holder: a relaxed load answers "do I hold it?" without racing anyone.
+// RecursiveMutex slow paths: a three-state futex lock (free, locked, locked
+// with waiters). The fast paths are inline in the header.
 #include <kivcore/RecursiveMutex.h>
 
-#include <pthread.h>
+#include <linux/futex.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <thread>
 
 namespace kivcore::threads {
 
 namespace {
-unsigned long CurrentThreadId() noexcept { return static_cast<unsigned long>(pthread_self()); }
+
+void FutexWait(std::atomic<int>& inWord, int inExpected) noexcept {
+  ::syscall(SYS_futex, reinterpret_cast<int*>(&inWord), FUTEX_WAIT_PRIVATE, inExpected, nullptr, nullptr, 0);
+}
+
+void FutexWakeOne(std::atomic<int>& inWord) noexcept {
+  ::syscall(SYS_futex, reinterpret_cast<int*>(&inWord), FUTEX_WAKE_PRIVATE, 1, nullptr, nullptr, 0);
+}
+
 }  // namespace
 
-void RecursiveMutex::Lock(const char* inLabel) {
-  const unsigned long self = CurrentThreadId();
-  if (mOwner.load(std::memory_order_relaxed) == self) {
-    ++mDepth;
-    return;
+void RecursiveMutex::LockContended() {
+  // Locks are held for a handful of instructions (a broadcaster picking its
+  // next listener), so a short spin usually wins without a system call.
+  for (int spin = 0; spin < 100; ++spin) {
+    int expected = kFree;
+    if (mState.load(std::memory_order_relaxed) == kFree &&
+        mState.compare_exchange_weak(expected, kLocked, std::memory_order_acquire, std::memory_order_relaxed)) {
+      return;
+    }
+#if defined(__x86_64__) || defined(__i386__)
+    __builtin_ia32_pause();
+#endif
   }
-  mMutex.lock();
-  mOwner.store(self, std::memory_order_relaxed);
-  mDepth = 1;
-  mLabel.store(inLabel, std::memory_order_relaxed);
+  // Marking the state "with waiters" makes the holder's Unlock wake one of
+  // us; whoever takes the lock from here keeps the mark, since others may
+  // still sleep.
+  while (mState.exchange(kLockedWithWaiters, std::memory_order_acquire) != kFree) {
+    FutexWait(mState, kLockedWithWaiters);
+  }
 }
 
-void RecursiveMutex::Unlock() {
-  if (--mDepth != 0) return;
-  mLabel.store(nullptr, std::memory_order_relaxed);
-  mOwner.store(0, std::memory_order_relaxed);
-  mMutex.unlock();
-}
-
-bool RecursiveMutex::IsHeldByCurrentThread() const noexcept {
-  return mOwner.load(std::memory_order_relaxed) == CurrentThreadId();
-}
+void RecursiveMutex::WakeOne() noexcept { FutexWakeOne(mState); }
 
 }  // namespace kivcore::threads
