@@ -172,8 +172,7 @@ void Broadcaster::RemoveListener(Listener* inListener, bool inUpdateListener) {
   if (inListener == nullptr) return;  // never follow a null pointer
   ListenerEntry entry;
   entry.mListener = inListener;
-  RemoveEntry(entry);
-  if (inUpdateListener) inListener->RemoveBroadcaster(this);
+  RemoveEntry(entry, inUpdateListener ? inListener : nullptr);
 }
 
 void Broadcaster::RemoveListener(InterfaceRef<ISafeListener> inListener) {
@@ -197,7 +196,7 @@ void Broadcaster::RemoveListener(const std::weak_ptr<Listener>& inListener) {
   RemoveEntry(entry);
 }
 
-void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
+void Broadcaster::RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink) {
   boost::shared_ptr<Gate> gate;
   bool ownsGateRecord = false;
   ListenerEntry gateKey;
@@ -259,6 +258,9 @@ void Broadcaster::RemoveEntry(const ListenerEntry& inListener) {
     mListeners.erase(mListeners.end() - 1 - position);
   }
   unlock.Release();
+  // Whether or not an entry was removed; after the wait the listener may
+  // already be gone (its owner may destroy it as soon as no delivery runs).
+  if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(this);
 
   if (!gate) return;
   gate->PassThrough(-1);

@@ -60,7 +60,9 @@ void Terminate() {
   // Posts still queued find no station now and deliver nothing; running them
   // frees their copies.
   if (sMainThreadAdaptor) sMainThreadAdaptor->RunPendingCalls();
-  sMainThreadAdaptor.reset();
+  // A pending call may have initialized the library again; it keeps the
+  // main thread it registered then.
+  if (sInitializeCount == 0) sMainThreadAdaptor.reset();
 }
 
 }  // namespace Messaging

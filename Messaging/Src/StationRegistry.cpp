@@ -160,10 +160,21 @@ Station* RetainStation(const ImmutableString& inStationID) {
   StationMapAccess map;
   const auto found = map->find(inStationID);
   if (found == map->end()) return nullptr;
-  // Counted before the station is made: a factory that fails leaves the
-  // retain standing, as callers that release only what they got expect.
-  ++found->second.mRetainCount;
-  return MakeStation(found->second);
+  // Counted before the station is made, and taken back when no station
+  // comes of it (the factory returned null or threw): callers release only
+  // the retains that gave them a station, so a count left standing would keep
+  // a later disposal from ever deleting the station.
+  StationRecord& record = found->second;
+  ++record.mRetainCount;
+  Station* station = nullptr;
+  try {
+    station = MakeStation(record);
+  } catch (...) {
+    --record.mRetainCount;
+    throw;
+  }
+  if (station == nullptr) --record.mRetainCount;
+  return station;
 }
 
 void ReleaseStation(const ImmutableString& inStationID) {

@@ -1,23 +1,29 @@
-// Tarn::IdleCountdownTimer: a one-shot notification, at an idle moment, that
-// a set time has passed since the timer was armed.
-//
-//   Tarn::IdleCountdownTimer autosave;
-//   autosave.SetDuration(5000);
-//   autosave.SetCookie(42);
-//   Tarn::StationUtils::AddListener(autosave.GetStationID(), &saver);
-//   autosave.ArmTimer();   // saver hears IdleCountdownTimerMessage(42) at the
-//                          // first ApplicationIdleMessage on kStation_Idle
-//                          // at least 5 s from now
-//
-// The host broadcasts ApplicationIdleMessage on kStation_Idle whenever it is
-// idle; an armed timer listens there, and at the first idle message at or
-// after its deadline it detaches and broadcasts one IdleCountdownTimerMessage
-// on its own station. Arm it again for every further firing (a handler of the
-// timer's message may do so). Time is read from Tarn::TimeStamp as
-// milliseconds, in wrapping unsigned 32-bit arithmetic.
-//
-// Threading: main thread only, like the idle broadcasts that drive it. Do not
-// destroy the timer from a handler of its own message.
+/// @file
+/// Tarn::IdleCountdownTimer: a one-shot notification, at an idle moment, that
+/// a set time has passed since the timer was armed.
+///
+/// @code{.cpp}
+///   Tarn::IdleCountdownTimer autosave;
+///   autosave.SetDuration(5000);
+///   autosave.SetCookie(42);
+///   Tarn::StationUtils::AddListener(autosave.GetStationID(), &saver);
+///   autosave.ArmTimer();   // saver hears IdleCountdownTimerMessage(42) at the
+///                          // first ApplicationIdleMessage on kStation_Idle
+///                          // at least 5 s from now
+/// @endcode
+///
+/// The host broadcasts ApplicationIdleMessage on kStation_Idle whenever it is
+/// idle; an armed timer listens there, and at the first idle message at or
+/// after its deadline it detaches and broadcasts one IdleCountdownTimerMessage
+/// on its own station. Arm it again for every further firing (a handler of the
+/// timer's message may do so). Time is read from Tarn::TimeStamp as
+/// milliseconds in wrapping 32-bit arithmetic, compared as serial numbers, so
+/// the wrap every 49.7 days neither fires a timer early nor stalls it; a
+/// duration must be below 2^31 ms (24.8 days). Arming before library
+/// initialization attaches nothing; arm again once the library is up.
+///
+/// Threading: main thread only, like the idle broadcasts that drive it. Do not
+/// destroy the timer from a handler of its own message.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -30,38 +36,44 @@
 
 namespace Tarn {
 
-// Broadcast by the host on kStation_Idle when the application is idle.
+/// Broadcast by the host on kStation_Idle when the application is idle.
 class TARN_MESSAGING_API ApplicationIdleMessage : public MessageImpl<ApplicationIdleMessage> {
 public:
   ApplicationIdleMessage() noexcept = default;
 };
 
-// Broadcast by a timer on its own station when it fires.
+/// Broadcast by a timer on its own station when it fires.
 class TARN_MESSAGING_API IdleCountdownTimerMessage : public MessageImpl<IdleCountdownTimerMessage> {
 public:
+  /// A message carrying the timer's cookie inCookie.
   explicit IdleCountdownTimerMessage(std::uint32_t inCookie) noexcept : mCookie(inCookie) {}
+  /// The cookie the timer was given with SetCookie.
   std::uint32_t GetCookie() const noexcept { return mCookie; }
 
 private:
   std::uint32_t mCookie;
 };
 
+/// A one-shot notification, at an idle moment, that a set time has passed
+/// since the timer was armed: broadcasts one IdleCountdownTimerMessage on its
+/// own station at the first idle broadcast at or after its deadline. Main
+/// thread only; do not destroy it from a handler of its own message.
 class TARN_MESSAGING_API IdleCountdownTimer : public Listener {
 public:
-  // Registers the timer's own unique station; the timer is not armed.
+  /// Registers the timer's own unique station; the timer is not armed.
   IdleCountdownTimer();
-  // Detaches from kStation_Idle if armed and disposes of the timer's station.
+  /// Detaches from kStation_Idle if armed and disposes of the timer's station.
   ~IdleCountdownTimer() override;
   IdleCountdownTimer(const IdleCountdownTimer&) = delete;
   IdleCountdownTimer& operator=(const IdleCountdownTimer&) = delete;
 
-  // Starts or restarts the countdown from now.
+  /// Starts or restarts the countdown from now.
   void ArmTimer();
-  // The countdown length (ms) for the next ArmTimer; a running one is kept.
+  /// The countdown length (ms) for the next ArmTimer; a running one is kept.
   void SetDuration(unsigned int inDuration) noexcept { mDuration = inDuration; }
-  // The value carried by the messages of the following firings.
+  /// The value carried by the messages of the following firings.
   void SetCookie(unsigned int inCookie) noexcept { mCookie = inCookie; }
-  // The station the timer's messages are broadcast on.
+  /// The station the timer's messages are broadcast on.
   kivcore::utility::ImmutableString GetStationID() const { return mStationID; }
 
   void ListenToMessage(const Message& inMessage) override;

@@ -1,22 +1,25 @@
-// Tarn::Message: the base of every message, and message type identity.
-//
-// A message carries one thing of its own, the 32-bit ID of its type. The ID
-// is the hash of the type's decorated name (on GCC and Clang the mangled name
-// that typeid(T).name() gives, which includes the enclosing namespaces), so
-// every module that sees a message class computes the same ID without any
-// registration. Listeners recognise a message by comparing IDs:
-//
-//   void MyListener::ListenToMessage(const Tarn::Message& inMessage) {
-//     if (inMessage.GetMessageID() == Progress::StaticMessageID())
-//       OnProgress(static_cast<const Progress&>(inMessage));
-//   }
-//
-// Concrete messages derive from Tarn::MessageImpl<T> (MessageImpl.h), never
-// from Message directly.
-//
-// Threading: HashMessageTypeNameToMessageID is pure and may be called from
-// any thread. A message object is not synchronised: the listeners of one
-// broadcast read it on the broadcasting thread.
+/// @file
+/// Tarn::Message: the base of every message, and message type identity.
+///
+/// A message carries one thing of its own, the 32-bit ID of its type. The ID
+/// is the hash of the type's decorated name (on GCC and Clang the mangled name
+/// that typeid(T).name() gives, which includes the enclosing namespaces), so
+/// every module that sees a message class computes the same ID without any
+/// registration. Listeners recognise a message by comparing IDs:
+///
+/// @code{.cpp}
+///   void MyListener::ListenToMessage(const Tarn::Message& inMessage) {
+///     if (inMessage.GetMessageID() == Progress::StaticMessageID())
+///       OnProgress(static_cast<const Progress&>(inMessage));
+///   }
+/// @endcode
+///
+/// Concrete messages derive from Tarn::MessageImpl<T> (MessageImpl.h), never
+/// from Message directly.
+///
+/// Threading: HashMessageTypeNameToMessageID is pure and may be called from
+/// any thread. A message object is not synchronised: the listeners of one
+/// broadcast read it on the broadcasting thread.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -29,31 +32,41 @@
 
 namespace Tarn {
 
+/// The 32-bit ID of a message type: the hash of the type's decorated name.
 using MessageID = std::uint32_t;
 
-// The message ID of a type name: h = h * 5 + (signed char)byte over the
-// bytes, from 0, wrapping modulo 2^32. inTypeName must not be null.
+/// The message ID of a type name: h = h * 5 + (signed char)byte over the
+/// bytes, from 0, wrapping modulo 2^32. inTypeName must not be null.
 TARN_MESSAGING_API unsigned int HashMessageTypeNameToMessageID(const char* inTypeName) noexcept;
 
+/// The base of every message: carries the 32-bit ID of the message's type,
+/// by which listeners recognise it. Concrete messages derive through
+/// MessageImpl<T>. A message is not synchronised: the listeners of one
+/// broadcast read it on the broadcasting thread.
 class TARN_MESSAGING_API Message {
 public:
+  /// The ID of the message's type (MessageImpl<T>::StaticMessageID()).
   MessageID GetMessageID() const noexcept { return mMessageID; }
 
   virtual ~Message();
 
-  // A new heap copy of the complete message, owned by the caller, who ends
-  // it with delete. Throws std::bad_alloc when small-block storage is out.
+  /// A new heap copy of the complete message, owned by the caller, who ends
+  /// it with delete. Throws std::bad_alloc when small-block storage is out.
   virtual Message* Clone() const = 0;
 
-  // A function that, when called, broadcasts a copy of this message on the
-  // station inStationID. The copy is taken now, not when the function runs.
-  // Throws std::bad_alloc when small-block storage is out.
+  /// A function that, when called, broadcasts a copy of this message on the
+  /// station inStationID. The copy is taken now, not when the function runs.
+  /// Throws std::bad_alloc when small-block storage is out.
   virtual boost::function<void()> CreateCallback(const kivcore::utility::ImmutableString& inStationID) const = 0;
 
 protected:
+  /// A message of the type whose ID is inMessageID; called by MessageImpl<T>.
   explicit Message(MessageID inMessageID) noexcept : mMessageID(inMessageID) {}
+  /// Copies keep the ID; only derived classes copy.
+  /// @{
   Message(const Message&) noexcept = default;
   Message& operator=(const Message&) noexcept = default;
+  /// @}
 
 private:
   MessageID mMessageID;  // set once by the constructor
@@ -61,6 +74,8 @@ private:
 
 namespace StationUtils {
 // Declared here for the message templates; documented in StationUtils.h.
+/// Delivers inMessage synchronously to the station's listeners on the main
+/// thread; does nothing on any other thread or when the ID is not registered.
 TARN_MESSAGING_API void BroadcastMessage(const kivcore::utility::ImmutableString& inStationID,
                                          const Message& inMessage);
 }  // namespace StationUtils

@@ -1,17 +1,20 @@
-// Tarn::Station: a named relay, both a Broadcaster (listeners attach to it)
-// and a Listener (it can be attached to another broadcaster, and broadcasts
-// again everything it hears).
-//
-//   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &statusLine);
-//   Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, Progress(1, 2));
-//
-// Stations are normally made, found and deleted by the station registry
-// (StationRegistry.h) and reached by name through StationUtils. A station the
-// registry holds is deleted only by the registry.
-//
-// Threading: as Broadcaster and Listener. The destructor takes the registry's
-// lock for one lookup and, off the main thread, may wait while the main
-// thread delivers to the station as a listener.
+/// @file
+/// Tarn::Station: a named relay, both a Broadcaster (listeners attach to it)
+/// and a Listener (it can be attached to another broadcaster, and broadcasts
+/// again everything it hears).
+///
+/// @code{.cpp}
+///   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &statusLine);
+///   Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, Progress(1, 2));
+/// @endcode
+///
+/// Stations are normally made, found and deleted by the station registry
+/// (StationRegistry.h) and reached by name through StationUtils. A station the
+/// registry holds is deleted only by the registry.
+///
+/// Threading: as Broadcaster and Listener. The destructor takes the registry's
+/// lock for one lookup and, off the main thread, may wait while the main
+/// thread delivers to the station as a listener.
 #pragma once
 
 #include <TarnMessaging/Broadcaster.h>
@@ -22,17 +25,23 @@
 
 namespace Tarn {
 
+/// A named relay: a Broadcaster that listeners attach to, and a Listener
+/// that broadcasts again everything it hears. Normally made, found and
+/// deleted by the station registry, which owns the stations it holds.
+/// Threading as Broadcaster and Listener.
 class TARN_MESSAGING_API Station : public Broadcaster, public Listener {
 public:
+  /// A station named inStationID, with no listeners.
   explicit Station(const kivcore::utility::ImmutableString& inStationID);
   ~Station() override;
 
-  // Broadcasts to the station's listeners (Broadcaster::BroadcastMessage).
+  /// Broadcasts to the station's listeners (Broadcaster::BroadcastMessage).
   void BroadcastMessage(const Message& inMessage) override;
-  // Relays a message heard as a listener to the station's own listeners,
-  // straight through Broadcaster::BroadcastMessage.
+  /// Relays a message heard as a listener to the station's own listeners,
+  /// straight through Broadcaster::BroadcastMessage.
   void ListenToMessage(const Message& inMessage) override;
 
+  /// The station's ID, fixed at construction.
   kivcore::utility::ImmutableString GetStationID() const { return mStationID; }
 
 private:

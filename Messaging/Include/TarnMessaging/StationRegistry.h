@@ -1,24 +1,27 @@
-// Tarn::StationRegistry: the process-wide registry of stations by ID.
-//
-//   StationRegistry::RegisterStation(myID, nullptr);   // made on first use
-//   Station* s = StationRegistry::RetainStation(myID); // counted use
-//   ...
-//   StationRegistry::ReleaseStation(myID);
-//   StationRegistry::DisposeStation(myID);             // deleted when unretained
-//
-// The registry owns every station it holds and is the only party that
-// deletes one. For each ID it keeps a factory or a handed-over station, a
-// retain count and a dispose-requested flag. A retain protects a station
-// against DisposeStation, not against Terminate; a mere FindStation
-// protects it against nothing.
-//
-// Threading: every function may be called from any thread; one recursive
-// lock serialises them. Factories and station destructors run with that lock
-// held and may call the registry again on the same thread. DisposeStation
-// deletes only on the main thread; elsewhere it queues the station for the
-// next main-thread disposal (or static destruction). ReleaseStation deletes a
-// station whose disposal is pending on whatever thread makes the last
-// release. Terminate deletes on the calling thread, without the lock.
+/// @file
+/// Tarn::StationRegistry: the process-wide registry of stations by ID.
+///
+/// @code{.cpp}
+///   StationRegistry::RegisterStation(myID, nullptr);   // made on first use
+///   Station* s = StationRegistry::RetainStation(myID); // counted use
+///   ...
+///   StationRegistry::ReleaseStation(myID);
+///   StationRegistry::DisposeStation(myID);             // deleted when unretained
+/// @endcode
+///
+/// The registry owns every station it holds and is the only party that
+/// deletes one. For each ID it keeps a factory or a handed-over station, a
+/// retain count and a dispose-requested flag. A retain protects a station
+/// against DisposeStation, not against Terminate; a mere FindStation
+/// protects it against nothing.
+///
+/// Threading: every function may be called from any thread; one recursive
+/// lock serialises them. Factories and station destructors run with that lock
+/// held and may call the registry again on the same thread. DisposeStation
+/// deletes only on the main thread; elsewhere it queues the station for the
+/// next main-thread disposal (or static destruction). ReleaseStation deletes a
+/// station whose disposal is pending on whatever thread makes the last
+/// release. Terminate deletes on the calling thread, without the lock.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -29,32 +32,33 @@ namespace Tarn {
 
 class Station;
 
-// Makes a new station for the ID on the heap (the registry owns it), or null.
+/// Makes a new station for the ID on the heap (the registry owns it), or null.
 using StationFactory = Station* (*)(const kivcore::utility::ImmutableString& inStationID);
 
 namespace StationRegistry {
 
-// Registers inStationID with inFactory (null: a plain Tarn::Station). An ID
-// already registered keeps its record; the new factory is dropped.
+/// Registers inStationID with inFactory (null: a plain Tarn::Station). An ID
+/// already registered keeps its record; the new factory is dropped.
 TARN_MESSAGING_API void RegisterStation(const kivcore::utility::ImmutableString& inStationID, StationFactory inFactory);
-// Hands inStation to the registry under its own ID. If the ID is already
-// registered nothing changes and the caller keeps the station. Null: no-op.
+/// Hands inStation to the registry under its own ID. If the ID is already
+/// registered nothing changes and the caller keeps the station. Null: no-op.
 TARN_MESSAGING_API void RegisterStation(Station* inStation);
-// Registers and returns a new unique ID (a plain station, made on first use).
+/// Registers and returns a new unique ID (a plain station, made on first use).
 TARN_MESSAGING_API kivcore::utility::ImmutableString RegisterUniqueStation();
-// A new unique ID; registers nothing.
+/// A new unique ID; registers nothing.
 TARN_MESSAGING_API kivcore::utility::ImmutableString UniqueStationID();
-// The station, made through its factory if needed; null when unregistered.
+/// The station, made through its factory if needed; null when unregistered.
 TARN_MESSAGING_API Station* FindStation(const kivcore::utility::ImmutableString& inStationID);
-// As FindStation, and counts a retain (even when the factory yields null).
+/// As FindStation, and counts a retain when a station is returned (a factory
+/// that yields null or throws leaves the count as it was).
 TARN_MESSAGING_API Station* RetainStation(const kivcore::utility::ImmutableString& inStationID);
-// Drops one retain; the last release of a station whose disposal was asked
-// for deletes it. Balance every RetainStation that returned a station.
+/// Drops one retain; the last release of a station whose disposal was asked
+/// for deletes it. Balance every RetainStation that returned a station.
 TARN_MESSAGING_API void ReleaseStation(const kivcore::utility::ImmutableString& inStationID);
-// Removes the ID and deletes its station (see Threading), or, while it is
-// retained, marks it for deletion by the last release.
+/// Removes the ID and deletes its station (see Threading), or, while it is
+/// retained, marks it for deletion by the last release.
 TARN_MESSAGING_API void DisposeStation(const kivcore::utility::ImmutableString& inStationID);
-// Empties the registry and deletes every station it held, retained or not.
+/// Empties the registry and deletes every station it held, retained or not.
 TARN_MESSAGING_API void Terminate();
 
 }  // namespace StationRegistry

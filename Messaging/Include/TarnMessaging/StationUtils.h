@@ -1,24 +1,27 @@
-// Tarn::StationUtils: work on a station by its ID alone.
-//
-//   StationUtils::AddListener(kStation_StatusBar, &statusLine);
-//   StationUtils::BroadcastMessage(kStation_StatusBar, Progress(1, 2)); // main thread
-//   StationUtils::PostMessageToUIThread(kStation_StatusBar, Progress(2, 2), false); // any thread
-//   StationUtils::FlushPostedMessagesOnUIThread();                     // main thread
-//
-// Each function that touches a station retains it from the registry for the
-// length of the call and releases it afterwards. An ID that is not
-// registered makes every function a silent no-op (HasListeners: false).
-//
-// Threading: every function may be called from any thread. BroadcastMessage
-// delivers only on the main thread; elsewhere it does nothing, which is what
-// PostMessageToUIThread is for. RemoveListener may block as
-// Broadcaster::RemoveListener does. A post is delivered when the main thread
-// runs its pending calls, to the listeners attached at that moment, unless
-// its station is gone or stopped then.
-//
-// Misuse (a null or expired listener, an empty station ID in SwitchStation)
-// is reported through the contract-check procedure before the station is
-// looked up; when the report returns, the call goes on harmlessly.
+/// @file
+/// Tarn::StationUtils: work on a station by its ID alone.
+///
+/// @code{.cpp}
+///   StationUtils::AddListener(kStation_StatusBar, &statusLine);
+///   StationUtils::BroadcastMessage(kStation_StatusBar, Progress(1, 2)); // main thread
+///   StationUtils::PostMessageToUIThread(kStation_StatusBar, Progress(2, 2), false); // any thread
+///   StationUtils::FlushPostedMessagesOnUIThread();                     // main thread
+/// @endcode
+///
+/// Each function that touches a station retains it from the registry for the
+/// length of the call and releases it afterwards. An ID that is not
+/// registered makes every function a silent no-op (HasListeners: false).
+///
+/// Threading: every function may be called from any thread. BroadcastMessage
+/// delivers only on the main thread; elsewhere it does nothing, which is what
+/// PostMessageToUIThread is for. RemoveListener may block as
+/// Broadcaster::RemoveListener does. A post is delivered when the main thread
+/// runs its pending calls, to the listeners attached at that moment, unless
+/// its station is gone or stopped then.
+///
+/// Misuse (a null or expired listener, an empty station ID in SwitchStation)
+/// is reported through the contract-check procedure before the station is
+/// looked up; when the report returns, the call goes on harmlessly.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -39,47 +42,60 @@ namespace StationUtils {
 
 using kivcore::utility::ImmutableString;
 
+/// Attaches inListener to the station, as Broadcaster::AddListener does; a
+/// station ID that is not registered makes it a no-op.
+/// Preconditions: inListener != NULL, or inListener.lock() != NULL.
+/// @{
 TARN_MESSAGING_API void AddListener(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener);
 TARN_MESSAGING_API void AddListener(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener);
 TARN_MESSAGING_API void AddListener(const ImmutableString& inStationID, Listener* inListener);
 TARN_MESSAGING_API void AddListener(const ImmutableString& inStationID, InterfaceRef<ISafeListener> inListener);
+/// @}
 
-// Preconditions: inListener.lock() != NULL, or inListener != NULL.
+/// Detaches inListener from the station; may block off the main thread as
+/// Broadcaster::RemoveListener does.
+/// Preconditions: inListener.lock() != NULL, or inListener != NULL.
+/// @{
 TARN_MESSAGING_API void RemoveListener(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener);
 TARN_MESSAGING_API void RemoveListener(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener);
 TARN_MESSAGING_API void RemoveListener(const ImmutableString& inStationID, Listener* inListener);
 TARN_MESSAGING_API void RemoveListener(const ImmutableString& inStationID, InterfaceRef<ISafeListener> inListener);
+/// @}
 
 // BroadcastMessage(inStationID, inMessage) is declared in Message.h: delivers
 // synchronously on the main thread; nothing elsewhere.
 
-// Whether the station has any registration; false when unregistered.
+/// Whether the station has any registration; false when unregistered.
 TARN_MESSAGING_API bool HasListeners(const ImmutableString& inStationID);
 
-// A retain that stands between calls: keeps the station (its listeners and
-// broadcasting state) from a pending disposal until the matching release.
+/// A retain that stands between calls: keeps the station (its listeners and
+/// broadcasting state) from a pending disposal until the matching release.
+/// @{
 TARN_MESSAGING_API void RetainStation(const ImmutableString& inStationID);
 TARN_MESSAGING_API void ReleaseStation(const ImmutableString& inStationID);
+/// @}
 
-// While stopped, broadcasts on the station are dropped (not kept for later).
+/// While stopped, broadcasts on the station are dropped (not kept for later).
+/// @{
 TARN_MESSAGING_API void StartBroadcasting(const ImmutableString& inStationID);
 TARN_MESSAGING_API void StopBroadcasting(const ImmutableString& inStationID);
+/// @}
 
-// Moves a plain-pointer listener: removes it from inFromStationID, then adds
-// it to inToStationID (not atomic: in between it is on neither).
-// Preconditions: !inFromStationID.empty(), !inToStationID.empty(),
-// inListener != NULL.
+/// Moves a plain-pointer listener: removes it from inFromStationID, then adds
+/// it to inToStationID (not atomic: in between it is on neither).
+/// Preconditions: !inFromStationID.empty(), !inToStationID.empty(),
+/// inListener != NULL.
 TARN_MESSAGING_API void SwitchStation(const ImmutableString& inFromStationID, const ImmutableString& inToStationID,
                                       Listener* inListener);
 
-// On the main thread with inForceAsync false: broadcasts at once, with no
-// copy and no allocation. Otherwise queues a copy of the message for the main
-// thread (one small-block allocation; std::bad_alloc when storage is out, and
-// nothing is queued then). inMessage may be destroyed as soon as this returns.
+/// On the main thread with inForceAsync false: broadcasts at once, with no
+/// copy and no allocation. Otherwise queues a copy of the message for the main
+/// thread (one small-block allocation; std::bad_alloc when storage is out, and
+/// nothing is queued then). inMessage may be destroyed as soon as this returns.
 TARN_MESSAGING_API void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
                                               bool inForceAsync);
-// Runs every pending call of the main thread now; meant for the main thread.
-// Does nothing while no main thread is registered.
+/// Runs every pending call of the main thread now; meant for the main thread.
+/// Does nothing while no main thread is registered.
 TARN_MESSAGING_API void FlushPostedMessagesOnUIThread();
 
 }  // namespace StationUtils
