@@ -1,6 +1,7 @@
-// Tarn::Exception: the base class of Tarn exceptions.
-//
-// Threading: a value; not synchronised.
+/// @file
+/// Tarn::Exception: the base class of Tarn exceptions.
+///
+/// Threading: a value; not synchronised.
 #pragma once
 
 #include <TarnFoundation/Export.h>
@@ -9,12 +10,19 @@
 
 namespace Tarn {
 
+/// The base class of the exceptions of Tarn libraries, itself a
+/// std::exception. A value; not synchronised.
 class TARNFOUNDATION_API Exception : public std::exception {
 public:
+  /// An exception with the generic text.
   Exception() noexcept;
+  /// Copies are cheap and cannot throw.
+  /// @{
   Exception(const Exception&) noexcept = default;
   Exception& operator=(const Exception&) noexcept = default;
+  /// @}
   ~Exception() override;
+  /// A description of the exception; derived classes give their own.
   const char* what() const noexcept override;
 };
 

@@ -1,4 +1,5 @@
-// The whole TarnFoundation API: Tarn::Exception and Tarn::TimeStamp.
+/// @file
+/// The whole TarnFoundation API: Tarn::Exception and Tarn::TimeStamp.
 #pragma once
 
 #include <TarnFoundation/Exception.h>

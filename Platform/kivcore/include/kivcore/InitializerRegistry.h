@@ -1,17 +1,20 @@
-// kivcore::config initializer registry: libraries enrol an init and a
-// terminate function at load time with a static InitializerRegistrar; the
-// host later runs them all. Nothing runs at load.
-//
-//   static kivcore::config::InitializerRegistrar sRegistrar(
-//       "My::Library", kivcore::config::EInitializerContextFlags(10),
-//       [](const kivcore::proplist::PropList&) { return Init(); },
-//       [] { Term(); }, {});
-//   // host, at start-up and shutdown:
-//   kivcore::config::InitializerRegistry::InitializeAll(props);
-//   kivcore::config::InitializerRegistry::TerminateAll();
-//
-// Threading: registration, InitializeAll and TerminateAll are serialised by
-// one lock; the init and terminate functions run with it released.
+/// @file
+/// kivcore::config initializer registry: libraries enrol an init and a
+/// terminate function at load time with a static InitializerRegistrar; the
+/// host later runs them all. Nothing runs at load.
+///
+/// @code{.cpp}
+///   static kivcore::config::InitializerRegistrar sRegistrar(
+///       "My::Library", kivcore::config::EInitializerContextFlags(10),
+///       [](const kivcore::proplist::PropList&) { return Init(); },
+///       [] { Term(); }, {});
+///   // host, at start-up and shutdown:
+///   kivcore::config::InitializerRegistry::InitializeAll(props);
+///   kivcore::config::InitializerRegistry::TerminateAll();
+/// @endcode
+///
+/// Threading: registration, InitializeAll and TerminateAll are serialised by
+/// one lock; the init and terminate functions run with it released.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -23,20 +26,25 @@
 
 namespace kivcore::config {
 
-// Context bits an initializer declares; their meaning is the host's.
+/// Context bits an initializer declares; their meaning is the host's.
 enum class EInitializerContextFlags : unsigned int {};
 
+/// Brings a library up with the host's properties; false reports failure.
 using InitializerFunction = std::function<bool(const proplist::PropList&)>;
+/// Brings a library down.
 using TerminatorFunction = std::function<void()>;
+/// Names of the initializers that must run first; unused entries are null.
 using InitializerDependencies = std::array<const char*, 16>;
 
+/// Enrols an initializer and terminator pair with the InitializerRegistry
+/// for as long as it lives; usually a static object of a library.
 class KIVCORE_API InitializerRegistrar {
 public:
-  // Enrols the pair under inName; inDependencies lists names (null entries
-  // are unused) of initializers that must run first.
+  /// Enrols the pair under inName; inDependencies lists names (null entries
+  /// are unused) of initializers that must run first.
   InitializerRegistrar(const char* inName, EInitializerContextFlags inFlags, InitializerFunction inInit,
                        TerminatorFunction inTerminate, const InitializerDependencies& inDependencies);
-  // Withdraws the registration (a library being unloaded).
+  /// Withdraws the registration (a library being unloaded).
   ~InitializerRegistrar();
   InitializerRegistrar(const InitializerRegistrar&) = delete;
   InitializerRegistrar& operator=(const InitializerRegistrar&) = delete;
@@ -45,15 +53,17 @@ private:
   unsigned long mId;
 };
 
+/// The registry of initializers that the host runs at start-up and
+/// shutdown; nothing runs at load.
 class KIVCORE_API InitializerRegistry {
 public:
-  // Runs every registered init not yet run, in registration order (an
-  // initializer whose named dependency is registered later waits for it).
-  // Stops at the first that returns false or throws, and returns false then.
+  /// Runs every registered init not yet run, in registration order (an
+  /// initializer whose named dependency is registered later waits for it).
+  /// Stops at the first that returns false or throws, and returns false then.
   static bool InitializeAll(const proplist::PropList& inProperties);
-  // Runs the terminate function of every initialized entry, in reverse order.
+  /// Runs the terminate function of every initialized entry, in reverse order.
   static void TerminateAll();
-  // Whether an initializer of this name is registered, and its flags.
+  /// Whether an initializer of this name is registered, and its flags.
   static bool IsRegistered(const std::string& inName, unsigned int* outFlags = nullptr);
 };
 

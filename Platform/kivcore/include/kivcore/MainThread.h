@@ -1,19 +1,22 @@
-// kivcore::threads main-thread services: which thread is the application's
-// main (UI) thread, and the queue of calls it runs for other threads.
-//
-//   auto adaptor = RegisterCurrentThreadAsMainThread();   // on the UI thread
-//   // any thread:
-//   AsyncCallFromMainThread([] { UpdateUI(); }, 0);
-//   // UI thread, in its event loop:
-//   if (adaptor->WaitForPendingCalls(50)) adaptor->RunPendingCalls();
-//
-// Threading: a thread is the main thread while anybody holds the adaptor that
-// registered it; once the last holder lets go, no thread is. Calls may be
-// queued from any thread at any time; a call queued while no main thread is
-// registered waits for the next one. RunPendingCalls runs, on the calling
-// thread and in queue order, the calls queued before it started; calls queued
-// while it runs wait for the next run. The wakeup handler runs on the queuing
-// thread, outside every lock of the queue.
+/// @file
+/// kivcore::threads main-thread services: which thread is the application's
+/// main (UI) thread, and the queue of calls it runs for other threads.
+///
+/// @code{.cpp}
+///   auto adaptor = RegisterCurrentThreadAsMainThread();   // on the UI thread
+///   // any thread:
+///   AsyncCallFromMainThread([] { UpdateUI(); }, 0);
+///   // UI thread, in its event loop:
+///   if (adaptor->WaitForPendingCalls(50)) adaptor->RunPendingCalls();
+/// @endcode
+///
+/// Threading: a thread is the main thread while anybody holds the adaptor that
+/// registered it; once the last holder lets go, no thread is. Calls may be
+/// queued from any thread at any time; a call queued while no main thread is
+/// registered waits for the next one. RunPendingCalls runs, on the calling
+/// thread and in queue order, the calls queued before it started; calls queued
+/// while it runs wait for the next run. The wakeup handler runs on the queuing
+/// thread, outside every lock of the queue.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -26,27 +29,31 @@
 
 namespace kivcore::threads {
 
+/// The registered main thread's handle on the process-wide queue of calls
+/// it runs for other threads. Holding it keeps the thread that registered
+/// it the main thread; RunPendingCalls and WaitForPendingCalls are for that
+/// thread, the rest may be called from any thread.
 class KIVCORE_API AsyncEventLoopAdaptor {
 public:
   AsyncEventLoopAdaptor(const AsyncEventLoopAdaptor&) = delete;
   AsyncEventLoopAdaptor& operator=(const AsyncEventLoopAdaptor&) = delete;
   ~AsyncEventLoopAdaptor();
 
-  // Runs every call queued before this call started, in queue order, on the
-  // calling thread. When a call throws, the calls after it stay queued (at
-  // the front, in order) and the exception propagates.
+  /// Runs every call queued before this call started, in queue order, on the
+  /// calling thread. When a call throws, the calls after it stay queued (at
+  /// the front, in order) and the exception propagates.
   void RunPendingCalls();
 
-  // Returns true at once when calls are queued; otherwise blocks until one
-  // is queued (true) or inTimeoutMilliseconds have passed (false); -1 waits
-  // without limit.
+  /// Returns true at once when calls are queued; otherwise blocks until one
+  /// is queued (true) or inTimeoutMilliseconds have passed (false); -1 waits
+  /// without limit.
   bool WaitForPendingCalls(int inTimeoutMilliseconds);
 
-  // Called on the queuing thread whenever a call is queued, so that a host
-  // event loop can schedule RunPendingCalls. An empty handler removes it.
+  /// Called on the queuing thread whenever a call is queued, so that a host
+  /// event loop can schedule RunPendingCalls. An empty handler removes it.
   void SetWakeupHandler(std::function<void()> inHandler);
 
-  // Number of calls queued and not yet taken by RunPendingCalls.
+  /// Number of calls queued and not yet taken by RunPendingCalls.
   std::size_t PendingCallCount() const;
 
 private:
@@ -54,19 +61,19 @@ private:
   AsyncEventLoopAdaptor() = default;
 };
 
-// Makes the calling thread the main thread and returns the adaptor that keeps
-// it so. A main thread registered earlier and still held is replaced by the
-// caller; all holders share one adaptor.
+/// Makes the calling thread the main thread and returns the adaptor that keeps
+/// it so. A main thread registered earlier and still held is replaced by the
+/// caller; all holders share one adaptor.
 KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> RegisterCurrentThreadAsMainThread();
 
-// The registered main thread's adaptor, or empty when none is registered.
+/// The registered main thread's adaptor, or empty when none is registered.
 KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> GetRegisteredMainThread();
 
-// True only on the registered main thread. One atomic load and a comparison.
+/// True only on the registered main thread. One atomic load and a comparison.
 KIVCORE_API bool CurrentThreadIsMainThread() noexcept;
 
-// Queues a copy of inCall to run once on the main thread. inFlags is
-// reserved (pass 0). Returns true when the call was queued.
+/// Queues a copy of inCall to run once on the main thread. inFlags is
+/// reserved (pass 0). Returns true when the call was queued.
 KIVCORE_API bool AsyncCallFromMainThread(const boost::function<void()>& inCall, unsigned int inFlags);
 
 }  // namespace kivcore::threads

@@ -1,7 +1,8 @@
-// kivcore::proplist::PropList: a small string-to-string property list handed
-// to initializers.
-//
-// Threading: a value type; not synchronised.
+/// @file
+/// kivcore::proplist::PropList: a small string-to-string property list handed
+/// to initializers.
+///
+/// Threading: a value type; not synchronised.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -11,11 +12,15 @@
 
 namespace kivcore::proplist {
 
+/// A small string-to-string property list handed to initializers; a value
+/// type, not synchronised.
 class KIVCORE_API PropList {
 public:
+  /// Sets inKey to inValue, replacing any earlier value.
   void Set(const std::string& inKey, const std::string& inValue);
-  // inDefault when the key is absent.
+  /// inDefault when the key is absent.
   std::string Get(const std::string& inKey, const std::string& inDefault = std::string()) const;
+  /// Whether inKey has a value.
   bool Has(const std::string& inKey) const;
 
 private:

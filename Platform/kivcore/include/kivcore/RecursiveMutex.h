@@ -1,15 +1,18 @@
-// kivcore::threads::RecursiveMutex: a mutex its holder may lock again.
-//
-//   mMutex.Lock("Broadcaster::AddListener");   // the label names the site
-//   ...                                          // for diagnostics only
-//   mMutex.Unlock();
-//
-// Threading: Lock blocks until the mutex is free or held by the caller; each
-// Lock is matched by one Unlock on the same thread. The uncontended paths are
-// inline: one compare-and-swap to lock and one exchange to unlock, with no
-// call. A waiter spins briefly, then sleeps in the kernel. The mutex is
-// constant-initialised and trivially destructible, so a global one can be used
-// at any point of static initialisation or destruction. Not copyable.
+/// @file
+/// kivcore::threads::RecursiveMutex: a mutex its holder may lock again.
+///
+/// @code{.cpp}
+///   mMutex.Lock("Broadcaster::AddListener");   // the label names the site
+///   ...                                          // for diagnostics only
+///   mMutex.Unlock();
+/// @endcode
+///
+/// Threading: Lock blocks until the mutex is free or held by the caller; each
+/// Lock is matched by one Unlock on the same thread. The uncontended paths are
+/// inline: one compare-and-swap to lock and one exchange to unlock, with no
+/// call. A waiter spins briefly, then sleeps in the kernel. The mutex is
+/// constant-initialised and trivially destructible, so a global one can be used
+/// at any point of static initialisation or destruction. Not copyable.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -19,19 +22,22 @@
 
 namespace kivcore::threads {
 
-// An identifier of the calling thread, unique among live threads: the
-// thread pointer, read from a register with no call.
+/// An identifier of the calling thread, unique among live threads: the
+/// thread pointer, read from a register with no call.
 inline std::uintptr_t CurrentThreadToken() noexcept {
   return reinterpret_cast<std::uintptr_t>(__builtin_thread_pointer());
 }
 
+/// A mutex its holder may lock again; each Lock is matched by one Unlock on
+/// the same thread. Constant-initialised and trivially destructible, so a
+/// global one works at any point of static initialisation or destruction.
 class KIVCORE_API RecursiveMutex {
 public:
   constexpr RecursiveMutex() noexcept = default;
   RecursiveMutex(const RecursiveMutex&) = delete;
   RecursiveMutex& operator=(const RecursiveMutex&) = delete;
 
-  // inLabel names the locking site ("Class::Operation"); may be null.
+  /// inLabel names the locking site ("Class::Operation"); may be null.
   void Lock(const char* inLabel) {
     const std::uintptr_t self = CurrentThreadToken();
     if (mOwner.load(std::memory_order_relaxed) == self) {
@@ -47,6 +53,8 @@ public:
     mLabel.store(inLabel, std::memory_order_relaxed);
   }
 
+  /// Undoes one Lock of the calling thread, which must hold the mutex; the
+  /// last one frees it and wakes one waiter.
   void Unlock() {
     if (--mDepth != 0) return;
     mLabel.store(nullptr, std::memory_order_relaxed);
@@ -54,12 +62,12 @@ public:
     if (mState.exchange(kFree, std::memory_order_release) == kLockedWithWaiters) WakeOne();
   }
 
-  // True when the calling thread holds the mutex.
+  /// True when the calling thread holds the mutex.
   bool IsHeldByCurrentThread() const noexcept {
     return mOwner.load(std::memory_order_relaxed) == CurrentThreadToken();
   }
-  // The label of the outermost Lock of the current holder (diagnostics; may
-  // be stale when read by another thread).
+  /// The label of the outermost Lock of the current holder (diagnostics; may
+  /// be stale when read by another thread).
   const char* HolderLabel() const noexcept { return mLabel.load(std::memory_order_relaxed); }
 
 private:
@@ -76,9 +84,10 @@ private:
   std::atomic<const char*> mLabel{nullptr};
 };
 
-// Locks on construction, unlocks on destruction (every way out).
+/// Locks on construction, unlocks on destruction (every way out).
 class ScopedLock {
 public:
+  /// Locks inMutex, naming the site inLabel; the mutex must outlive the lock.
   ScopedLock(RecursiveMutex& inMutex, const char* inLabel) : mMutex(inMutex) { mMutex.Lock(inLabel); }
   ~ScopedLock() { mMutex.Unlock(); }
   ScopedLock(const ScopedLock&) = delete;
