@@ -1,0 +1,658 @@
+// Shared fixtures of the messaging tests: hooks into kivcore that record
+// instead of reporting, small message types, listeners that record their
+// calls, and bounded waits so that a deadlock fails a test instead of
+// hanging it.
+//
+//   TEST(Example, ABroadcastReachesTheListener) {
+//     messaging_test::MainThreadGuard mainThread;          // this thread broadcasts
+//     messaging_test::CallLog log;
+//     messaging_test::RecordingListener listener("A", &log);
+//     Tarn::Broadcaster broadcaster;
+//     broadcaster.AddListener(&listener);
+//     broadcaster.BroadcastMessage(messaging_test::NumberMessage(1));
+//     EXPECT_EQ(std::vector<std::string>{"A:1"}, log.Entries());
+//   }
+//
+// Every guard restores what it replaced when it goes out of scope, so tests
+// stay independent whatever order gtest runs them in. The hooks are
+// process-wide: install them on the test's thread before starting workers,
+// and let the guard outlive every thread that might report.
+//
+// Threading: CallLog, the recorders, Latch and the call counters may be used
+// from any thread. MainThreadGuard makes the constructing thread the main
+// thread; the guards that swap handlers are meant for the test's own thread.
+#pragma once
+
+#include <TarnMessaging/Broadcaster.h>
+#include <TarnMessaging/Listener.h>
+#include <TarnMessaging/MessageImpl.h>
+#include <TarnMessaging/SafeListener.h>
+
+#include <kivcore/Debug.h>
+#include <kivcore/Error.h>
+#include <kivcore/MainThread.h>
+#include <kivcore/SmallBlockAllocator.h>
+
+#include <boost/shared_ptr.hpp>
+#include <boost/weak_ptr.hpp>
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+#include <exception>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+namespace messaging_test {
+
+// Long enough never to expire on a loaded machine (sanitizer builds
+// included); short enough that a deadlock is reported well within the ctest
+// timeout.
+constexpr std::chrono::seconds kDeadline{20};
+
+// ---------------------------------------------------------------------------
+// Bounded waits
+
+// Counts down to zero once; waiters wait for zero, with a deadline.
+class Latch {
+public:
+  explicit Latch(int inCount = 1) : mCount(inCount) {}
+  Latch(const Latch&) = delete;
+  Latch& operator=(const Latch&) = delete;
+
+  void CountDown() {
+    std::lock_guard<std::mutex> lock(mMutex);
+    if (mCount > 0 && --mCount == 0) mReached.notify_all();
+  }
+  // True when the count reached zero before inTimeout passed.
+  bool WaitFor(std::chrono::milliseconds inTimeout = kDeadline) {
+    std::unique_lock<std::mutex> lock(mMutex);
+    return mReached.wait_for(lock, inTimeout, [this] { return mCount == 0; });
+  }
+  bool IsReleased() const {
+    std::lock_guard<std::mutex> lock(mMutex);
+    return mCount == 0;
+  }
+
+private:
+  mutable std::mutex mMutex;
+  std::condition_variable mReached;
+  int mCount;  // guarded by mMutex
+};
+
+// Polls inDone until it returns true or inTimeout passes; true when it did.
+// For conditions that nothing signals (a registry becoming empty, a count
+// kept by the library); the polling interval grows to one millisecond, so
+// the result never depends on how long the wait took.
+template <class Predicate>
+bool WaitUntil(Predicate inDone, std::chrono::milliseconds inTimeout = kDeadline) {
+  const auto deadline = std::chrono::steady_clock::now() + inTimeout;
+  std::chrono::microseconds pause{1};
+  while (!inDone()) {
+    if (std::chrono::steady_clock::now() >= deadline) return inDone();
+    std::this_thread::sleep_for(pause);
+    if (pause < std::chrono::milliseconds(1)) pause *= 2;
+  }
+  return true;
+}
+
+namespace detail {
+inline void AbortNamingTheTest(const char* inWhat) {
+  const ::testing::TestInfo* test = ::testing::UnitTest::GetInstance()->current_test_info();
+  std::fprintf(stderr, "%s.%s: %s\n", test != nullptr ? test->test_suite_name() : "?",
+               test != nullptr ? test->name() : "?", inWhat);
+  std::fflush(stderr);
+  std::abort();
+}
+}  // namespace detail
+
+// Threads that must all finish within the deadline. A thread still running
+// then can be neither joined nor abandoned safely (it uses the test's
+// stack), so the process stops with a message naming the test.
+class ThreadGroup {
+public:
+  ThreadGroup() = default;
+  ThreadGroup(const ThreadGroup&) = delete;
+  ThreadGroup& operator=(const ThreadGroup&) = delete;
+  ~ThreadGroup() { JoinAll(); }
+
+  void Start(std::function<void()> inBody) {
+    mThreads.emplace_back([this, body = std::move(inBody)] {
+      body();
+      std::lock_guard<std::mutex> lock(mMutex);
+      ++mFinished;
+      mChanged.notify_all();
+    });
+  }
+
+  void JoinAll() {
+    {
+      std::unique_lock<std::mutex> lock(mMutex);
+      if (!mChanged.wait_for(lock, kDeadline, [this] { return mFinished == mThreads.size(); })) {
+        detail::AbortNamingTheTest("threads still running after the deadline (deadlock?)");
+      }
+    }
+    for (std::thread& thread : mThreads)
+      if (thread.joinable()) thread.join();
+    mThreads.clear();
+    mFinished = 0;
+  }
+
+private:
+  std::vector<std::thread> mThreads;
+  std::mutex mMutex;
+  std::condition_variable mChanged;
+  std::size_t mFinished = 0;  // guarded by mMutex
+};
+
+// Stops the process, naming the test, if it is still alive after inLimit:
+// for tests whose main thread could itself block (a broadcast that never
+// ends), where no bounded wait of the test's own would get a chance to run.
+class Watchdog {
+public:
+  explicit Watchdog(std::chrono::seconds inLimit = kDeadline * 2)
+      : mThread([this, inLimit] {
+          std::unique_lock<std::mutex> lock(mMutex);
+          if (!mDisarmed.wait_for(lock, inLimit, [this] { return mDone; }))
+            detail::AbortNamingTheTest("still running when the watchdog expired (deadlock?)");
+        }) {}
+  Watchdog(const Watchdog&) = delete;
+  Watchdog& operator=(const Watchdog&) = delete;
+  ~Watchdog() {
+    {
+      std::lock_guard<std::mutex> lock(mMutex);
+      mDone = true;
+    }
+    mDisarmed.notify_all();
+    mThread.join();
+  }
+
+private:
+  std::mutex mMutex;
+  std::condition_variable mDisarmed;
+  bool mDone = false;  // guarded by mMutex
+  std::thread mThread;  // last: starts once the members above exist
+};
+
+// ---------------------------------------------------------------------------
+// Process-wide hooks
+
+// Makes the constructing thread the main thread for the guard's lifetime.
+// Broadcasts deliver only there. If nothing else holds the main-thread
+// adaptor, no thread is the main thread once the guard is gone; a main thread
+// registered earlier on another thread is replaced, not restored.
+class MainThreadGuard {
+public:
+  MainThreadGuard() : mAdaptor(kivcore::threads::RegisterCurrentThreadAsMainThread()) {}
+  MainThreadGuard(const MainThreadGuard&) = delete;
+  MainThreadGuard& operator=(const MainThreadGuard&) = delete;
+  ~MainThreadGuard() { mAdaptor.reset(); }
+
+  kivcore::threads::AsyncEventLoopAdaptor& Adaptor() const { return *mAdaptor; }
+
+private:
+  boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> mAdaptor;
+};
+
+// One call of the contract dialog, as the dialog was given it.
+struct ContractViolation {
+  std::string condition;
+  std::string file;
+  std::string function;
+  int line = 0;
+};
+
+// Replaces the contract dialog with one that records every violation and
+// answers inAnswer ("break into the debugger?"). Restores the previous dialog
+// when destroyed. The dialog runs on the reporting thread, which may hold a
+// broadcaster's lock meanwhile: keep the recorder's users off that lock.
+class ContractDialogRecorder {
+public:
+  explicit ContractDialogRecorder(bool inAnswer = false)
+      : mState(std::make_shared<State>(inAnswer)),
+        mPrevious(kivcore::debug::SetContractDialogHandler(
+            [state = mState](const char* inCondition, const char* inFile, const char* inFunction, int inLine) {
+              std::lock_guard<std::mutex> lock(state->mMutex);
+              state->mViolations.push_back(ContractViolation{inCondition != nullptr ? inCondition : "",
+                                                             inFile != nullptr ? inFile : "",
+                                                             inFunction != nullptr ? inFunction : "", inLine});
+              state->mChanged.notify_all();
+              return state->mAnswer;
+            })) {}
+  ContractDialogRecorder(const ContractDialogRecorder&) = delete;
+  ContractDialogRecorder& operator=(const ContractDialogRecorder&) = delete;
+  ~ContractDialogRecorder() { kivcore::debug::SetContractDialogHandler(std::move(mPrevious)); }
+
+  std::vector<ContractViolation> Violations() const {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    return mState->mViolations;
+  }
+  std::size_t Count() const {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    return mState->mViolations.size();
+  }
+  // True when at least inCount violations were recorded before inTimeout.
+  bool WaitForCount(std::size_t inCount, std::chrono::milliseconds inTimeout = kDeadline) const {
+    std::unique_lock<std::mutex> lock(mState->mMutex);
+    return mState->mChanged.wait_for(lock, inTimeout, [&] { return mState->mViolations.size() >= inCount; });
+  }
+  void Clear() {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    mState->mViolations.clear();
+  }
+
+private:
+  struct State {
+    explicit State(bool inAnswer) : mAnswer(inAnswer) {}
+    mutable std::mutex mMutex;
+    std::condition_variable mChanged;
+    std::vector<ContractViolation> mViolations;  // guarded by mMutex
+    const bool mAnswer;
+  };
+  std::shared_ptr<State> mState;  // shared with the installed handler
+  kivcore::debug::ContractDialogHandler mPrevious;
+};
+
+// Replaces the error handler with one that records every report and
+// returns, so that ThrowError returns to the operation that reported.
+// Restores the previous handler when destroyed.
+class ErrorRecorder {
+public:
+  ErrorRecorder()
+      : mState(std::make_shared<State>()),
+        mPrevious(kivcore::config::SetErrorHandler([state = mState](const kivcore::config::ErrorReport& inReport) {
+          std::lock_guard<std::mutex> lock(state->mMutex);
+          state->mReports.push_back(inReport);
+        })) {}
+  ErrorRecorder(const ErrorRecorder&) = delete;
+  ErrorRecorder& operator=(const ErrorRecorder&) = delete;
+  ~ErrorRecorder() { kivcore::config::SetErrorHandler(std::move(mPrevious)); }
+
+  std::vector<kivcore::config::ErrorReport> Reports() const {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    return mState->mReports;
+  }
+  std::size_t Count() const {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    return mState->mReports.size();
+  }
+
+private:
+  struct State {
+    mutable std::mutex mMutex;
+    std::vector<kivcore::config::ErrorReport> mReports;  // guarded by mMutex
+  };
+  std::shared_ptr<State> mState;
+  kivcore::config::ErrorHandler mPrevious;
+};
+
+// Installs the default error handler (ThrowError throws
+// kivcore::config::Error) for the guard's lifetime, whatever was installed
+// before, and restores that afterwards.
+class DefaultErrorHandlerGuard {
+public:
+  DefaultErrorHandlerGuard() : mPrevious(kivcore::config::SetErrorHandler(nullptr)) {}
+  DefaultErrorHandlerGuard(const DefaultErrorHandlerGuard&) = delete;
+  DefaultErrorHandlerGuard& operator=(const DefaultErrorHandlerGuard&) = delete;
+  ~DefaultErrorHandlerGuard() { kivcore::config::SetErrorHandler(std::move(mPrevious)); }
+
+private:
+  kivcore::config::ErrorHandler mPrevious;
+};
+
+// Replaces the error manager's exception handler (what GuardedCall does with
+// an exception a listener raised) with one that records the exception's
+// what() text, or "unknown" for a non-standard exception. Restores the
+// previous handler when destroyed.
+class ExceptionRecorder {
+public:
+  ExceptionRecorder()
+      : mState(std::make_shared<State>()),
+        mPrevious(kivcore::config::ErrorManager::SetExceptionHandler([state = mState](std::exception_ptr inError) {
+          std::string text = "unknown";
+          try {
+            std::rethrow_exception(inError);
+          } catch (const std::exception& e) {
+            text = e.what();
+          } catch (...) {
+          }
+          std::lock_guard<std::mutex> lock(state->mMutex);
+          state->mMessages.push_back(std::move(text));
+        })) {}
+  ExceptionRecorder(const ExceptionRecorder&) = delete;
+  ExceptionRecorder& operator=(const ExceptionRecorder&) = delete;
+  ~ExceptionRecorder() { kivcore::config::ErrorManager::SetExceptionHandler(std::move(mPrevious)); }
+
+  std::vector<std::string> Messages() const {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    return mState->mMessages;
+  }
+  std::size_t Count() const {
+    std::lock_guard<std::mutex> lock(mState->mMutex);
+    return mState->mMessages.size();
+  }
+
+private:
+  struct State {
+    mutable std::mutex mMutex;
+    std::vector<std::string> mMessages;  // guarded by mMutex
+  };
+  std::shared_ptr<State> mState;
+  kivcore::config::ErrorManager::ExceptionHandler mPrevious;
+};
+
+// Lets the next inSucceeding small-block allocations succeed and fails every
+// one after them, until the guard is destroyed; then allocations never fail
+// again (the allocator's default).
+class SmallBlockFailureGuard {
+public:
+  explicit SmallBlockFailureGuard(long long inSucceeding) {
+    kivcore::utility::SmallBlockAllocator::SetFailAfter(inSucceeding);
+  }
+  SmallBlockFailureGuard(const SmallBlockFailureGuard&) = delete;
+  SmallBlockFailureGuard& operator=(const SmallBlockFailureGuard&) = delete;
+  ~SmallBlockFailureGuard() { kivcore::utility::SmallBlockAllocator::SetFailAfter(-1); }
+};
+
+// ---------------------------------------------------------------------------
+// Messages
+
+// A message without parameters.
+struct PingMessage : Tarn::MessageImpl<PingMessage> {};
+
+// A message with one parameter, handy for telling broadcasts apart.
+struct NumberMessage : Tarn::MessageImpl<NumberMessage> {
+  explicit NumberMessage(int inValue) : mValue(inValue) {}
+  int mValue;
+};
+
+// How the call log shows a message: "ping", the number of a NumberMessage,
+// or "#<id>" for any other type.
+inline std::string Describe(const Tarn::Message& inMessage) {
+  if (inMessage.GetMessageID() == PingMessage::StaticMessageID()) return "ping";
+  if (inMessage.GetMessageID() == NumberMessage::StaticMessageID())
+    return std::to_string(static_cast<const NumberMessage&>(inMessage).mValue);
+  return "#" + std::to_string(inMessage.GetMessageID());
+}
+
+// ---------------------------------------------------------------------------
+// Listeners
+
+// An ordered record of calls, shared by the listeners of a test; entries are
+// "<listener name>:<Describe(message)>".
+class CallLog {
+public:
+  void Record(std::string inEntry) {
+    std::lock_guard<std::mutex> lock(mMutex);
+    mEntries.push_back(std::move(inEntry));
+  }
+  std::vector<std::string> Entries() const {
+    std::lock_guard<std::mutex> lock(mMutex);
+    return mEntries;
+  }
+  std::size_t Count(const std::string& inEntry) const {
+    std::lock_guard<std::mutex> lock(mMutex);
+    std::size_t count = 0;
+    for (const std::string& entry : mEntries) count += entry == inEntry ? 1 : 0;
+    return count;
+  }
+  void Clear() {
+    std::lock_guard<std::mutex> lock(mMutex);
+    mEntries.clear();
+  }
+
+private:
+  mutable std::mutex mMutex;
+  std::vector<std::string> mEntries;  // guarded by mMutex
+};
+
+// What every recording listener shares, whatever its base class: a name, an
+// optional log, a call count, an optional action run after the call is
+// recorded, and a probe that outlives the listener (so that a test can still
+// read the count, and see the destruction, after the listener is gone).
+// Without a log and an action a call allocates nothing.
+class CallRecorder {
+public:
+  using Action = std::function<void(const Tarn::Message&)>;
+  struct Probe {
+    std::atomic<int> mCalls{0};
+    std::atomic<bool> mDestroyed{false};
+  };
+
+  explicit CallRecorder(std::string inName, CallLog* inLog)
+      : mName(std::move(inName)), mLog(inLog), mProbe(std::make_shared<Probe>()) {}
+  CallRecorder(const CallRecorder&) = delete;
+  CallRecorder& operator=(const CallRecorder&) = delete;
+  ~CallRecorder() { mProbe->mDestroyed.store(true); }
+
+  const std::string& Name() const { return mName; }
+  int Calls() const { return mProbe->mCalls.load(); }
+  const std::shared_ptr<Probe>& GetProbe() const { return mProbe; }
+  // Runs on every call, on the delivering thread, after the call is logged.
+  // Set it before the listener is attached: it is not synchronised.
+  void SetAction(Action inAction) { mAction = std::move(inAction); }
+
+protected:
+  void RecordCall(const Tarn::Message& inMessage) {
+    mProbe->mCalls.fetch_add(1);
+    if (mLog != nullptr) mLog->Record(mName + ":" + Describe(inMessage));
+    if (mAction) mAction(inMessage);
+  }
+
+private:
+  const std::string mName;
+  CallLog* const mLog;  // not owned; may be null
+  Action mAction;
+  const std::shared_ptr<Probe> mProbe;
+};
+
+// A Tarn::Listener that records its calls. It can detach itself from chosen
+// broadcasters in its own destructor, before its derived part is gone: a
+// listener that a worker may destroy while the main thread delivers to it
+// needs that, since ~Listener would detach only after this class's members
+// (the action, the name) were destroyed.
+class RecordingListener : public Tarn::Listener, public CallRecorder {
+public:
+  explicit RecordingListener(std::string inName, CallLog* inLog = nullptr)
+      : CallRecorder(std::move(inName), inLog) {}
+  ~RecordingListener() override {
+    for (Tarn::Broadcaster* broadcaster : mDetachOnDestroy) broadcaster->RemoveListener(this, true);
+  }
+
+  void ListenToMessage(const Tarn::Message& inMessage) override { RecordCall(inMessage); }
+
+  // In the destructor, remove this listener from inBroadcaster first (which
+  // waits, on a worker, for a delivery in progress). inBroadcaster must
+  // outlive this listener.
+  void DetachInDestructor(Tarn::Broadcaster& inBroadcaster) {
+    for (Tarn::Broadcaster* broadcaster : mDetachOnDestroy)
+      if (broadcaster == &inBroadcaster) return;
+    mDetachOnDestroy.push_back(&inBroadcaster);
+  }
+
+private:
+  std::vector<Tarn::Broadcaster*> mDetachOnDestroy;  // owned by the thread that destroys the listener
+};
+
+// A counted safe listener that records its calls. Create it with new and
+// hold it in a Tarn::ISafeListenerRef at once; it is deleted with its last
+// reference. LiveCount() counts the objects of this class not yet deleted.
+class CountedSafeListener : public Tarn::SafeListenerBase, public CallRecorder {
+public:
+  explicit CountedSafeListener(std::string inName, CallLog* inLog = nullptr)
+      : CallRecorder(std::move(inName), inLog) {
+    sLive.fetch_add(1);
+  }
+
+  void ListenToMessage(const Tarn::Message& inMessage) override { RecordCall(inMessage); }
+
+  // The object's reference count as its weak-reference block holds it.
+  std::int32_t RefCount() { return GetWeakReference()->mRefCount.load(); }
+  static int LiveCount() { return sLive.load(); }
+
+protected:
+  ~CountedSafeListener() override { sLive.fetch_sub(1); }
+
+private:
+  static inline std::atomic<int> sLive{0};
+};
+
+// The four ways a broadcaster can hold a listener.
+enum class ListenerKind { kPlainPointer, kBoostWeak, kStdWeak, kSafe };
+constexpr ListenerKind kAllListenerKinds[] = {ListenerKind::kPlainPointer, ListenerKind::kBoostWeak,
+                                              ListenerKind::kStdWeak, ListenerKind::kSafe};
+// The kinds whose listener has a shared owner that can let go of it while it
+// is registered (a plain-pointer listener detaches itself when it dies).
+constexpr ListenerKind kSharedListenerKinds[] = {ListenerKind::kBoostWeak, ListenerKind::kStdWeak,
+                                                 ListenerKind::kSafe};
+
+inline const char* KindName(ListenerKind inKind) {
+  switch (inKind) {
+    case ListenerKind::kPlainPointer:
+      return "PlainPointer";
+    case ListenerKind::kBoostWeak:
+      return "BoostWeak";
+    case ListenerKind::kStdWeak:
+      return "StdWeak";
+    case ListenerKind::kSafe:
+      return "Safe";
+  }
+  return "?";
+}
+
+// One recording listener held the way inKind says, so that one test body can
+// run for every kind. The handle owns the listener: a plain-pointer listener
+// outright, a weak one through the owning shared pointer, a safe one through
+// the host's counted reference. Attach and Detach use the overload of the
+// kind; Destroy ends the listener the way its owner would (delete, last
+// owner gone, last reference released) without detaching it first.
+//
+// A plain-pointer listener detaches itself in its destructor from every
+// broadcaster it was attached to, so those broadcasters must outlive it (or
+// it must be detached first).
+class AnyListener {
+public:
+  AnyListener(ListenerKind inKind, std::string inName, CallLog* inLog = nullptr) : mKind(inKind) {
+    switch (inKind) {
+      case ListenerKind::kPlainPointer:
+        mPlain = std::make_unique<RecordingListener>(std::move(inName), inLog);
+        mRecorder = mPlain.get();
+        break;
+      case ListenerKind::kBoostWeak:
+        mBoost = boost::shared_ptr<RecordingListener>(new RecordingListener(std::move(inName), inLog));
+        mRecorder = mBoost.get();
+        break;
+      case ListenerKind::kStdWeak:
+        mStd = std::make_shared<RecordingListener>(std::move(inName), inLog);
+        mRecorder = mStd.get();
+        break;
+      case ListenerKind::kSafe: {
+        auto* object = new CountedSafeListener(std::move(inName), inLog);
+        mRecorder = object;
+        mSafe = Tarn::ISafeListenerRef(object);
+        break;
+      }
+    }
+    mProbe = mRecorder->GetProbe();
+  }
+  AnyListener(const AnyListener&) = delete;
+  AnyListener& operator=(const AnyListener&) = delete;
+  ~AnyListener() { Destroy(); }
+
+  ListenerKind Kind() const { return mKind; }
+  int Calls() const { return mProbe->mCalls.load(); }
+  bool IsDestroyed() const { return mProbe->mDestroyed.load(); }
+  const std::shared_ptr<CallRecorder::Probe>& GetProbe() const { return mProbe; }
+  // Set before attaching; see CallRecorder::SetAction.
+  void SetAction(CallRecorder::Action inAction) { mRecorder->SetAction(std::move(inAction)); }
+
+  void Attach(Tarn::Broadcaster& inBroadcaster) {
+    switch (mKind) {
+      case ListenerKind::kPlainPointer:
+        inBroadcaster.AddListener(mPlain.get());
+        mPlain->DetachInDestructor(inBroadcaster);
+        break;
+      case ListenerKind::kBoostWeak:
+        inBroadcaster.AddListener(boost::weak_ptr<Tarn::Listener>(mBoost));
+        break;
+      case ListenerKind::kStdWeak:
+        inBroadcaster.AddListener(std::weak_ptr<Tarn::Listener>(mStd));
+        break;
+      case ListenerKind::kSafe:
+        inBroadcaster.AddListener(mSafe);
+        break;
+    }
+  }
+  void Detach(Tarn::Broadcaster& inBroadcaster) {
+    switch (mKind) {
+      case ListenerKind::kPlainPointer:
+        inBroadcaster.RemoveListener(mPlain.get(), true);
+        break;
+      case ListenerKind::kBoostWeak:
+        inBroadcaster.RemoveListener(boost::weak_ptr<Tarn::Listener>(mBoost));
+        break;
+      case ListenerKind::kStdWeak:
+        inBroadcaster.RemoveListener(std::weak_ptr<Tarn::Listener>(mStd));
+        break;
+      case ListenerKind::kSafe:
+        inBroadcaster.RemoveListener(mSafe);
+        break;
+    }
+  }
+  // A callable that detaches the listener from inBroadcaster without
+  // touching this handle, for a handler that removes its own listener while
+  // another thread may be destroying the handle. Call it only while the
+  // listener is alive (from its own handler, for instance).
+  std::function<void()> MakeDetacher(Tarn::Broadcaster& inBroadcaster) const {
+    Tarn::Broadcaster* const broadcaster = &inBroadcaster;
+    switch (mKind) {
+      case ListenerKind::kPlainPointer:
+        return [broadcaster, listener = mPlain.get()] { broadcaster->RemoveListener(listener, true); };
+      case ListenerKind::kBoostWeak:
+        return [broadcaster, listener = boost::weak_ptr<Tarn::Listener>(mBoost)] {
+          broadcaster->RemoveListener(listener);
+        };
+      case ListenerKind::kStdWeak:
+        return [broadcaster, listener = std::weak_ptr<Tarn::Listener>(mStd)] { broadcaster->RemoveListener(listener); };
+      case ListenerKind::kSafe:
+        return [broadcaster, listener = mSafe.get()] { broadcaster->RemoveListener(Tarn::ISafeListenerRef(listener)); };
+    }
+    return [] {};
+  }
+  // Ends the handle's ownership. The listener itself may live on for a
+  // delivery in progress (weak and safe kinds); IsDestroyed tells.
+  void Destroy() {
+    mRecorder = nullptr;
+    mPlain.reset();
+    mBoost.reset();
+    mStd.reset();
+    mSafe = nullptr;
+  }
+
+private:
+  const ListenerKind mKind;
+  CallRecorder* mRecorder = nullptr;  // the listener's recording part, while owned
+  std::unique_ptr<RecordingListener> mPlain;
+  boost::shared_ptr<RecordingListener> mBoost;
+  std::shared_ptr<RecordingListener> mStd;
+  Tarn::ISafeListenerRef mSafe;
+  std::shared_ptr<CallRecorder::Probe> mProbe;  // outlives the listener
+};
+
+// Names gtest parameterised suites over ListenerKind.
+struct KindParamName {
+  std::string operator()(const ::testing::TestParamInfo<ListenerKind>& inInfo) const {
+    return KindName(inInfo.param);
+  }
+};
+
+}  // namespace messaging_test
