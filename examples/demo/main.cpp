@@ -1,0 +1,34 @@
+// tarn-demo: a small host application for TarnMessaging. Run it with --help
+// for what it does and its options; DemoHost.cpp is the place to start
+// reading.
+#include "DemoHost.h"
+#include "DemoOptions.h"
+#include "Summary.h"
+
+#include <cstdio>
+#include <string>
+
+int main(int argc, char** argv) {
+  tarn_demo::DemoOptions options;
+  std::string error;
+  switch (tarn_demo::ParseDemoOptions(argc, argv, options, error)) {
+    case tarn_demo::ParseResult::kHelp:
+      tarn_demo::PrintDemoHelp(stdout);
+      return 0;
+    case tarn_demo::ParseResult::kError:
+      std::fprintf(stderr, "tarn-demo: %s\nTry 'tarn-demo --help' for the options.\n", error.c_str());
+      return 2;
+    case tarn_demo::ParseResult::kRun:
+      break;
+  }
+
+  tarn_demo::DemoSummary summary = tarn_demo::RunDemo(options);
+  tarn_demo::CheckSummary(summary);
+  if (options.mJson) {
+    tarn_demo::PrintSummaryJson(summary, stdout);
+  } else {
+    tarn_demo::PrintSummaryTable(summary, stdout);
+  }
+  // A lost or duplicated message, a leak, or any other failed check.
+  return summary.mFaults.empty() ? 0 : 1;
+}
