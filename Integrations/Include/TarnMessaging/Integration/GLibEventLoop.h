@@ -1,0 +1,158 @@
+/// @file
+/// Tarn::Integration::GLibEventLoop: delivers messages posted to the main
+/// thread from a GLib main context that the main thread iterates.
+///
+/// @code{.cpp}
+///   Tarn::Messaging::Initialize();                       // this thread is the main thread
+///   GMainLoop* loop = g_main_loop_new(nullptr, FALSE);   // the global default context
+///   Tarn::Integration::GLibEventLoop messaging(nullptr);
+///   // any thread: Tarn::StationUtils::PostMessageToUIThread(station, Progress(1, 2), false);
+///   g_main_loop_run(loop);                               // posted messages are delivered in here
+/// @endcode
+///
+/// While the object lives, the first call queued for the main thread after a
+/// run attaches one idle source to the context, and its dispatch runs every
+/// call pending by then: a burst of posted messages costs one source, not one
+/// per message (PendingCallRunner.h explains the coalescing). ScheduledRuns()
+/// counts the sources attached.
+///
+/// The source is attached explicitly rather than through
+/// g_main_context_invoke: invoke runs the function at once, on the calling
+/// thread, whenever that thread can acquire the context, which a worker can
+/// for the global default context while the main thread is not iterating it,
+/// and a run of the pending calls off the main thread would deliver nothing.
+/// From the main thread itself, invoke would run the calls inside
+/// PostMessageToUIThread, which a post with inForceAsync must not do.
+///
+/// Threading: construct and destroy the object on the main thread, after
+/// Tarn::Messaging::Initialize and before the last Tarn::Messaging::Terminate.
+/// Iterate the context on the main thread only. Messages may be posted from
+/// any thread; the wakeup runs on the posting thread, takes no lock unless it
+/// attaches a source, and never blocks on the main thread. An exception thrown
+/// by a pending call must not unwind through GLib's C frames: it goes to
+/// kivcore's error manager, the calls behind it stay queued and a new source is
+/// attached for them.
+///
+/// Ownership: the object holds a reference on the context (g_main_context_ref)
+/// from construction to destruction. The main thread's queue has one wakeup
+/// handler for the whole process, so keep one integration (of any kind) at a
+/// time. The destructor removes the wakeup handler, destroys the sources it
+/// attached that have not run yet, and runs the calls still pending, so that
+/// nothing posted before it is lost.
+#pragma once
+
+#include <TarnMessaging/Integration/PendingCallRunner.h>
+
+#include <glib.h>
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <vector>
+
+namespace Tarn::Integration {
+
+/// Runs the main thread's pending calls, and with them the messages posted
+/// with Tarn::StationUtils::PostMessageToUIThread, from a GLib main context
+/// iterated by the main thread, one idle source per burst of posts.
+///
+/// Construct and destroy on the main thread after Tarn::Messaging::Initialize
+/// and before the last Tarn::Messaging::Terminate; iterate the context on the
+/// main thread only. Holds a reference on the context while it lives. Only
+/// one event-loop integration may exist at a time.
+class GLibEventLoop {
+public:
+  /// Installs the wakeup handler for inContext (null: the global default
+  /// context) and, when calls are already pending, attaches a source for
+  /// them. inPriority is the priority of the sources attached
+  /// (G_PRIORITY_DEFAULT, like g_main_context_invoke, by default).
+  /// Precondition: a main thread is registered (Tarn::Messaging::Initialize
+  /// has run); otherwise throws std::logic_error.
+  explicit GLibEventLoop(GMainContext* inContext, int inPriority = G_PRIORITY_DEFAULT)
+      : mRunner(std::make_shared<Runner>(inContext != nullptr ? inContext : g_main_context_default(), inPriority)) {
+    mRunner->Install();
+  }
+
+  /// Removes the wakeup handler, runs on the calling (main) thread every call
+  /// still pending, and drops the reference on the context. Exceptions of
+  /// those calls go to kivcore's error manager.
+  ~GLibEventLoop() { mRunner->Uninstall(); }
+
+  GLibEventLoop(const GLibEventLoop&) = delete;
+  GLibEventLoop& operator=(const GLibEventLoop&) = delete;
+
+  /// Number of sources attached to the context so far. Any thread.
+  std::uint64_t ScheduledRuns() const noexcept { return mRunner->ScheduledRuns(); }
+
+private:
+  class Runner : public PendingCallRunner {
+  public:
+    Runner(GMainContext* inContext, int inPriority) : mContext(g_main_context_ref(inContext)), mPriority(inPriority) {}
+    ~Runner() override {
+      // Uninstall has normally destroyed the sources and dropped the context.
+      DestroySources();
+      if (mContext != nullptr) g_main_context_unref(mContext);
+    }
+
+  private:
+    // On the thread iterating the context. The runner is alive: Uninstall
+    // destroys every source still attached before the runner can go.
+    static gboolean Dispatch(gpointer inRunner) {
+      auto* runner = static_cast<Runner*>(inRunner);
+      {
+        // Taking the lock also orders this thread after the posting thread
+        // for ThreadSanitizer, which does not see GLib's own locks.
+        std::lock_guard<std::mutex> lock(runner->mSourcesMutex);
+        runner->ForgetSource(g_main_current_source());
+      }
+      runner->RunPending(kToErrorManager);
+      return G_SOURCE_REMOVE;
+    }
+
+    void PostRun() override {
+      std::lock_guard<std::mutex> lock(mSourcesMutex);
+      // The only step that can throw comes before the source exists.
+      mSources.reserve(mSources.size() + 1);
+      GSource* source = g_idle_source_new();
+      g_source_set_priority(source, mPriority);
+      g_source_set_name(source, "Tarn::Integration::GLibEventLoop");
+      g_source_set_callback(source, &Dispatch, this, nullptr);
+      mSources.push_back(source);  // our reference, dropped by ForgetSource or DestroySources
+      g_source_attach(source, mContext);
+    }
+
+    void ForgetLoop() noexcept override {
+      DestroySources();
+      g_main_context_unref(mContext);
+      mContext = nullptr;
+    }
+
+    // mSourcesMutex held.
+    void ForgetSource(GSource* inSource) noexcept {
+      for (auto it = mSources.begin(); it != mSources.end(); ++it) {
+        if (*it != inSource) continue;
+        g_source_unref(inSource);  // GLib holds its own reference while it dispatches
+        mSources.erase(it);
+        return;
+      }
+    }
+
+    void DestroySources() noexcept {
+      std::lock_guard<std::mutex> lock(mSourcesMutex);
+      for (GSource* source : mSources) {
+        g_source_destroy(source);
+        g_source_unref(source);
+      }
+      mSources.clear();
+    }
+
+    GMainContext* mContext;  // a counted reference; guarded by the runner's mutex; null after ForgetLoop
+    const int mPriority;
+    std::mutex mSourcesMutex;
+    std::vector<GSource*> mSources;  // attached, not yet dispatched, one reference each; guarded by mSourcesMutex
+  };
+
+  std::shared_ptr<Runner> mRunner;
+};
+
+}  // namespace Tarn::Integration
