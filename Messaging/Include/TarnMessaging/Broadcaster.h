@@ -169,7 +169,7 @@ private:
   // inUnlink drops this broadcaster from that listener's back-links once the
   // entry is out and before any wait, while a running delivery still keeps
   // the listener in existence.
-  void RemoveEntry(const ListenerEntry& inEntry, Listener* inUnlink = nullptr);
+  void RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink = nullptr);
   // Linear search from the front (newest); the position, or -1 when absent.
   // mMutex must be held.
   std::int32_t FindEntry(const ListenerEntry& inEntry) const noexcept;

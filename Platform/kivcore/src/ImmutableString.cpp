@@ -70,6 +70,7 @@ void Release(Rep* inRep) noexcept {
 
 ImmutableString::ImmutableString(const ImmutableString& inOther) noexcept : mRep(inOther.mRep) { AddRef(mRep); }
 
+// NOLINTNEXTLINE(bugprone-unhandled-self-assignment): the reference is raised before the old one drops.
 ImmutableString& ImmutableString::operator=(const ImmutableString& inOther) noexcept {
   // Raise first: inOther may be this string, or hold the last reference to
   // the same Rep through another object.

@@ -106,7 +106,7 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
     std::lock_guard<std::mutex> lock(state.mutex);
     // The calls not yet run were queued before anything queued since, so
     // they go back in front of it.
-    state.queue.insert(state.queue.begin(), std::make_move_iterator(batch->begin() + next + 1),
+    state.queue.insert(state.queue.begin(), std::make_move_iterator(batch->begin() + static_cast<std::ptrdiff_t>(next + 1)),
                        std::make_move_iterator(batch->end()));
     throw;
   }

@@ -41,7 +41,7 @@ constexpr bool kBypassPools = false;
 
 constexpr std::size_t kGranule = 16;
 constexpr std::size_t kClassCount = SmallBlockAllocator::kMaxSmallSize / kGranule;
-constexpr std::size_t kChunkSize = 64 * 1024;
+constexpr std::size_t kChunkSize = std::size_t{64} * 1024;
 
 struct Block {
   Block* next;

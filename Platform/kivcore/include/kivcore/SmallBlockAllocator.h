@@ -67,14 +67,17 @@ public:
     STLAllocator(const STLAllocator<U>&) noexcept {}
     /// Storage for inCount elements; throws std::bad_alloc when none is left.
     T* allocate(std::size_t inCount) {
-      if (inCount > static_cast<std::size_t>(-1) / sizeof(T)) throw std::bad_alloc();
-      void* block = SmallBlockAllocator::Allocate(inCount * sizeof(T));
+      // A named constant: T is often a pointer, and sizeof on it is meant.
+      constexpr std::size_t kElementSize = sizeof(T);
+      if (inCount > static_cast<std::size_t>(-1) / kElementSize) throw std::bad_alloc();
+      void* block = SmallBlockAllocator::Allocate(inCount * kElementSize);
       if (block == nullptr) throw std::bad_alloc();
       return static_cast<T*>(block);
     }
     /// Returns storage from allocate, with the same inCount.
     void deallocate(T* inBlock, std::size_t inCount) noexcept {
-      SmallBlockAllocator::Dispose(inBlock, inCount * sizeof(T));
+      constexpr std::size_t kElementSize = sizeof(T);
+      SmallBlockAllocator::Dispose(inBlock, inCount * kElementSize);
     }
     /// The allocator of another element type.
     template <class U>
