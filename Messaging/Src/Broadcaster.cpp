@@ -93,7 +93,7 @@ Broadcaster::Broadcaster(const Broadcaster& inOther) : mBroadcasting(inOther.IsB
 
 Broadcaster::~Broadcaster() {
   for (const ListenerEntry& entry : mListeners) {
-    if (entry.mListener != nullptr) entry.mListener->RemoveBroadcaster(this);
+    if (entry.mListener != nullptr) entry.mListener->ForgetBroadcaster(this);
   }
 }
 

@@ -65,6 +65,12 @@ void Listener::AddBroadcaster(Broadcaster* inBroadcaster) {
 
 void Listener::RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept {
   BroadcastersLock lock(mBroadcastersBusy);
+  const auto found = std::find(mBroadcasters.begin(), mBroadcasters.end(), inBroadcaster);
+  if (found != mBroadcasters.end()) mBroadcasters.erase(found);
+}
+
+void Listener::ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept {
+  BroadcastersLock lock(mBroadcastersBusy);
   mBroadcasters.remove(inBroadcaster);
 }
 

@@ -31,6 +31,10 @@ struct StationRecord {
   Station* mStation;           // owned; null until made
   std::uint32_t mRetainCount;
   bool mDisposeRequested;
+  // Set while the factory runs. A station whose construction fails is
+  // destroyed inside the factory, and its destructor looks its own ID up:
+  // that lookup must not call the factory again (it would recurse for ever).
+  bool mMaking = false;
 };
 
 // Keys compare by identity (interned handles), never by text.
@@ -111,7 +115,12 @@ PendingStationList& GetPendingStationList() {
 // registry's lock must be held; the record keeps its address while the
 // factory runs (a map node does not move).
 Station* MakeStation(StationRecord& ioRecord) {
-  if (ioRecord.mStation == nullptr && ioRecord.mFactory != nullptr) {
+  if (ioRecord.mStation == nullptr && ioRecord.mFactory != nullptr && !ioRecord.mMaking) {
+    ioRecord.mMaking = true;
+    struct MakingReset {
+      bool& mFlag;
+      ~MakingReset() { mFlag = false; }
+    } reset{ioRecord.mMaking};
     ioRecord.mStation = ioRecord.mFactory(ioRecord.mStationID);
   }
   return ioRecord.mStation;
@@ -125,7 +134,7 @@ void RegisterStation(const ImmutableString& inStationID, StationFactory inFactor
   RegistryLock lock("StationRegistry::RegisterStation");
   StationMapAccess map;
   map->try_emplace(inStationID,
-                   StationRecord{inStationID, inFactory != nullptr ? inFactory : &DefaultStationFactory, nullptr, 0, false});
+                   StationRecord{inStationID, inFactory != nullptr ? inFactory : &DefaultStationFactory, nullptr, 0, false, false});
 }
 
 void RegisterStation(Station* inStation) {
@@ -133,7 +142,7 @@ void RegisterStation(Station* inStation) {
   RegistryLock lock("StationRegistry::RegisterStation");
   StationMapAccess map;
   const ImmutableString stationID = inStation->GetStationID();
-  map->try_emplace(stationID, StationRecord{stationID, nullptr, inStation, 0, false});
+  map->try_emplace(stationID, StationRecord{stationID, nullptr, inStation, 0, false, false});
 }
 
 ImmutableString UniqueStationID() {

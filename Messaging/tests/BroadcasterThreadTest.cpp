@@ -475,6 +475,49 @@ TEST_P(BroadcasterThreadKinds, WorkerRemovalAfterTheHandlerRemovedItselfStillWai
   EXPECT_FALSE(mBroadcaster.HasListeners());
 }
 
+// A handler re-adds its listener while a worker removes it. Whichever order
+// the worker's back-link update and the re-add land in, the listener must end
+// registered exactly when it lists the broadcaster: a registration without its
+// back-link outlives the listener, and the next broadcast calls freed memory.
+TEST_F(BroadcasterThreads, HandlerReaddingItselfWhileAWorkerRemovesItKeepsItsBackLink) {
+  for (int round = 0; round < 50; ++round) {
+    SCOPED_TRACE(round);
+    GateWatch::Get().Reset();
+    auto listener = std::make_unique<RecordingListener>("L");
+    Latch entered;
+    bool first = true;
+    listener->SetAction([&](const Tarn::Message&) {
+      if (!first) return;
+      first = false;
+      entered.CountDown();
+      // Odd rounds re-add once the remover waits for this delivery; even
+      // rounds as soon as its entry is gone, racing its back-link update.
+      if (round % 2 == 1) {
+        ASSERT_TRUE(GateWatch::Get().WaitForWaiters(1));
+      } else {
+        ASSERT_TRUE(messaging_test::WaitUntil([&] { return !mBroadcaster.HasListener(listener.get()); }));
+      }
+      mBroadcaster.AddListener(listener.get());
+    });
+    mBroadcaster.AddListener(listener.get());
+    {
+      ThreadGroup worker;
+      worker.Start([&] {
+        ASSERT_TRUE(entered.WaitFor());
+        mBroadcaster.RemoveListener(listener.get(), true);
+      });
+      mBroadcaster.BroadcastMessage(PingMessage());
+      worker.JoinAll();
+    }
+    ASSERT_EQ(mBroadcaster.HasListener(listener.get()), listener->HasBroadcaster(&mBroadcaster));
+    // Destroying the listener detaches it through its back-links; nothing of
+    // it may be left for the next broadcast to call.
+    listener.reset();
+    EXPECT_FALSE(mBroadcaster.HasListeners());
+    mBroadcaster.BroadcastMessage(PingMessage());
+  }
+}
+
 // ---------------------------------------------------------------------------
 // What does not wait
 

@@ -343,6 +343,36 @@ TEST_F(StationRegistryTest, FactoryThrowingPassesTheExceptionOnWithTheRegistryUn
   EXPECT_EQ(ThrowingFactory::sCalls, 3);
 }
 
+// A station whose own constructor fails is destroyed inside its factory, and
+// the destructor's lookup of its ID must not call that factory again: it used
+// to recurse until the stack overflowed.
+struct StationFailingConstruction : Tarn::Station {
+  static inline std::atomic<int> sAttempts{0};
+  explicit StationFailingConstruction(const ImmutableString& inStationID) : Tarn::Station(inStationID) {
+    sAttempts.fetch_add(1);
+    throw std::runtime_error("station construction failed");
+  }
+  static Tarn::Station* Make(const ImmutableString& inStationID) {
+    return new StationFailingConstruction(inStationID);
+  }
+};
+
+TEST_F(StationRegistryTest, StationWhoseConstructionFailsIsNotMadeAgainByItsOwnDestructor) {
+  StationFailingConstruction::sAttempts = 0;
+  const ImmutableString id = Registry::UniqueStationID();
+  Registry::RegisterStation(id, &StationFailingConstruction::Make);
+
+  EXPECT_THROW(Registry::RetainStation(id), std::runtime_error);
+  EXPECT_EQ(StationFailingConstruction::sAttempts.load(), 1);
+  EXPECT_THROW(Registry::FindStation(id), std::runtime_error);
+  EXPECT_EQ(StationFailingConstruction::sAttempts.load(), 2);
+
+  // The failed retain was taken back, so a disposal removes the record at once.
+  Registry::DisposeStation(id);
+  EXPECT_EQ(Registry::FindStation(id), nullptr);
+  EXPECT_EQ(StationFailingConstruction::sAttempts.load(), 2);
+}
+
 // ---------------------------------------------------------------------------
 // Terminate
 

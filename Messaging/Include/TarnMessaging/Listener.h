@@ -84,8 +84,13 @@ private:
   using BroadcasterList = std::list<Broadcaster*, kivcore::utility::SmallBlockAllocator::STLAllocator<Broadcaster*>>;
 
   // For Broadcaster only: record / forget a plain-pointer registration.
+  // RemoveBroadcaster drops one record, so that a removal whose back-link
+  // update lands after the listener was added again (a handler re-adding
+  // itself while a worker removes it) leaves the new registration's record.
   void AddBroadcaster(Broadcaster* inBroadcaster);
   void RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept;
+  // Drops every record of a broadcaster that is being destroyed.
+  void ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept;
 
   // Broadcasters holding this listener by plain pointer, in attach order.
   // Guarded by mBroadcastersBusy: a broadcaster on another thread (one being
