@@ -1,7 +1,11 @@
 # The two entry points of the project, around scripts/setup.sh and the CMake
 # presets:
 #   make demo   set up, build, and run the demo host application
-#   make test   set up, build, and run every test (plus the sanitizer runs)
+#   make test   set up, build, and run every test: the normal build, the
+#               threaded tests under ThreadSanitizer, the whole suite under
+#               AddressSanitizer, and the fuzzer for FUZZ_SECONDS
+#   make bench  the benchmarks against the peer libraries
+#   make fuzz   the fuzzer alone (FUZZ_SECONDS=600 make fuzz for longer)
 # WERROR=ON turns warnings into errors (CI does this).
 
 WERROR ?= OFF
@@ -9,8 +13,9 @@ JOBS ?= 2
 CONFIGURE = cmake --preset $(1) -DTARN_WERROR=$(WERROR) > /dev/null
 BUILD = cmake --build --preset $(1) -j $(JOBS)
 DEMO_ARGS ?=
+FUZZ_SECONDS ?= 60
 
-.PHONY: setup build demo test test-default test-tsan test-asan bench clean
+.PHONY: setup build demo test test-default test-tsan test-asan fuzz bench docs lint clean
 
 setup:
 	./scripts/setup.sh
@@ -22,7 +27,7 @@ build: setup
 demo: build
 	./build/default/examples/tarn-demo $(DEMO_ARGS)
 
-test: test-default test-tsan test-asan
+test: test-default test-tsan test-asan fuzz
 
 test-default: build
 	ctest --preset default
@@ -40,8 +45,20 @@ test-asan: setup
 	$(call BUILD,asan)
 	ASAN_OPTIONS="detect_leaks=1" UBSAN_OPTIONS="print_stacktrace=1" ctest --preset asan
 
+# The operations fuzzer (clang, libFuzzer, AddressSanitizer); skipped with a
+# message where clang is missing.
+fuzz: setup
+	@if command -v clang++ > /dev/null; then ./fuzz/run.sh $(FUZZ_SECONDS); \
+	else echo "fuzz: clang++ not found, fuzzer skipped (apt-get install clang)"; fi
+
 bench: build
 	./bench/run.sh
+
+docs: build
+	cmake --build --preset default --target docs
+
+lint: build
+	cmake --build --preset default --target lint
 
 clean:
 	rm -rf build

@@ -15,6 +15,7 @@ optional=(
   libglib2.0-dev    # the GLib event-loop integration, its example and its tests
   doxygen           # the API reference: the docs target and the docs_build test
   clang-tidy        # the lint target
+  clang             # the fuzzer (libFuzzer) and the clang++ header check
 )
 
 installed() {
