@@ -16,6 +16,7 @@ optional=(
   doxygen           # the API reference: the docs target and the docs_build test
   clang-tidy        # the lint target
   clang             # the fuzzer (libFuzzer) and the clang++ header check
+  libsigc++-3.0-dev # one more peer row in the benchmarks
 )
 
 installed() {
