@@ -102,6 +102,14 @@ Broadcaster::~Broadcaster() {
 
 std::int32_t Broadcaster::FindEntry(const ListenerEntry& inEntry) const noexcept {
   const std::int32_t count = EntryCount();
+  if (inEntry.mListener != nullptr) {
+    // Every entry has one field set, so an entry holding this pointer is a
+    // plain one and equal to the probe: the pointer alone decides.
+    for (std::int32_t position = 0; position < count; ++position) {
+      if (EntryAt(position).mListener == inEntry.mListener) return position;
+    }
+    return -1;
+  }
   for (std::int32_t position = 0; position < count; ++position) {
     if (EntryAt(position) == inEntry) return position;
   }
@@ -363,9 +371,23 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
           plainCopied = true;
           break;
         }
-        // Test a copy: dropping the test's temporary reference may destroy the
-        // listener, whose destructor may change this registry (and move the
-        // cursor with the entry it stands on).
+        if (!atCursor.mSafeListener) {
+          // A weak pointer is tested with expired(), which takes no reference,
+          // so no listener can die here, under the lock. One that dies after
+          // the test is not called by its delivery and is pruned next time.
+          const bool live = atCursor.mBoostWeakListener.empty() ? !atCursor.mStdWeakListener.expired()
+                                                                : !atCursor.mBoostWeakListener.expired();
+          if (live) break;
+          // Prune as the cursor passes: the removal steps this cursor back one.
+          const ListenerEntry dead = atCursor;
+          RemoveEntry(dead);
+          cursor = ++mBroadcastCursors.back();
+          continue;
+        }
+        // A safe listener is resolved, which takes a reference. Test a copy:
+        // dropping the test's reference may destroy the listener, whose
+        // destructor may change this registry (and move the cursor with the
+        // entry it stands on).
         const ListenerEntry candidate = atCursor;
         if (candidate.IsLive()) {
           cursor = mBroadcastCursors.back();
@@ -383,6 +405,14 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
         mBroadcastCursors.pop_back();
         mDeliveries.pop_back();
         cursorPushed = false;
+        // Closing sweep, in the same hold of the lock: once no broadcast of
+        // this broadcaster runs any more, no delivery can be in progress, so
+        // any remover still waiting is released.
+        if (mBroadcastCursors.empty() && !mGateMap.empty()) {
+          for (auto& element : mGateMap) {
+            if (element.second.mCount != 0) element.second.mGate->Open();
+          }
+        }
         break;
       }
       if (!plainCopied) {
@@ -401,17 +431,6 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
 
     // No lock is held while the listener runs.
     errors->GuardedCall(delivery);
-  }
-  current = ListenerEntry();
-
-  // Closing sweep: once no broadcast of this broadcaster runs any more, no
-  // delivery can be in progress, so any remover still waiting is released.
-  mMutex.Lock("Broadcaster::BroadcastMessage2");
-  Unlocker unlock(mMutex);
-  if (mBroadcastCursors.empty() && !mGateMap.empty()) {
-    for (auto& element : mGateMap) {
-      if (element.second.mCount != 0) element.second.mGate->Open();
-    }
   }
 }
 
