@@ -165,13 +165,17 @@ bool CurrentThreadIsMainThread() noexcept {
   return id != 0 && id == CurrentThreadId();
 }
 
-bool AsyncCallFromMainThread(const boost::function<void()>& inCall, unsigned int /*inFlags*/) {
+bool AsyncCallFromMainThread(const boost::function<void()>& inCall, unsigned int inFlags) {
+  return AsyncCallFromMainThread(boost::function<void()>(inCall), inFlags);
+}
+
+bool AsyncCallFromMainThread(boost::function<void()>&& inCall, unsigned int /*inFlags*/) {
   if (inCall.empty()) return false;
   MainThreadState& state = State();
   WakeupHandler wakeup;
   {
     std::lock_guard<std::mutex> lock(state.mutex);
-    state.queue.push_back(inCall);
+    state.queue.push_back(std::move(inCall));
     if (state.waiters > 0) state.callQueued.notify_all();
     wakeup = state.wakeup;
   }

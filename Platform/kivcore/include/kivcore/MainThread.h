@@ -75,5 +75,8 @@ KIVCORE_API bool CurrentThreadIsMainThread() noexcept;
 /// Queues a copy of inCall to run once on the main thread. inFlags is
 /// reserved (pass 0). Returns true when the call was queued.
 KIVCORE_API bool AsyncCallFromMainThread(const boost::function<void()>& inCall, unsigned int inFlags);
+/// As above, moving inCall into the queue instead of copying it (one
+/// reference-count round trip less for a call that owns shared state).
+KIVCORE_API bool AsyncCallFromMainThread(boost::function<void()>&& inCall, unsigned int inFlags);
 
 }  // namespace kivcore::threads
