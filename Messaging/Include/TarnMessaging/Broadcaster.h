@@ -160,19 +160,19 @@ private:
   using DeliveryVector = std::vector<DeliverySlot, Alloc<DeliverySlot>>;
 
   struct BroadcastMessageRecord;
-  static int DeliverToListener(const BroadcastMessageRecord& inRecord);
+  TARN_MESSAGING_LOCAL static int DeliverToListener(const BroadcastMessageRecord& inRecord);
 
   // Inserts inEntry at the front unless an equal entry exists; true when
   // inserted.
-  bool AddEntry(const ListenerEntry& inEntry);
+  TARN_MESSAGING_LOCAL bool AddEntry(const ListenerEntry& inEntry);
   // The one removal path (also used to prune dead entries). A non-null
   // inUnlink drops this broadcaster from that listener's back-links once the
   // entry is out and before any wait, while a running delivery still keeps
   // the listener in existence.
-  void RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink = nullptr);
+  TARN_MESSAGING_LOCAL void RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink = nullptr);
   // Linear search from the front (newest); the position, or -1 when absent.
   // mMutex must be held.
-  std::int32_t FindEntry(const ListenerEntry& inEntry) const noexcept;
+  TARN_MESSAGING_LOCAL std::int32_t FindEntry(const ListenerEntry& inEntry) const noexcept;
   // The entry at a position counted from the front. mMutex must be held.
   const ListenerEntry& EntryAt(std::int32_t inPosition) const noexcept {
     return mListeners[mListeners.size() - 1 - static_cast<std::size_t>(inPosition)];

@@ -79,7 +79,7 @@ public:
   void ListenToMessage(const Message& inMessage) override;
 
 private:
-  static std::uint32_t NowMilliSeconds();
+  TARN_MESSAGING_LOCAL static std::uint32_t NowMilliSeconds();
 
   kivcore::utility::ImmutableString mStationID;
   bool mListeningForIdle = false;

@@ -87,10 +87,10 @@ private:
   // RemoveBroadcaster drops one record, so that a removal whose back-link
   // update lands after the listener was added again (a handler re-adding
   // itself while a worker removes it) leaves the new registration's record.
-  void AddBroadcaster(Broadcaster* inBroadcaster);
-  void RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept;
+  TARN_MESSAGING_LOCAL void AddBroadcaster(Broadcaster* inBroadcaster);
+  TARN_MESSAGING_LOCAL void RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept;
   // Drops every record of a broadcaster that is being destroyed.
-  void ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept;
+  TARN_MESSAGING_LOCAL void ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept;
 
   // Broadcasters holding this listener by plain pointer, in attach order.
   // Guarded by mBroadcastersBusy: a broadcaster on another thread (one being
