@@ -32,11 +32,11 @@ test: test-default test-tsan test-asan fuzz
 test-default: build
 	ctest --preset default
 
-# The threaded tests under ThreadSanitizer.
+# The threaded and randomized tests under ThreadSanitizer.
 test-tsan: setup
 	$(call CONFIGURE,tsan)
 	$(call BUILD,tsan)
-	TSAN_OPTIONS="halt_on_error=1 second_deadlock_stack=1" ctest --preset tsan -L threaded
+	TSAN_OPTIONS="halt_on_error=1 second_deadlock_stack=1" ctest --preset tsan -L "threaded|randomized"
 
 # The whole suite under AddressSanitizer, UndefinedBehaviorSanitizer and
 # LeakSanitizer.
