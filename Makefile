@@ -24,7 +24,10 @@ build: setup
 	$(call CONFIGURE,default)
 	$(call BUILD,default)
 
-demo: build
+# Builds only what the demo needs.
+demo: setup
+	$(call CONFIGURE,default)
+	cmake --build --preset default -j $(JOBS) --target tarn-demo
 	./build/default/examples/tarn-demo $(DEMO_ARGS)
 
 test: test-default test-tsan test-asan fuzz
