@@ -16,12 +16,14 @@
 /// protects it against nothing.
 ///
 /// Threading: every function may be called from any thread; one recursive
-/// lock serialises them. Factories and station destructors run with that lock
-/// held and may call the registry again on the same thread. DisposeStation
-/// deletes only on the main thread; elsewhere it queues the station for the
-/// next main-thread disposal (or static destruction). ReleaseStation deletes a
-/// station whose disposal is pending on whatever thread makes the last
-/// release. Terminate deletes on the calling thread, without the lock.
+/// lock serialises them. Factories, and the station destructors run by
+/// DisposeStation, run with that lock held and may call the registry again on
+/// the same thread. DisposeStation deletes only on the main thread; elsewhere
+/// it queues the station for the next main-thread disposal (or static
+/// destruction). ReleaseStation deletes a station whose disposal is pending on
+/// whatever thread makes the last release, after letting go of the lock (the
+/// destructor may wait for the main thread, whose handlers may need the
+/// registry). Terminate deletes on the calling thread, without the lock.
 #pragma once
 
 #include <TarnMessaging/Export.h>
