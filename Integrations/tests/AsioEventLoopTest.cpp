@@ -57,7 +57,7 @@ TEST_F(AsioEventLoopTest, EveryPostIsDeliveredOnceOnTheThreadRunningTheLoop) {
     WorkerGroup workers;
     for (int w = 0; w < kWorkers; ++w) workers.Start([this, w] { PostNumbered(mStation, w, 0, kPerWorker); });
     ASSERT_TRUE(RunWithDeadline(context)) << log.Total() << " of " << kWorkers * kPerWorker << " delivered";
-    workers.Join();
+    workers.JoinAll();
     // Whatever is still queued in the io_context must not deliver again.
     context.restart();
     context.poll();
@@ -86,7 +86,7 @@ TEST_F(AsioEventLoopTest, EachBurstPostedWhileTheLoopIsBusyCostsOneHandler) {
       WorkerGroup workers;
       for (int w = 0; w < kWorkers; ++w)
         workers.Start([this, w, round] { PostNumbered(mStation, w, round * kBurst, kBurst); });
-      workers.Join();
+      workers.JoinAll();
 
       context.restart();
       EXPECT_EQ(1u, context.poll()) << "round " << round << ": io_context handlers run";
@@ -128,7 +128,7 @@ TEST_F(AsioEventLoopTest, MessagesStillPendingAreDeliveredWhenTheIntegrationIsDe
     AsioEventLoop messaging(context);
     WorkerGroup workers;
     for (int w = 0; w < kWorkers; ++w) workers.Start([this, w] { PostNumbered(mStation, w, 0, kPerWorker); });
-    workers.Join();
+    workers.JoinAll();
     EXPECT_EQ(0, log.Total()) << "delivered before the loop ran";
     EXPECT_EQ(1u, messaging.ScheduledRuns());
   }
@@ -151,7 +151,7 @@ TEST_F(AsioEventLoopTest, MessagesPostedBeforeTheIntegrationExistedAreScheduledB
   {
     WorkerGroup workers;
     workers.Start([this] { PostNumbered(mStation, 0, 0, kPerWorker); });
-    workers.Join();
+    workers.JoinAll();
   }
   {
     AsioEventLoop messaging(context);
@@ -172,7 +172,7 @@ TEST_F(AsioEventLoopTest, AfterDestructionPostsNoLongerReachTheLoop) {
   {
     WorkerGroup workers;
     workers.Start([this] { PostNumbered(mStation, 0, 0, 1); });
-    workers.Join();
+    workers.JoinAll();
   }
   context.restart();
   EXPECT_EQ(0u, context.poll()) << "the wakeup handler outlived the integration";

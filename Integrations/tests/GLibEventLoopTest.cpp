@@ -88,7 +88,7 @@ TEST_F(GLibEventLoopTest, EveryPostIsDeliveredOnceOnTheThreadIteratingTheContext
     WorkerGroup workers;
     for (int w = 0; w < kWorkers; ++w) workers.Start([this, w] { PostNumbered(mStation, w, 0, kPerWorker); });
     ASSERT_TRUE(own.RunWithDeadline()) << log.Total() << " of " << kWorkers * kPerWorker << " delivered";
-    workers.Join();
+    workers.JoinAll();
     // Whatever source is still attached must not deliver again.
     own.Iterate();
 
@@ -116,7 +116,7 @@ TEST_F(GLibEventLoopTest, EachBurstPostedWhileTheLoopIsBusyCostsOneSource) {
       WorkerGroup workers;
       for (int w = 0; w < kWorkers; ++w)
         workers.Start([this, w, round] { PostNumbered(mStation, w, round * kBurst, kBurst); });
-      workers.Join();
+      workers.JoinAll();
 
       EXPECT_EQ(1, own.Iterate()) << "round " << round << ": iterations that dispatched";
       EXPECT_EQ((round + 1) * kWorkers * kBurst, log.Total()) << "round " << round;
@@ -159,7 +159,7 @@ TEST_F(GLibEventLoopTest, PostsToTheIdleDefaultContextAreDeliveredOnTheMainThrea
     GLibEventLoop messaging(nullptr);
     WorkerGroup workers;
     workers.Start([this] { PostNumbered(mStation, 0, 0, kPerWorker); });
-    workers.Join();
+    workers.JoinAll();
     EXPECT_EQ(0, log.Total()) << "delivered before the main thread iterated the context";
     EXPECT_EQ(static_cast<std::size_t>(kPerWorker), PendingCalls());
     OwnContext::IterateContext(g_main_context_default());
@@ -181,7 +181,7 @@ TEST_F(GLibEventLoopTest, MessagesStillPendingAreDeliveredWhenTheIntegrationIsDe
     GLibEventLoop messaging(own.Context());
     WorkerGroup workers;
     for (int w = 0; w < kWorkers; ++w) workers.Start([this, w] { PostNumbered(mStation, w, 0, kPerWorker); });
-    workers.Join();
+    workers.JoinAll();
     EXPECT_EQ(0, log.Total()) << "delivered before the context was iterated";
     EXPECT_EQ(1u, messaging.ScheduledRuns());
   }
@@ -202,7 +202,7 @@ TEST_F(GLibEventLoopTest, MessagesPostedBeforeTheIntegrationExistedAreScheduledB
   {
     WorkerGroup workers;
     workers.Start([this] { PostNumbered(mStation, 0, 0, kPerWorker); });
-    workers.Join();
+    workers.JoinAll();
   }
   {
     GLibEventLoop messaging(own.Context());
@@ -222,7 +222,7 @@ TEST_F(GLibEventLoopTest, AfterDestructionPostsNoLongerReachTheContext) {
   {
     WorkerGroup workers;
     workers.Start([this] { PostNumbered(mStation, 0, 0, 1); });
-    workers.Join();
+    workers.JoinAll();
   }
   EXPECT_EQ(0, own.Iterate()) << "the wakeup handler outlived the integration";
   EXPECT_EQ(0, log.Total());
@@ -260,7 +260,7 @@ TEST_F(GLibEventLoopTest, TheIntegrationKeepsItsContextAlive) {
     g_main_context_unref(context);  // the integration's reference is the last one now
     WorkerGroup workers;
     workers.Start([this] { PostNumbered(mStation, 0, 0, 1); });
-    workers.Join();
+    workers.JoinAll();
     EXPECT_EQ(1, OwnContext::IterateContext(context));
     EXPECT_EQ(1, log.Total());
   }

@@ -1,10 +1,10 @@
 // Shared pieces of the event-loop integration tests: a numbered message, a
 // listener that checks what it hears (each message exactly once, on the loop
-// thread, in each worker's order), a worker group whose join is bounded, and
+// thread, in each worker's order), the shared bounded-wait helpers, and
 // a fixture that brings the messaging library up on the test's thread.
 //
 // Threading: DeliveryLog may be called from any thread (a delivery on the
-// wrong thread is exactly what it must record safely). WorkerGroup::Join
+// wrong thread is exactly what it must record safely). WorkerGroup::JoinAll
 // aborts the test process, naming the test, when workers are still running
 // after the deadline, so that a deadlock fails instead of hanging.
 #pragma once
@@ -15,6 +15,8 @@
 #include <kivcore/MainThread.h>
 
 #include <gtest/gtest.h>
+
+#include "BoundedWait.h"
 
 #include <chrono>
 #include <condition_variable>
@@ -29,23 +31,16 @@
 
 namespace integration_test {
 
-// Long enough never to expire on a loaded machine under a sanitizer, short
-// enough to fail well inside the ctest timeout.
-constexpr std::chrono::seconds kDeadline{20};
+using tarn_test::kDeadline;
+using tarn_test::Watchdog;
+using WorkerGroup = tarn_test::ThreadGroup;
+
 
 struct Numbered : Tarn::MessageImpl<Numbered> {
   Numbered(int inWorker, int inSequence) : mWorker(inWorker), mSequence(inSequence) {}
   int mWorker;
   int mSequence;
 };
-
-[[noreturn]] inline void AbortNamingTheTest(const char* inWhy) {
-  const ::testing::TestInfo* test = ::testing::UnitTest::GetInstance()->current_test_info();
-  std::fprintf(stderr, "%s.%s: %s\n", test != nullptr ? test->test_suite_name() : "?",
-               test != nullptr ? test->name() : "?", inWhy);
-  std::fflush(stderr);
-  std::abort();
-}
 
 // Hears Numbered messages from inWorkers workers posting inPerWorker each.
 class DeliveryLog : public Tarn::Listener {
@@ -108,60 +103,6 @@ private:
   int mOutOfOrder = 0;             // guarded by mMutex
 };
 
-// Worker threads whose join is bounded by kDeadline.
-class WorkerGroup {
-public:
-  WorkerGroup() = default;
-  WorkerGroup(const WorkerGroup&) = delete;
-  WorkerGroup& operator=(const WorkerGroup&) = delete;
-  ~WorkerGroup() { Join(); }
-
-  void Start(std::function<void()> inBody) {
-    mThreads.emplace_back([this, body = std::move(inBody)] {
-      body();
-      std::lock_guard<std::mutex> lock(mMutex);
-      ++mFinished;
-      mChanged.notify_all();
-    });
-  }
-
-  void Join() {
-    {
-      std::unique_lock<std::mutex> lock(mMutex);
-      if (!mChanged.wait_for(lock, kDeadline, [this] { return mFinished == mThreads.size(); }))
-        AbortNamingTheTest("workers still running after the deadline (deadlock?)");
-    }
-    for (std::thread& thread : mThreads) thread.join();
-    mThreads.clear();
-    mFinished = 0;
-  }
-
-private:
-  std::vector<std::thread> mThreads;
-  std::mutex mMutex;
-  std::condition_variable mChanged;
-  std::size_t mFinished = 0;  // guarded by mMutex
-};
-
-// A one-shot signal with a bounded wait.
-class Signal {
-public:
-  void Raise() {
-    std::lock_guard<std::mutex> lock(mMutex);
-    mRaised = true;
-    mChanged.notify_all();
-  }
-  bool WaitFor(std::chrono::milliseconds inTimeout = kDeadline) {
-    std::unique_lock<std::mutex> lock(mMutex);
-    return mChanged.wait_for(lock, inTimeout, [this] { return mRaised; });
-  }
-
-private:
-  std::mutex mMutex;
-  std::condition_variable mChanged;
-  bool mRaised = false;  // guarded by mMutex
-};
-
 // Posts inCount Numbered messages of worker inWorker to inStation.
 inline void PostNumbered(const kivcore::utility::ImmutableString& inStation, int inWorker, int inFirst, int inCount) {
   for (int i = inFirst; i < inFirst + inCount; ++i)
@@ -209,35 +150,6 @@ private:
   kivcore::config::ErrorManager::ExceptionHandler mPrevious;
   mutable std::mutex mMutex;
   std::vector<std::exception_ptr> mExceptions;  // guarded by mMutex
-};
-
-// Aborts the process, naming the test, if it is still alive after inLimit:
-// a test whose main thread blocks (inside a post, a run or a loop) gets no
-// chance to run a bounded wait of its own.
-class Watchdog {
-public:
-  explicit Watchdog(std::chrono::seconds inLimit = 2 * kDeadline)
-      : mThread([this, inLimit] {
-          std::unique_lock<std::mutex> lock(mMutex);
-          if (!mChanged.wait_for(lock, inLimit, [this] { return mDone; }))
-            AbortNamingTheTest("still running after the watchdog's limit (deadlock?)");
-        }) {}
-  ~Watchdog() {
-    {
-      std::lock_guard<std::mutex> lock(mMutex);
-      mDone = true;
-      mChanged.notify_all();
-    }
-    mThread.join();
-  }
-  Watchdog(const Watchdog&) = delete;
-  Watchdog& operator=(const Watchdog&) = delete;
-
-private:
-  std::mutex mMutex;
-  std::condition_variable mChanged;
-  bool mDone = false;  // guarded by mMutex
-  std::thread mThread;
 };
 
 // The test's thread is the main thread for the length of the test, each test
