@@ -608,28 +608,7 @@ private:
 
 TEST(BroadcasterModelTest, RandomSequencesMatchTheModel) {
   messaging_test::MainThreadGuard mainThread;
-  const messaging_test::RandomRun run = messaging_test::RandomRun::FromEnvironment(10000, 0xb40adca5);
-  SequentialExecutor helper;
-  const std::size_t baselineBlocks = SmallBlockAllocator::GetStatistics().blocksInUse;
-  const auto start = std::chrono::steady_clock::now();
-  std::uint64_t steps = 0;
-  std::uint64_t index = 0;
-  for (; index < run.mSequences && !::testing::Test::HasFailure(); ++index) {
-    const std::uint64_t seed = run.SeedOf(index);
-    SCOPED_TRACE(messaging_test::ReplayHint(seed));
-    {
-      Sequence sequence(seed, helper);
-      const int length = Random(seed ^ 0x9e3779b97f4a7c15ull).Between(20, 60);
-      sequence.Run(length);
-      steps += static_cast<std::uint64_t>(length);
-      sequence.Finish();
-    }
-    ASSERT_EQ(SmallBlockAllocator::GetStatistics().blocksInUse, baselineBlocks) << "small blocks leaked by the sequence";
-  }
-  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-  std::printf("[ figures  ] %llu random broadcaster sequences (%llu steps) in %.2f s, first seed %llu\n",
-              static_cast<unsigned long long>(index), static_cast<unsigned long long>(steps), seconds,
-              static_cast<unsigned long long>(run.mFirstSeed));
+  messaging_test::RunRandomSequences<Sequence>("broadcaster", 10000, 0xb40adca5);
 }
 
 }  // namespace

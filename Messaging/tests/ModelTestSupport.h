@@ -243,4 +243,36 @@ private:
   std::thread mThread;  // last: starts once the members above exist
 };
 
+// Runs the seeded sequences of a model test, inSequences of them by default
+// (the environment may change the count and the first seed): each of 20 to 60
+// random steps, then its final checks; after each, no small block may be
+// left in use. Prints the figures. Sequence is made from (seed, helper) and
+// has Run(steps) and Finish().
+template <class Sequence>
+void RunRandomSequences(const char* inWhat, std::uint64_t inSequences, std::uint64_t inFirstSeed) {
+  const RandomRun run = RandomRun::FromEnvironment(inSequences, inFirstSeed);
+  SequentialExecutor helper;
+  const std::size_t baseline = kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse;
+  const auto start = std::chrono::steady_clock::now();
+  std::uint64_t steps = 0;
+  std::uint64_t index = 0;
+  for (; index < run.mSequences && !::testing::Test::HasFailure(); ++index) {
+    const std::uint64_t seed = run.SeedOf(index);
+    SCOPED_TRACE(ReplayHint(seed));
+    {
+      Sequence sequence(seed, helper);
+      const int length = Random(seed ^ 0x9e3779b97f4a7c15ull).Between(20, 60);
+      sequence.Run(length);
+      steps += static_cast<std::uint64_t>(length);
+      sequence.Finish();
+    }
+    ASSERT_EQ(kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse, baseline)
+        << "small blocks leaked by the sequence";
+  }
+  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+  std::printf("[ figures  ] %llu random %s sequences (%llu steps) in %.2f s, first seed %llu\n",
+              static_cast<unsigned long long>(index), inWhat, static_cast<unsigned long long>(steps), seconds,
+              static_cast<unsigned long long>(run.mFirstSeed));
+}
+
 }  // namespace messaging_test

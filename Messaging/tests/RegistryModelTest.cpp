@@ -763,26 +763,7 @@ protected:
 };
 
 TEST_F(RegistryModelTest, RandomSequencesMatchTheModel) {
-  const messaging_test::RandomRun run = messaging_test::RandomRun::FromEnvironment(10000, 0x7e617301);
-  SequentialExecutor helper;
-  const std::size_t baseline = SmallBlockAllocator::GetStatistics().blocksInUse;
-  const auto start = std::chrono::steady_clock::now();
-  std::uint64_t steps = 0;
-  std::uint64_t index = 0;
-  for (; index < run.mSequences && !HasFailure(); ++index) {
-    const std::uint64_t seed = run.SeedOf(index);
-    SCOPED_TRACE(messaging_test::ReplayHint(seed));
-    Sequence sequence(seed, helper);
-    const int length = Random(seed ^ 0x9e3779b97f4a7c15ull).Between(20, 60);
-    sequence.Run(length);
-    steps += static_cast<std::uint64_t>(length);
-    sequence.Finish();
-    ASSERT_EQ(SmallBlockAllocator::GetStatistics().blocksInUse, baseline) << "small blocks leaked by the sequence";
-  }
-  const double seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-  std::printf("[ figures  ] %llu random registry sequences (%llu steps) in %.2f s, first seed %llu\n",
-              static_cast<unsigned long long>(index), static_cast<unsigned long long>(steps), seconds,
-              static_cast<unsigned long long>(run.mFirstSeed));
+  messaging_test::RunRandomSequences<Sequence>("registry", 10000, 0x7e617301);
 }
 
 }  // namespace
