@@ -32,8 +32,8 @@ void IdleCountdownTimer::ArmTimer() {
     // attach does nothing. Marking the timer as listening all the same would
     // make every later ArmTimer skip the attach and leave the timer dead, so
     // the mark follows what actually happened.
-    const Station* idle = StationRegistry::FindStation(kStation_Idle);
-    mListeningForIdle = idle != nullptr && HasBroadcaster(const_cast<Station*>(idle));
+    Station* const idle = StationRegistry::FindStation(kStation_Idle);
+    mListeningForIdle = idle != nullptr && HasBroadcaster(idle);
   }
 }
 
