@@ -32,7 +32,9 @@ libdir=$(dirname "$(find "$prefix" -name 'libTarnMessaging.so*' -print -quit)")
 
 # The consumer must have resolved libTarnMessaging to the prefix.
 uses_prefix() {
-  ldd "$1" | grep -q "libTarnMessaging.so.* => $libdir/" || fail "$1 does not load libTarnMessaging from $libdir"
+  local loaded
+  loaded=$(ldd "$1") || fail "ldd $1"
+  grep -q "libTarnMessaging.so.* => $libdir/" <<< "$loaded" || fail "$1 does not load libTarnMessaging from $libdir"
 }
 
 step "find_package route"
