@@ -69,9 +69,9 @@ bool Verify(benchmark::State& ioState, bool inOk, const char* inWhat) {
 
 benchmark::internal::Benchmark* WithBestOf(benchmark::internal::Benchmark* ioBenchmark) {
   return ioBenchmark
-      ->ComputeStatistics("min", [](const std::vector<double>& inValues) {
-        return *std::min_element(inValues.begin(), inValues.end());
-      })
+      ->ComputeStatistics(
+          "min",
+          [](const std::vector<double>& inValues) { return *std::min_element(inValues.begin(), inValues.end()); })
       ->ComputeStatistics("max", [](const std::vector<double>& inValues) {
         return *std::max_element(inValues.begin(), inValues.end());
       });
@@ -141,8 +141,9 @@ namespace {
 
 void* CountedNew(std::size_t inSize, std::size_t inAlignment = 0) noexcept {
   const std::size_t size = inSize == 0 ? 1 : inSize;
-  void* block = inAlignment == 0 ? std::malloc(size)
-                                 : std::aligned_alloc(inAlignment, (size + inAlignment - 1) / inAlignment * inAlignment);
+  void* block = inAlignment == 0
+                    ? std::malloc(size)
+                    : std::aligned_alloc(inAlignment, (size + inAlignment - 1) / inAlignment * inAlignment);
   if (block != nullptr && TarnBench::gCountingScopes.load(std::memory_order_relaxed) != 0) {
     TarnBench::gAllocations.fetch_add(1, std::memory_order_relaxed);
     TarnBench::gBytes.fetch_add(static_cast<std::int64_t>(malloc_usable_size(block)), std::memory_order_relaxed);
@@ -170,7 +171,9 @@ std::size_t Size(std::align_val_t inAlignment) { return static_cast<std::size_t>
 TARN_BENCH_VISIBLE void* operator new(std::size_t inSize) { return CountedNewOrThrow(inSize); }
 TARN_BENCH_VISIBLE void* operator new[](std::size_t inSize) { return CountedNewOrThrow(inSize); }
 TARN_BENCH_VISIBLE void* operator new(std::size_t inSize, const std::nothrow_t&) noexcept { return CountedNew(inSize); }
-TARN_BENCH_VISIBLE void* operator new[](std::size_t inSize, const std::nothrow_t&) noexcept { return CountedNew(inSize); }
+TARN_BENCH_VISIBLE void* operator new[](std::size_t inSize, const std::nothrow_t&) noexcept {
+  return CountedNew(inSize);
+}
 TARN_BENCH_VISIBLE void* operator new(std::size_t inSize, std::align_val_t inAlign) {
   return CountedNewOrThrow(inSize, Size(inAlign));
 }
@@ -191,8 +194,12 @@ TARN_BENCH_VISIBLE void operator delete(void* inBlock, const std::nothrow_t&) no
 TARN_BENCH_VISIBLE void operator delete[](void* inBlock, const std::nothrow_t&) noexcept { CountedDelete(inBlock); }
 TARN_BENCH_VISIBLE void operator delete(void* inBlock, std::align_val_t) noexcept { CountedDelete(inBlock); }
 TARN_BENCH_VISIBLE void operator delete[](void* inBlock, std::align_val_t) noexcept { CountedDelete(inBlock); }
-TARN_BENCH_VISIBLE void operator delete(void* inBlock, std::size_t, std::align_val_t) noexcept { CountedDelete(inBlock); }
-TARN_BENCH_VISIBLE void operator delete[](void* inBlock, std::size_t, std::align_val_t) noexcept { CountedDelete(inBlock); }
+TARN_BENCH_VISIBLE void operator delete(void* inBlock, std::size_t, std::align_val_t) noexcept {
+  CountedDelete(inBlock);
+}
+TARN_BENCH_VISIBLE void operator delete[](void* inBlock, std::size_t, std::align_val_t) noexcept {
+  CountedDelete(inBlock);
+}
 TARN_BENCH_VISIBLE void operator delete(void* inBlock, std::align_val_t, const std::nothrow_t&) noexcept {
   CountedDelete(inBlock);
 }

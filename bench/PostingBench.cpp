@@ -99,10 +99,10 @@ private:
   }
 
   const int mPostsEach;
-  std::vector<std::uint8_t> mSeen;  // main thread
-  std::size_t mDistinct = 0;        // main thread
-  bool mExtra = false;              // a duplicate or unknown message; main thread
-  Clock::time_point mEnd;           // main thread
+  std::vector<std::uint8_t> mSeen;                // main thread
+  std::size_t mDistinct = 0;                      // main thread
+  bool mExtra = false;                            // a duplicate or unknown message; main thread
+  Clock::time_point mEnd;                         // main thread
   std::vector<Clock::time_point> mPostTimes;      // each slot written by its producer before the post
   std::vector<Clock::time_point> mDeliveryTimes;  // main thread
 };
@@ -157,7 +157,8 @@ private:
 // thread. Returns the seconds from the first post to the last delivery, or
 // -1 when the run did not complete in time.
 double RunProducers(int inProducers, int inPostsEach, bool inPaced, int inCpu, DeliveryRecord& ioRecord,
-                    const std::function<void(int, int)>& inPost, const std::function<void(Clock::time_point)>& inServe) {
+                    const std::function<void(int, int)>& inPost,
+                    const std::function<void(Clock::time_point)>& inServe) {
   std::atomic<bool> go{false};
   std::atomic<Clock::rep> firstPost{Clock::time_point::max().time_since_epoch().count()};
   std::vector<std::thread> threads;
@@ -167,7 +168,8 @@ double RunProducers(int inProducers, int inPostsEach, bool inPaced, int inCpu, D
       while (!go.load(std::memory_order_acquire)) std::this_thread::yield();
       const Clock::time_point start = Clock::now();
       Clock::rep first = firstPost.load();
-      while (start.time_since_epoch().count() < first && !firstPost.compare_exchange_weak(first, start.time_since_epoch().count())) {
+      while (start.time_since_epoch().count() < first &&
+             !firstPost.compare_exchange_weak(first, start.time_since_epoch().count())) {
       }
       for (int sequence = 0; sequence < inPostsEach; ++sequence) {
         if (inPaced) {
@@ -256,7 +258,8 @@ double RunQt(int inProducers, int inPostsEach, bool inPaced, int inCpu, Delivery
       inProducers, inPostsEach, inPaced, inCpu, ioRecord,
       [&](int inSequence, int inProducer) {
         QMetaObject::invokeMethod(
-            &receiver, [&ioRecord, &loop, inSequence, inProducer] {
+            &receiver,
+            [&ioRecord, &loop, inSequence, inProducer] {
               if (ioRecord.Deliver(inSequence, inProducer)) loop.quit();
             },
             Qt::QueuedConnection);
@@ -278,7 +281,8 @@ void Throughput(benchmark::State& ioState, RunFunction inRun) {
   for (auto _ : ioState) {
     DeliveryRecord record(producers, kPostsPerProducer, false);
     const double seconds = inRun(producers, kPostsPerProducer, false, pinning.mProducerCpu, record);
-    if (!Verify(ioState, seconds >= 0.0 && record.ExactlyOnce(), "a post was not delivered exactly once in time")) return;
+    if (!Verify(ioState, seconds >= 0.0 && record.ExactlyOnce(), "a post was not delivered exactly once in time"))
+      return;
     ioState.SetIterationTime(seconds);
   }
   ioState.SetItemsProcessed(static_cast<std::int64_t>(ioState.iterations()) * producers * kPostsPerProducer);
@@ -291,7 +295,8 @@ void Latency(benchmark::State& ioState, RunFunction inRun) {
   for (auto _ : ioState) {
     DeliveryRecord record(1, kLatencyPosts, true);
     const double seconds = inRun(1, kLatencyPosts, true, pinning.mProducerCpu, record);
-    if (!Verify(ioState, seconds >= 0.0 && record.ExactlyOnce(), "a post was not delivered exactly once in time")) return;
+    if (!Verify(ioState, seconds >= 0.0 && record.ExactlyOnce(), "a post was not delivered exactly once in time"))
+      return;
     ioState.SetIterationTime(seconds);
     const std::vector<double> run = record.LatenciesMicroseconds();
     latencies.insert(latencies.end(), run.begin(), run.end());
@@ -318,7 +323,8 @@ void CountPosts(benchmark::State& ioState, const Tally& inTally, bool inFromWork
         for (int i = 0; i < kAllocPosts; ++i) inPost();
       };
       std::thread worker;
-      if (inFromWorker) worker = std::thread([&] {
+      if (inFromWorker)
+        worker = std::thread([&] {
           while (step.load() == 0) std::this_thread::yield();
           postAll();
           step.store(2);
@@ -326,7 +332,8 @@ void CountPosts(benchmark::State& ioState, const Tally& inTally, bool inFromWork
       {
         AllocationCounts counts;
         step.store(1);
-        if (inFromWorker) while (step.load() != 2) std::this_thread::yield();
+        if (inFromWorker)
+          while (step.load() != 2) std::this_thread::yield();
         else postAll();
         inRun();
         heap = static_cast<double>(counts.HeapAllocations());
@@ -349,7 +356,9 @@ void AllocTarnPost(benchmark::State& ioState, bool inFromWorker, bool inForceAsy
   Tarn::StationUtils::AddListener(BenchStationID(), &listener);
   CountPosts(
       ioState, tally, inFromWorker,
-      [inForceAsync] { Tarn::StationUtils::PostMessageToUIThread(BenchStationID(), PairMessage(kA, kB), inForceAsync); },
+      [inForceAsync] {
+        Tarn::StationUtils::PostMessageToUIThread(BenchStationID(), PairMessage(kA, kB), inForceAsync);
+      },
       [] { Tarn::StationUtils::FlushPostedMessagesOnUIThread(); });
   Tarn::StationUtils::RemoveListener(BenchStationID(), &listener);
 }
@@ -376,10 +385,14 @@ const bool sRegistered = [] {
   for (const auto& [name, run] : peers) {
     WithBestOf(benchmark::RegisterBenchmark((std::string("Posting/") + name).c_str(),
                                             [run = run](benchmark::State& ioState) { Throughput(ioState, run); }))
-        ->Arg(1)->Arg(2)->UseManualTime()->MinTime(0.3);
+        ->Arg(1)
+        ->Arg(2)
+        ->UseManualTime()
+        ->MinTime(0.3);
     WithBestOf(benchmark::RegisterBenchmark((std::string("Latency/") + name).c_str(),
                                             [run = run](benchmark::State& ioState) { Latency(ioState, run); }))
-        ->Iterations(1)->UseManualTime();
+        ->Iterations(1)
+        ->UseManualTime();
   }
   const auto once = [](const char* inName, auto inFunction) {
     benchmark::RegisterBenchmark(inName, inFunction)->Iterations(1)->Repetitions(1);

@@ -97,8 +97,8 @@ struct QtSlot : QtFunctor {
   };
   Handler Make(Tally* inTally) { return {std::make_unique<QtReceiver>(inTally), {}}; }
   void Connect(Handler& ioHandler) {
-    ioHandler.mConnection = QObject::connect(&mSender, &QtSender::Pair, ioHandler.mReceiver.get(),
-                                             &QtReceiver::OnPair, Qt::DirectConnection);
+    ioHandler.mConnection = QObject::connect(&mSender, &QtSender::Pair, ioHandler.mReceiver.get(), &QtReceiver::OnPair,
+                                             Qt::DirectConnection);
   }
   void Disconnect(Handler& ioHandler) { QObject::disconnect(ioHandler.mConnection); }
 };
@@ -210,12 +210,23 @@ void AllocListener(benchmark::State& ioState) {
 template <class Peer, bool kWithAttach = true, bool kWithAllocs = true>
 void Register(const std::string& inName) {
   WithBestOf(benchmark::RegisterBenchmark(("Delivery/" + inName).c_str(), &Delivery<Peer>))
-      ->Arg(1)->Arg(10)->Arg(100)->Arg(1000)->MinTime(0.1);
+      ->Arg(1)
+      ->Arg(10)
+      ->Arg(100)
+      ->Arg(1000)
+      ->MinTime(0.1);
   if constexpr (kWithAttach)
-    WithBestOf(benchmark::RegisterBenchmark(("Attach/" + inName).c_str(), &Attach<Peer>))->Arg(10)->Arg(1000)->MinTime(0.1);
+    WithBestOf(benchmark::RegisterBenchmark(("Attach/" + inName).c_str(), &Attach<Peer>))
+        ->Arg(10)
+        ->Arg(1000)
+        ->MinTime(0.1);
   if constexpr (kWithAllocs) {
-    benchmark::RegisterBenchmark(("Alloc/Delivery/" + inName).c_str(), &AllocDelivery<Peer>)->Iterations(1)->Repetitions(1);
-    benchmark::RegisterBenchmark(("Alloc/Listener/" + inName).c_str(), &AllocListener<Peer>)->Iterations(1)->Repetitions(1);
+    benchmark::RegisterBenchmark(("Alloc/Delivery/" + inName).c_str(), &AllocDelivery<Peer>)
+        ->Iterations(1)
+        ->Repetitions(1);
+    benchmark::RegisterBenchmark(("Alloc/Listener/" + inName).c_str(), &AllocListener<Peer>)
+        ->Iterations(1)
+        ->Repetitions(1);
   }
 }
 
