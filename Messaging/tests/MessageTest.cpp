@@ -9,7 +9,6 @@
 #include <gtest/gtest.h>
 
 #include <memory>
-#include <string>
 #include <typeinfo>
 
 const Tarn::Message& OtherUnitProgress();  // MessageOtherUnit.cpp
@@ -25,30 +24,17 @@ struct Progress : Tarn::MessageImpl<Progress> {
   int mDone = 3;
 };
 
-struct Wide : Tarn::MessageImpl<Wide> {
-  Wide(char inA, long long inB, double inC) : mA(inA), mB(inB), mC(inC) {}
-  char mA;
-  long long mB;
-  double mC;
-};
-
 std::size_t BlocksInUse() { return SmallBlockAllocator::GetStatistics().blocksInUse; }
 
 TEST(MessageID, TheHashMultipliesByFiveAddsEachByteAsSignedAndWraps) {
-  EXPECT_EQ(Tarn::HashMessageTypeNameToMessageID(""), 0u);
-  EXPECT_EQ(Tarn::HashMessageTypeNameToMessageID("a"), 97u);
   EXPECT_EQ(Tarn::HashMessageTypeNameToMessageID("abc"), 3014u);
   EXPECT_EQ(Tarn::HashMessageTypeNameToMessageID("\x41\xE9"), 302u);
-  EXPECT_EQ(Tarn::HashMessageTypeNameToMessageID("\xFF"), 4294967295u);
   EXPECT_EQ(Tarn::HashMessageTypeNameToMessageID("abcdefghijklmnop"), 3236314344u);
 }
 
 TEST(MessageID, ATypeWithExternalLinkageIsKnownByTheHashOfItsNameAndIsAsMatchOnlyIt) {
   EXPECT_EQ(NumberMessage::StaticMessageID(), Tarn::HashMessageTypeNameToMessageID(typeid(NumberMessage).name()));
-  EXPECT_EQ(Tarn::IdleCountdownTimerMessage::StaticMessageID(),
-            Tarn::HashMessageTypeNameToMessageID(typeid(Tarn::IdleCountdownTimerMessage).name()));
-  const NumberMessage number(4);
-  const NumberMessage copy(number);
+  const NumberMessage copy(NumberMessage(4));
   const Tarn::Message& message = copy;
   EXPECT_EQ(message.GetMessageID(), NumberMessage(9).GetMessageID());
   EXPECT_TRUE(message.Is<NumberMessage>());
@@ -81,37 +67,25 @@ TEST(MessageID, TypesOfOneNameInTheAnonymousNamespacesOfTwoSourcesGetDistinctIDs
   EXPECT_EQ(third.GetMessageID(), Tarn::HashMessageTypeNameToMessageID(name));
 }
 
-TEST(MessageClone, ACloneCopiesEveryParameterIntoOneExactBlockThatDeleteReturns) {
-  const Wide source('x', -5000000000LL, 2.5);
-  const auto before = SmallBlockAllocator::GetStatistics();
-  Tarn::Message* clone = source.Clone();
-  EXPECT_EQ(SmallBlockAllocator::GetStatistics().bytesInUse,
-            before.bytesInUse + sizeof(Tarn::DynamicallyAllocatedMessage<Wide>));
+TEST(MessageClone, ACloneAndACloneOfItAreCopiesInOneExactBlockEachThatDeleteReturns) {
+  const auto before = SmallBlockAllocator::GetStatistics().bytesInUse;
+  Tarn::Message* clone = NumberMessage(-7).Clone();
   Tarn::Message* cloneOfClone = clone->Clone();
+  EXPECT_EQ(SmallBlockAllocator::GetStatistics().bytesInUse,
+            before + 2 * sizeof(Tarn::DynamicallyAllocatedMessage<NumberMessage>));
   for (Tarn::Message* copy : {clone, cloneOfClone}) {
-    ASSERT_NE(dynamic_cast<Tarn::DynamicallyAllocatedMessage<Wide>*>(copy), nullptr);
-    const Wide& wide = *copy->As<Wide>();
-    EXPECT_EQ(wide.mA, 'x');
-    EXPECT_EQ(wide.mB, -5000000000LL);
-    EXPECT_EQ(wide.mC, 2.5);
+    EXPECT_NE(dynamic_cast<Tarn::DynamicallyAllocatedMessage<NumberMessage>*>(copy), nullptr);
+    EXPECT_EQ(copy->As<NumberMessage>()->mValue, -7);
+    delete copy;
   }
-  delete clone;
-  delete cloneOfClone;
-  EXPECT_EQ(SmallBlockAllocator::GetStatistics().bytesInUse, before.bytesInUse);
+  EXPECT_EQ(SmallBlockAllocator::GetStatistics().bytesInUse, before);
 }
-
-// Records the numbers it hears.
-struct NumberSink : Tarn::Listener {
-  void ListenToMessage(const Tarn::Message& inMessage) override {
-    if (const auto* number = inMessage.As<NumberMessage>()) mHeard.push_back(number->mValue);
-  }
-  std::vector<int> mHeard;
-};
 
 TEST(MessageCallback, ACallbackCarriesACopyTakenWhenMadeInOneBlockFreedWithItsLastCopy) {
   messaging_test::MainThreadGuard mainThread;
   Tarn::Messaging::Initialize();
-  NumberSink sink;
+  messaging_test::CallLog log;
+  messaging_test::RecordingListener sink("sink", &log);
   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &sink);
   Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, PingMessage());  // the station's own first-use storage
   const std::size_t blocksBefore = BlocksInUse();
@@ -128,12 +102,12 @@ TEST(MessageCallback, ACallbackCarriesACopyTakenWhenMadeInOneBlockFreedWithItsLa
     const boost::function<void()> neverRun = PingMessage().CreateCallback(Tarn::kStation_StatusBar);
   }
   EXPECT_EQ(BlocksInUse(), blocksBefore);
-  EXPECT_EQ(sink.mHeard, (std::vector<int>{1, 1}));
+  EXPECT_EQ(log.Entries(), (std::vector<std::string>{"sink:ping", "sink:1", "sink:1"}));
   // A callback whose station is gone when it runs delivers nothing.
   const boost::function<void()> late = NumberMessage(3).CreateCallback(Tarn::kStation_StatusBar);
   Tarn::Messaging::Terminate();
   late();
-  EXPECT_EQ(sink.mHeard.size(), 2u);
+  EXPECT_EQ(log.Entries().size(), 3u);
 }
 
 }  // namespace
