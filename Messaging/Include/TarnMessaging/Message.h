@@ -108,6 +108,7 @@ public:
   LocalMessageType(const LocalMessageType&) = delete;
   LocalMessageType& operator=(const LocalMessageType&) = delete;
 
+  /// The ID this type holds for its record's life.
   MessageID GetMessageID() const noexcept { return mMessageID; }
 
 private:

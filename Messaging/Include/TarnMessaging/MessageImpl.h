@@ -57,9 +57,13 @@ public:
   boost::function<void()> CreateCallback(const kivcore::utility::ImmutableString& inStationID) const override;
 
 protected:
+  /// A message of the type whose ID is inMessageID; called by MessageImpl<T>.
   explicit MessageImplBase(MessageID inMessageID) noexcept : Message(inMessageID) {}
+  /// Copies keep the ID; only derived classes copy.
+  /// @{
   MessageImplBase(const MessageImplBase&) noexcept = default;
   MessageImplBase& operator=(const MessageImplBase&) noexcept = default;
+  /// @}
   ~MessageImplBase() override;
 
 private:
