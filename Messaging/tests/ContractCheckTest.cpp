@@ -107,41 +107,34 @@ const char kBAdd[] = "Tarn::Broadcaster::AddListener", kBRemove[] = "Tarn::Broad
 Tarn::Listener* const kNoListener = nullptr;
 namespace Utils = Tarn::StationUtils;
 
+// Named by the object called (b: a broadcaster, u: the station utilities)
+// and the argument given.
 const std::vector<Site> kSites = {
-    {"Broadcaster::AddListener(null)", [](Scene& s) { s.mBroadcaster.AddListener(kNoListener); }, {{kNull, kBAdd}}},
-    {"Broadcaster::AddListener(null safe)", [](Scene& s) { s.mBroadcaster.AddListener(Tarn::ISafeListenerRef()); },
-     {{kNull, kBAdd}}},
-    {"Broadcaster::AddListener(unweakable)",
-     [](Scene& s) { s.mBroadcaster.AddListener(Tarn::ISafeListenerRef(&s.mUnweakable)); },
+    {"b.Add(null)", [](Scene& s) { s.mBroadcaster.AddListener(kNoListener); }, {{kNull, kBAdd}}},
+    {"b.Add(null safe)", [](Scene& s) { s.mBroadcaster.AddListener(Tarn::ISafeListenerRef()); }, {{kNull, kBAdd}}},
+    {"b.Add(unweakable)", [](Scene& s) { s.mBroadcaster.AddListener(Tarn::ISafeListenerRef(&s.mUnweakable)); },
      {{"IWeakReferenceCapableRef(inListener) != NULL", kBAdd}}},
-    {"Broadcaster::AddListener(boost)", [](Scene& s) { s.mBroadcaster.AddListener(s.mExpiredBoost); },
-     {{kExpired, kBAdd}}},
-    {"Broadcaster::AddListener(std)", [](Scene& s) { s.mBroadcaster.AddListener(s.mExpiredStd); }, {{kExpired, kBAdd}}},
-    {"Broadcaster::RemoveListener(null)", [](Scene& s) { s.mBroadcaster.RemoveListener(kNoListener, true); },
+    {"b.Add(boost)", [](Scene& s) { s.mBroadcaster.AddListener(s.mExpiredBoost); }, {{kExpired, kBAdd}}},
+    {"b.Add(std)", [](Scene& s) { s.mBroadcaster.AddListener(s.mExpiredStd); }, {{kExpired, kBAdd}}},
+    {"b.Remove(null)", [](Scene& s) { s.mBroadcaster.RemoveListener(kNoListener, true); }, {{kNull, kBRemove}}},
+    {"b.Remove(null safe)", [](Scene& s) { s.mBroadcaster.RemoveListener(Tarn::ISafeListenerRef()); },
      {{kNull, kBRemove}}},
-    {"Broadcaster::RemoveListener(null safe)", [](Scene& s) { s.mBroadcaster.RemoveListener(Tarn::ISafeListenerRef()); },
-     {{kNull, kBRemove}}},
-    {"Broadcaster::RemoveListener(boost)", [](Scene& s) { s.mBroadcaster.RemoveListener(s.mExpiredBoost); },
-     {{kExpired, kBRemove}}},
-    {"Broadcaster::RemoveListener(std)", [](Scene& s) { s.mBroadcaster.RemoveListener(s.mExpiredStd); },
-     {{kExpired, kBRemove}}},
-    {"Broadcaster::HasListener(null)", [](Scene& s) { EXPECT_FALSE(s.mBroadcaster.HasListener(nullptr)); },
+    {"b.Remove(boost)", [](Scene& s) { s.mBroadcaster.RemoveListener(s.mExpiredBoost); }, {{kExpired, kBRemove}}},
+    {"b.Remove(std)", [](Scene& s) { s.mBroadcaster.RemoveListener(s.mExpiredStd); }, {{kExpired, kBRemove}}},
+    {"b.Has(null)", [](Scene& s) { EXPECT_FALSE(s.mBroadcaster.HasListener(nullptr)); },
      {{"inListener", "Tarn::Broadcaster::HasListener"}}},
     // On a registered station, the station's own removal reports again.
-    {"StationUtils::RemoveListener(null)", [](Scene& s) { Utils::RemoveListener(s.mStation, kNoListener); },
+    {"u.Remove(null)", [](Scene& s) { Utils::RemoveListener(s.mStation, kNoListener); },
      {{kNull, kURemove}, {kNull, kBRemove}}},
-    {"StationUtils::RemoveListener(null safe)",
-     [](Scene& s) { Utils::RemoveListener(s.mStation, Tarn::ISafeListenerRef()); },
+    {"u.Remove(null safe)", [](Scene& s) { Utils::RemoveListener(s.mStation, Tarn::ISafeListenerRef()); },
      {{kNull, kURemove}, {kNull, kBRemove}}},
-    {"StationUtils::RemoveListener(boost)", [](Scene& s) { Utils::RemoveListener(s.mStation, s.mExpiredBoost); },
+    {"u.Remove(boost)", [](Scene& s) { Utils::RemoveListener(s.mStation, s.mExpiredBoost); },
      {{kExpired, kURemove}, {kExpired, kBRemove}}},
-    {"StationUtils::RemoveListener(std, unregistered)",
-     [](Scene& s) { Utils::RemoveListener(s.mUnregistered, s.mExpiredStd); }, {{kExpired, kURemove}}},
-    {"StationUtils::SwitchStation(no IDs, null)",
-     [](Scene&) { Utils::SwitchStation(Tarn::kNoStation, Tarn::kNoStation, kNoListener); },
+    {"u.Remove(std, unregistered)", [](Scene& s) { Utils::RemoveListener(s.mUnregistered, s.mExpiredStd); },
+     {{kExpired, kURemove}}},
+    {"u.Switch(no IDs, null)", [](Scene&) { Utils::SwitchStation(Tarn::kNoStation, Tarn::kNoStation, kNoListener); },
      {{"!inFromStationID.empty()", kUSwitch}, {"!inToStationID.empty()", kUSwitch}, {kNull, kUSwitch}}},
-    {"StationUtils::SwitchStation(from no ID)",
-     [](Scene& s) { Utils::SwitchStation(Tarn::kNoStation, s.mStation, &s.mMover); },
+    {"u.Switch(from no ID)", [](Scene& s) { Utils::SwitchStation(Tarn::kNoStation, s.mStation, &s.mMover); },
      {{"!inFromStationID.empty()", kUSwitch}}, true},
 };
 
@@ -170,7 +163,7 @@ TEST_F(ContractCheckSites, EachReportsItselfAndLeavesNothingBrokenWhetherTheRepo
       const auto violations = dialog.Violations();
       const std::size_t expected = throws ? 1 : site.mReports.size();
       // A null safe listener may fail the weak-reference check too.
-      const bool nullSafe = site.mName == std::string("Broadcaster::AddListener(null safe)") && !throws;
+      const bool nullSafe = site.mName == std::string("b.Add(null safe)") && !throws;
       EXPECT_TRUE(violations.size() == expected || (nullSafe && violations.size() == 2)) << violations.size();
       for (std::size_t i = 0; i < expected && i < violations.size(); ++i) {
         EXPECT_EQ(violations[i].condition + " in " + violations[i].function,

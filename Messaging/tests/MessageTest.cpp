@@ -9,6 +9,8 @@
 #include <gtest/gtest.h>
 
 #include <memory>
+#include <optional>
+#include <set>
 #include <typeinfo>
 
 const Tarn::Message& OtherUnitProgress();  // MessageOtherUnit.cpp
@@ -17,11 +19,15 @@ namespace {
 
 using kivcore::utility::SmallBlockAllocator;
 using messaging_test::NumberMessage;
-using messaging_test::PingMessage;
 
 // Same name as the type in MessageOtherUnit.cpp, another layout.
 struct Progress : Tarn::MessageImpl<Progress> {
   int mDone = 3;
+};
+
+// Holds a share of mToken, so that its destruction shows.
+struct Tracked : Tarn::MessageImpl<Tracked> {
+  std::shared_ptr<int> mToken = std::make_shared<int>(0);
 };
 
 std::size_t BlocksInUse() { return SmallBlockAllocator::GetStatistics().blocksInUse; }
@@ -37,11 +43,10 @@ TEST(MessageID, ATypeWithExternalLinkageIsKnownByTheHashOfItsNameAndIsAsMatchOnl
   const NumberMessage copy(NumberMessage(4));
   const Tarn::Message& message = copy;
   EXPECT_EQ(message.GetMessageID(), NumberMessage(9).GetMessageID());
-  EXPECT_TRUE(message.Is<NumberMessage>());
-  EXPECT_FALSE(message.Is<PingMessage>());
+  EXPECT_TRUE(message.Is<NumberMessage>() && !message.Is<messaging_test::PingMessage>());
   ASSERT_EQ(message.As<NumberMessage>(), &copy);
   EXPECT_EQ(message.As<NumberMessage>()->mValue, 4);
-  EXPECT_EQ(message.As<PingMessage>(), nullptr);
+  EXPECT_EQ(message.As<messaging_test::PingMessage>(), nullptr);
 }
 
 // Two types of one name in the anonymous namespaces of two sources had one
@@ -58,13 +63,19 @@ TEST(MessageID, TypesOfOneNameInTheAnonymousNamespacesOfTwoSourcesGetDistinctIDs
   const char* const name = "N12_GLOBAL__N_18SolitaryE";
   ASSERT_TRUE(Tarn::Detail::HasInternalLinkage(name));
   EXPECT_FALSE(Tarn::Detail::HasInternalLinkage(typeid(NumberMessage).name()));
-  auto first = std::make_unique<Tarn::Detail::LocalMessageType>(name);
-  const Tarn::Detail::LocalMessageType second(name);
+  // Optional storage, not the heap, so that a stale link would still read
+  // the dead record's ID.
+  std::optional<Tarn::Detail::LocalMessageType> first, second, third;
+  first.emplace(name);
+  second.emplace(name);
+  third.emplace(name);  // listed third, second, first
   EXPECT_EQ(first->GetMessageID(), Tarn::HashMessageTypeNameToMessageID(name));
-  EXPECT_NE(second.GetMessageID(), first->GetMessageID());
+  const std::set<Tarn::MessageID> ids = {first->GetMessageID(), second->GetMessageID(), third->GetMessageID()};
+  EXPECT_EQ(ids.size(), 3u);
+  second.reset();  // from the middle: the first record's back-link must follow
   first.reset();
-  const Tarn::Detail::LocalMessageType third(name);
-  EXPECT_EQ(third.GetMessageID(), Tarn::HashMessageTypeNameToMessageID(name));
+  third.emplace(name);
+  EXPECT_EQ(third->GetMessageID(), Tarn::HashMessageTypeNameToMessageID(name));
 }
 
 TEST(MessageClone, ACloneAndACloneOfItAreCopiesInOneExactBlockEachThatDeleteReturns) {
@@ -87,8 +98,10 @@ TEST(MessageCallback, ACallbackCarriesACopyTakenWhenMadeInOneBlockFreedWithItsLa
   messaging_test::CallLog log;
   messaging_test::RecordingListener sink("sink", &log);
   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &sink);
-  Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, PingMessage());  // the station's own first-use storage
+  // The station's own storage, made on its first broadcast, is not counted.
+  Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, messaging_test::PingMessage());
   const std::size_t blocksBefore = BlocksInUse();
+  const Tracked tracked;
   {
     NumberMessage message(1);
     const boost::function<void()> callback = message.CreateCallback(Tarn::kStation_StatusBar);
@@ -99,9 +112,11 @@ TEST(MessageCallback, ACallbackCarriesACopyTakenWhenMadeInOneBlockFreedWithItsLa
     callback();
     copy.clear();
     EXPECT_EQ(BlocksInUse(), blocksBefore + 1);
-    const boost::function<void()> neverRun = PingMessage().CreateCallback(Tarn::kStation_StatusBar);
+    const boost::function<void()> neverRun = tracked.CreateCallback(Tarn::kStation_StatusBar);
+    EXPECT_EQ(tracked.mToken.use_count(), 2);
   }
-  EXPECT_EQ(BlocksInUse(), blocksBefore);
+  EXPECT_EQ(tracked.mToken.use_count(), 1) << "the posted copy was never destroyed";
+  EXPECT_EQ(BlocksInUse(), blocksBefore) << "the posted copies' block was not returned";
   EXPECT_EQ(log.Entries(), (std::vector<std::string>{"sink:ping", "sink:1", "sink:1"}));
   // A callback whose station is gone when it runs delivers nothing.
   const boost::function<void()> late = NumberMessage(3).CreateCallback(Tarn::kStation_StatusBar);

@@ -10,7 +10,6 @@ namespace {
 using namespace station_test;
 namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
-using messaging_test::CallLog;
 using messaging_test::RecordingListener;
 
 class StationUtilsTest : public RegistryTest {};
@@ -57,7 +56,7 @@ TEST_F(StationUtilsTest, EachKindIsAttachedByIDAndDetachedAgainWhileEveryRetainI
 
 TEST_F(StationUtilsTest, SwitchStationMovesTheListenerToTheNewestPlaceOfItsDestination) {
   const ImmutableString from = MakeCounted(), to = MakeCounted(), unregistered = Registry::UniqueStationID();
-  CallLog log;
+  messaging_test::CallLog log;
   RecordingListener mover("mover", &log), resident("resident", &log);
   Utils::AddListener(to, &resident);
   Utils::SwitchStation(unregistered, from, &mover);  // from nowhere: simply added
