@@ -6,47 +6,64 @@
 
 #include <TarnFoundation/TimeStamp.h>
 
+#include <new>
+
 namespace Tarn {
 
 IdleCountdownTimer::IdleCountdownTimer() : mStationID(StationRegistry::RegisterUniqueStation()) {}
 
 IdleCountdownTimer::~IdleCountdownTimer() {
+  // Detached here, while the timer is whole: ~Listener detaches only once
+  // ListenToMessage is pure again, and a delivery reaching the timer then
+  // would call a pure function.
   if (mListeningForIdle) {
     mListeningForIdle = false;
-    StationUtils::RemoveListener(kStation_Idle, this);
+    try {
+      StationUtils::RemoveListener(kStation_Idle, this);
+    } catch (const std::bad_alloc&) {
+      // The only allocation on this path is the making of an idle station
+      // that does not exist yet (after Terminate and Initialize), and the
+      // timer cannot be attached to a station that does not exist.
+    }
   }
   StationRegistry::DisposeStation(mStationID);
 }
 
-std::uint32_t IdleCountdownTimer::NowMilliSeconds() {
-  // Truncated toward zero, then the low 32 bits: the deadline arithmetic
-  // wraps modulo 2^32.
-  return static_cast<std::uint32_t>(static_cast<std::int64_t>(TimeStamp().GetMilliSeconds()));
+std::int64_t IdleCountdownTimer::NowMilliSeconds() {
+  // Truncated toward zero. A reading outside +-2^62 ms (a broken clock) is
+  // clamped, so that the conversion and the deadline's sum stay defined.
+  constexpr double kLimit = 4611686018427387904.0;
+  const double now = TimeStamp().GetMilliSeconds();
+  if (!(now > -kLimit)) return -static_cast<std::int64_t>(kLimit);
+  if (!(now < kLimit)) return static_cast<std::int64_t>(kLimit);
+  return static_cast<std::int64_t>(now);
+}
+
+kivcore::utility::ImmutableString IdleCountdownTimer::GetStationID() const {
+  // Terminate empties the registry; an ID registered already keeps its
+  // record, so this is a no-op whenever the library has not been restarted.
+  StationRegistry::RegisterStation(mStationID, nullptr);
+  return mStationID;
 }
 
 void IdleCountdownTimer::ArmTimer() {
-  mDeadline = NowMilliSeconds() + mDuration;
-  if (!mListeningForIdle) {
+  StationRegistry::RegisterStation(mStationID, nullptr);
+  mDeadline = NowMilliSeconds() + static_cast<std::int64_t>(mDuration);
+  // The idle station's record decides, not a flag of our own: Terminate
+  // deletes the station the timer was attached to, and before library
+  // initialization the attach does nothing at all.
+  Station* idle = StationRegistry::FindStation(kStation_Idle);
+  if (idle == nullptr || !HasBroadcaster(idle)) {
     StationUtils::AddListener(kStation_Idle, this);
-    // Before library initialization the idle station does not exist and the
-    // attach does nothing. Marking the timer as listening all the same would
-    // make every later ArmTimer skip the attach and leave the timer dead, so
-    // the mark follows what actually happened.
-    Station* const idle = StationRegistry::FindStation(kStation_Idle);
-    mListeningForIdle = idle != nullptr && HasBroadcaster(idle);
+    idle = StationRegistry::FindStation(kStation_Idle);
   }
+  mListeningForIdle = idle != nullptr && HasBroadcaster(idle);
 }
 
 void IdleCountdownTimer::ListenToMessage(const Message& inMessage) {
-  if (inMessage.GetMessageID() != MessageImpl<ApplicationIdleMessage>::StaticMessageID()) return;
+  if (!inMessage.Is<ApplicationIdleMessage>()) return;
   if (!mListeningForIdle) return;
-  // Serial-number comparison of the wrapping 32-bit clock: the deadline is
-  // reached when now is at most 2^31 ms (24.8 days) before it. A plain
-  // unsigned comparison would fire up to a whole duration early when the
-  // deadline wraps past 2^32, and stall for 49.7 days when the clock wraps
-  // after arming (a monotonic clock that counts from boot does so on machines
-  // up for longer than that).
-  if (static_cast<std::int32_t>(NowMilliSeconds() - mDeadline) < 0) return;
+  if (NowMilliSeconds() < mDeadline) return;
   if (mFiring) return;
   mFiring = true;
   // Cleared on every way out, an exception included: a timer whose firing

@@ -1,10 +1,20 @@
-#include <TarnMessaging/Message.h>
+#include <TarnMessaging/MessageImpl.h>
 #include <TarnMessaging/NullInterfaceException.h>
 
+#include <kivcore/SmallBlockAllocator.h>
+
+#include <boost/function.hpp>
+
+#include <atomic>
 #include <cstdint>
 #include <cstring>
+#include <new>
+#include <thread>
 
 namespace Tarn {
+
+using kivcore::utility::ImmutableString;
+using kivcore::utility::SmallBlockAllocator;
 
 unsigned int HashMessageTypeNameToMessageID(const char* inTypeName) noexcept {
   std::uint32_t hash = 0;
@@ -17,6 +27,134 @@ unsigned int HashMessageTypeNameToMessageID(const char* inTypeName) noexcept {
 
 // Out of line so that the vtable and type information live in this library.
 Message::~Message() = default;
+
+// ---------------------------------------------------------------------------
+// IDs of types with internal linkage
+
+namespace Detail {
+
+namespace {
+// The live records of types with internal linkage, across all modules. A
+// spin lock and a plain pointer, both trivially destructible: a module's exit
+// may unlink its records after this library's own statics are gone.
+std::atomic_flag sLocalTypesBusy = ATOMIC_FLAG_INIT;
+LocalMessageType* sLocalTypes = nullptr;  // guarded by sLocalTypesBusy
+
+class LocalTypesLock {
+public:
+  LocalTypesLock() noexcept {
+    while (sLocalTypesBusy.test_and_set(std::memory_order_acquire)) std::this_thread::yield();
+  }
+  ~LocalTypesLock() { sLocalTypesBusy.clear(std::memory_order_release); }
+  LocalTypesLock(const LocalTypesLock&) = delete;
+  LocalTypesLock& operator=(const LocalTypesLock&) = delete;
+};
+}  // namespace
+
+bool HasInternalLinkage(const char* inTypeName) noexcept {
+  // GCC and Clang decorate every anonymous namespace as _GLOBAL__N_1, in
+  // every source, so the name alone cannot tell two such types apart; a
+  // template argument of such a type gives the instance internal linkage too.
+  return std::strstr(inTypeName, "_GLOBAL__N_") != nullptr;
+}
+
+LocalMessageType::LocalMessageType(const char* inTypeName) noexcept : mNext(nullptr), mPrevious(nullptr) {
+  MessageID id = HashMessageTypeNameToMessageID(inTypeName);
+  const LocalTypesLock lock;
+  // The first type of a name keeps the name's hash. Every further one steps
+  // with a multiplier, not by one: names differing in their last byte hash
+  // to neighbouring values.
+  for (bool taken = true; taken;) {
+    taken = false;
+    for (const LocalMessageType* type = sLocalTypes; type != nullptr; type = type->mNext) {
+      if (type->mMessageID == id) {
+        taken = true;
+        id = id * 2654435761u + 1u;
+        break;
+      }
+    }
+  }
+  mMessageID = id;
+  mNext = sLocalTypes;
+  if (mNext != nullptr) mNext->mPrevious = this;
+  sLocalTypes = this;
+}
+
+LocalMessageType::~LocalMessageType() {
+  const LocalTypesLock lock;
+  if (mPrevious != nullptr) mPrevious->mNext = mNext;
+  else sLocalTypes = mNext;
+  if (mNext != nullptr) mNext->mPrevious = mPrevious;
+}
+
+// ---------------------------------------------------------------------------
+// Posted copies
+
+namespace {
+
+// One small block: this header, then the copy of the message at
+// kMessageOffset. Shared by the copies of one function object.
+struct PostedCopy {
+  std::atomic<long> mOwners{1};
+  ImmutableString mStationID;
+  Message* mMessage = nullptr;
+  std::size_t mBlockSize = 0;
+};
+constexpr std::size_t kMessageOffset =
+    (sizeof(PostedCopy) + alignof(std::max_align_t) - 1) / alignof(std::max_align_t) * alignof(std::max_align_t);
+
+void ReleasePostedCopy(PostedCopy* inCopy) noexcept {
+  if (inCopy->mOwners.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
+  const std::size_t size = inCopy->mBlockSize;
+  inCopy->mMessage->~Message();
+  inCopy->~PostedCopy();
+  SmallBlockAllocator::Dispose(inCopy, size);
+}
+
+// The function object CreateCallback returns: one pointer, so that it lies
+// inside the boost::function and costs no allocation of its own.
+class PostedCall {
+public:
+  explicit PostedCall(PostedCopy* inCopy) noexcept : mCopy(inCopy) {}
+  PostedCall(const PostedCall& inOther) noexcept : mCopy(inOther.mCopy) {
+    mCopy->mOwners.fetch_add(1, std::memory_order_relaxed);
+  }
+  PostedCall& operator=(const PostedCall&) = delete;
+  ~PostedCall() { ReleasePostedCopy(mCopy); }
+
+  void operator()() const { StationUtils::BroadcastMessage(mCopy->mStationID, *mCopy->mMessage); }
+
+private:
+  PostedCopy* mCopy;  // one of its owners
+};
+static_assert(boost::detail::function::function_allows_small_object_optimization<PostedCall>::value,
+              "a posted call must fit inside boost::function");
+
+}  // namespace
+
+MessageImplBase::~MessageImplBase() = default;
+
+boost::function<void()> MessageImplBase::CreateCallback(const ImmutableString& inStationID) const {
+  const std::size_t size = kMessageOffset + CopySize();
+  void* const block = SmallBlockAllocator::Allocate(size);
+  if (block == nullptr) throw std::bad_alloc();
+  PostedCopy* const copy = new (block) PostedCopy;
+  copy->mBlockSize = size;
+  try {
+    copy->mStationID = inStationID;
+    copy->mMessage = CopyInto(static_cast<char*>(block) + kMessageOffset);
+  } catch (...) {
+    copy->~PostedCopy();
+    SmallBlockAllocator::Dispose(block, size);
+    throw;
+  }
+  return boost::function<void()>(PostedCall(copy));
+}
+
+}  // namespace Detail
+
+// ---------------------------------------------------------------------------
+// NullInterfaceException
 
 namespace {
 constexpr char kNullInterfacePrefix[] = "A NULL interface pointer has been dereferenced: ";

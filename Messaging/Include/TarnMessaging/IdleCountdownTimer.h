@@ -16,14 +16,20 @@
 /// idle; an armed timer listens there, and at the first idle message at or
 /// after its deadline it detaches and broadcasts one IdleCountdownTimerMessage
 /// on its own station. Arm it again for every further firing (a handler of the
-/// timer's message may do so). Time is read from Tarn::TimeStamp as
-/// milliseconds in wrapping 32-bit arithmetic, compared as serial numbers, so
-/// the wrap every 49.7 days neither fires a timer early nor stalls it; a
-/// duration must be below 2^31 ms (24.8 days). Arming before library
-/// initialization attaches nothing; arm again once the library is up.
+/// timer's message may do so). Time is read from Tarn::TimeStamp as whole
+/// milliseconds on a 64-bit count, so every duration up to 2^32 - 1 ms (49.7
+/// days) fires no earlier than its length, and the wrap of a 32-bit
+/// millisecond count changes nothing. Arming before library initialization
+/// attaches nothing; arm again once the library is up. A timer that lives
+/// across Messaging::Terminate and Initialize works again once armed anew:
+/// ArmTimer and GetStationID register its station again if Terminate dropped
+/// it, and ArmTimer attaches to the new idle station.
 ///
 /// Threading: main thread only, like the idle broadcasts that drive it. Do not
-/// destroy the timer from a handler of its own message.
+/// destroy the timer from a handler of its own message. The destructor
+/// detaches the timer from kStation_Idle before anything of the timer is
+/// destroyed; a host that attaches the timer to a broadcaster of its own
+/// detaches it there before destroying it.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -73,18 +79,19 @@ public:
   void SetDuration(unsigned int inDuration) noexcept { mDuration = inDuration; }
   /// The value carried by the messages of the following firings.
   void SetCookie(unsigned int inCookie) noexcept { mCookie = inCookie; }
-  /// The station the timer's messages are broadcast on.
-  kivcore::utility::ImmutableString GetStationID() const { return mStationID; }
+  /// The station the timer's messages are broadcast on; registers it again
+  /// when Terminate dropped it. Throws std::bad_alloc when storage is out.
+  kivcore::utility::ImmutableString GetStationID() const;
 
   void ListenToMessage(const Message& inMessage) override;
 
 private:
-  TARN_MESSAGING_LOCAL static std::uint32_t NowMilliSeconds();
+  TARN_MESSAGING_LOCAL static std::int64_t NowMilliSeconds();
 
-  kivcore::utility::ImmutableString mStationID;
-  bool mListeningForIdle = false;
+  kivcore::utility::ImmutableString mStationID;  // registered while the library is up
+  bool mListeningForIdle = false;                // follows the idle station's own record
   std::uint32_t mDuration = 0;
-  std::uint32_t mDeadline = 0;
+  std::int64_t mDeadline = 0;                    // on the 64-bit millisecond count
   std::uint32_t mCookie = 0;
   bool mFiring = false;
 };

@@ -5,28 +5,37 @@
 /// is the hash of the type's decorated name (on GCC and Clang the mangled name
 /// that typeid(T).name() gives, which includes the enclosing namespaces), so
 /// every module that sees a message class computes the same ID without any
-/// registration. Listeners recognise a message by comparing IDs:
+/// registration. A type with internal linkage (declared in an anonymous
+/// namespace) is the one exception: two sources may each declare one of the
+/// same name, and their decorated names are then equal, so the library hands
+/// each such type an ID of its own, the name's hash for the first one seen
+/// and a distinct value for every further one. Listeners recognise a message
+/// by its ID, most simply through Is<T>() and As<T>():
 ///
 /// @code{.cpp}
 ///   void MyListener::ListenToMessage(const Tarn::Message& inMessage) {
-///     if (inMessage.GetMessageID() == Progress::StaticMessageID())
-///       OnProgress(static_cast<const Progress&>(inMessage));
+///     if (const Progress* progress = inMessage.As<Progress>()) OnProgress(*progress);
 ///   }
 /// @endcode
 ///
 /// Concrete messages derive from Tarn::MessageImpl<T> (MessageImpl.h), never
 /// from Message directly.
 ///
+/// Calling CreateCallback needs the definition of boost::function, which this
+/// header only declares: include <boost/function.hpp> where you call it.
+///
 /// Threading: HashMessageTypeNameToMessageID is pure and may be called from
-/// any thread. A message object is not synchronised: the listeners of one
-/// broadcast read it on the broadcasting thread.
+/// any thread, and so may the ID lookup of a type with internal linkage (it
+/// takes a short spin lock, once per type and module). A message object is not
+/// synchronised: the listeners of one broadcast read it on the broadcasting
+/// thread.
 #pragma once
 
 #include <TarnMessaging/Export.h>
 
 #include <kivcore/ImmutableString.h>
 
-#include <boost/function.hpp>
+#include <boost/function/function_fwd.hpp>
 
 #include <cstdint>
 
@@ -47,6 +56,19 @@ class TARN_MESSAGING_API Message {
 public:
   /// The ID of the message's type (MessageImpl<T>::StaticMessageID()).
   MessageID GetMessageID() const noexcept { return mMessageID; }
+
+  /// True when this message is a T (its ID is T's).
+  template <class T>
+  bool Is() const noexcept {
+    return mMessageID == T::StaticMessageID();
+  }
+  /// This message as a T, or null when it is of another type. A mismatch is
+  /// an ordinary miss, as for a listener that ignores other types, so it is
+  /// not reported.
+  template <class T>
+  const T* As() const noexcept {
+    return Is<T>() ? static_cast<const T*>(this) : nullptr;
+  }
 
   virtual ~Message();
 
@@ -71,6 +93,34 @@ protected:
 private:
   MessageID mMessageID;  // set once by the constructor
 };
+
+namespace Detail {
+
+/// The ID record of one message type with internal linkage, in the module
+/// that declares the type; MessageImpl<T> makes it on first use and the
+/// module's exit destroys it, which takes it off the library's list.
+class TARN_MESSAGING_API LocalMessageType {
+public:
+  /// Takes an ID that no other live record holds: the hash of inTypeName if
+  /// it is free. inTypeName must outlive the record.
+  explicit LocalMessageType(const char* inTypeName) noexcept;
+  ~LocalMessageType();
+  LocalMessageType(const LocalMessageType&) = delete;
+  LocalMessageType& operator=(const LocalMessageType&) = delete;
+
+  /// The ID this type holds for its record's life.
+  MessageID GetMessageID() const noexcept { return mMessageID; }
+
+private:
+  MessageID mMessageID;       // fixed by the constructor
+  LocalMessageType* mNext;    // the library's list, guarded by its spin lock
+  LocalMessageType* mPrevious;
+};
+
+/// True when a decorated type name names a type with internal linkage.
+TARN_MESSAGING_API bool HasInternalLinkage(const char* inTypeName) noexcept;
+
+}  // namespace Detail
 
 namespace StationUtils {
 // Declared here for the message templates; documented in StationUtils.h.

@@ -13,12 +13,18 @@
 ///
 /// MessageImpl<T> gives T its ID (StaticMessageID), Clone (a copy in
 /// small-block storage, DynamicallyAllocatedMessage<T>) and CreateCallback (a
-/// copy carried to the main thread, MessageCallbackImpl<T>). T overrides none
-/// of them; its copy constructor must copy every parameter.
+/// copy carried to the main thread in one small block, made by the library).
+/// T overrides none of them; its copy constructor must copy every parameter.
+/// Only T itself can build its MessageImpl<T> base, so a class that names
+/// another type (`struct Saved : Tarn::MessageImpl<Progress>`) does not
+/// compile, and T must derive from MessageImpl<T>.
+///
+/// The header pulls in no Boost header beyond a forward declaration, so that
+/// every source declaring a message type compiles fast.
 ///
 /// Threading: StaticMessageID caches the ID in a per-module slot without a
-/// lock (a relaxed atomic); concurrent first uses store the same value. Clone and CreateCallback
-/// only read the message and may run on any thread.
+/// lock (a relaxed atomic); concurrent first uses store the same value. Clone
+/// and CreateCallback only read the message and may run on any thread.
 #pragma once
 
 #include <TarnMessaging/Message.h>
@@ -26,33 +32,66 @@
 #include <kivcore/ImmutableString.h>
 #include <kivcore/SmallBlockAllocator.h>
 
-#include <boost/bind/bind.hpp>
-#include <boost/function.hpp>
-#include <boost/make_shared.hpp>
-#include <boost/shared_ptr.hpp>
-
 #include <atomic>
+#include <cstddef>
+#include <new>
+#include <type_traits>
 #include <typeinfo>
 
+namespace boost {
+template <class T>
+class shared_ptr;
+}  // namespace boost
+
 namespace Tarn {
+namespace Detail {
+
+/// What MessageImpl<T> shares for every T, compiled once in the library:
+/// CreateCallback, which copies the complete message through the two hooks
+/// that MessageImpl<T> implements.
+class TARN_MESSAGING_API MessageImplBase : public Message {
+public:
+  /// A function that broadcasts a copy of this message, taken now, on
+  /// inStationID. The copy and its station ID share one small block, owned by
+  /// the function's copies. Throws std::bad_alloc when storage is out.
+  boost::function<void()> CreateCallback(const kivcore::utility::ImmutableString& inStationID) const override;
+
+protected:
+  /// A message of the type whose ID is inMessageID; called by MessageImpl<T>.
+  explicit MessageImplBase(MessageID inMessageID) noexcept : Message(inMessageID) {}
+  /// Copies keep the ID; only derived classes copy.
+  /// @{
+  MessageImplBase(const MessageImplBase&) noexcept = default;
+  MessageImplBase& operator=(const MessageImplBase&) noexcept = default;
+  /// @}
+  ~MessageImplBase() override;
+
+private:
+  // The bytes a copy of the complete message needs.
+  virtual std::size_t CopySize() const noexcept = 0;
+  // Copy-constructs the complete message at inStorage (CopySize() bytes,
+  // aligned for std::max_align_t) and returns it.
+  virtual Message* CopyInto(void* inStorage) const = 0;
+};
+
+}  // namespace Detail
 
 /// The template every concrete message T derives through, as
 /// `struct T : MessageImpl<T>`: gives T its ID, Clone and CreateCallback. T's
 /// copy constructor must copy every parameter. Clone and CreateCallback only
 /// read the message and may run on any thread.
 template <class T>
-class MessageImpl : public Message {
+class MessageImpl : public Detail::MessageImplBase {
 public:
-  /// A message with T's ID.
-  MessageImpl() noexcept : Message(StaticMessageID()) {}
-
-  /// The ID of T: the hash of T's decorated name, computed on first use.
+  /// The ID of T: the hash of T's decorated name, computed on first use (a
+  /// type with internal linkage gets an ID no other such type holds).
   static MessageID StaticMessageID() noexcept {
     // Relaxed atomics: threads that meet the empty slot at once compute and
     // store the same value, so no ordering is needed, only freedom from a race.
     MessageID id = sMessageID.load(std::memory_order_relaxed);
     if (id == 0) {
-      id = HashMessageTypeNameToMessageID(typeid(T).name());
+      const char* const name = typeid(T).name();
+      id = Detail::HasInternalLinkage(name) ? LocalType().GetMessageID() : HashMessageTypeNameToMessageID(name);
       sMessageID.store(id, std::memory_order_relaxed);
     }
     return id;
@@ -61,12 +100,27 @@ public:
   /// A DynamicallyAllocatedMessage<T> copy of this message, in small-block
   /// storage, owned by the caller. Throws std::bad_alloc when storage is out.
   Message* Clone() const override;
-  /// A function that broadcasts a copy of this message, taken now, on
-  /// inStationID; the copy lives in one small-block allocation shared by the
-  /// function's copies. Throws std::bad_alloc when storage is out.
-  boost::function<void()> CreateCallback(const kivcore::utility::ImmutableString& inStationID) const override;
 
 private:
+  // Only T may build this base, so a class deriving from MessageImpl<U> for
+  // another type U fails to compile, and the compiler quotes the line below.
+  friend T;
+  MessageImpl() noexcept : MessageImplBase(StaticMessageID()) {  // error? write struct T : Tarn::MessageImpl<T>
+    static_assert(std::is_base_of<MessageImpl, T>::value,
+                  "a message type T must derive from Tarn::MessageImpl<T>, naming itself");
+    static_assert(alignof(T) <= alignof(std::max_align_t), "a message type may not be over-aligned");
+  }
+
+  std::size_t CopySize() const noexcept override { return sizeof(T); }
+  Message* CopyInto(void* inStorage) const override { return new (inStorage) T(static_cast<const T&>(*this)); }
+
+  // Made on the first use of a type with internal linkage only; its module's
+  // exit takes it off the library's list again.
+  static const Detail::LocalMessageType& LocalType() noexcept {
+    static const Detail::LocalMessageType sType(typeid(T).name());
+    return sType;
+  }
+
   static inline std::atomic<MessageID> sMessageID{0};  // per module; 0 means not computed yet
 };
 
@@ -85,9 +139,9 @@ public:
   explicit DynamicallyAllocatedMessage(const T& inMessage) : T(inMessage) {}
 };
 
-/// A posted message on its way to the main thread: a copy of the message and
-/// of the station ID, shared by the function objects that CreateCallback
-/// returns and freed with the last of them (on whichever thread that is).
+/// A copy of a message and of a station ID, for code that carries a message
+/// to the main thread in a boost::shared_ptr of its own (include
+/// <boost/shared_ptr.hpp> to use Deliver). CreateCallback does not need it.
 template <class T>
 class MessageCallbackImpl {
 public:
@@ -107,17 +161,6 @@ public:
 template <class T>
 Message* MessageImpl<T>::Clone() const {
   return new DynamicallyAllocatedMessage<T>(static_cast<const T&>(*this));
-}
-
-template <class T>
-boost::function<void()> MessageImpl<T>::CreateCallback(const kivcore::utility::ImmutableString& inStationID) const {
-  using Callback = MessageCallbackImpl<T>;
-  // One small-block allocation holds both the object and its shared count;
-  // the bound call (a function pointer and a shared_ptr) fits inside the
-  // boost::function without an allocation of its own.
-  boost::shared_ptr<Callback> callback = boost::allocate_shared<Callback>(
-      kivcore::utility::SmallBlockAllocator::STLAllocator<Callback>(), static_cast<const T&>(*this), inStationID);
-  return boost::function<void()>(boost::bind(&Callback::Deliver, callback));
 }
 
 }  // namespace Tarn
