@@ -12,100 +12,78 @@ using kivcore::proplist::PropList;
 
 namespace {
 
-// Registrars made by a test, and the log of what ran. Every registrar is
-// withdrawn, after a final TerminateAll, when the test ends.
-class InitializerRegistryTest : public ::testing::Test {
-protected:
-  void TearDown() override {
-    InitializerRegistry::TerminateAll();
-    mRegistrars.clear();
-  }
+std::vector<std::string> sLog;  // what the entries below did, in order
 
-  void Register(const char* inName, const char* inDependency = nullptr,
-                std::function<bool(const PropList&)> inInit = [](const PropList&) { return true; },
-                std::function<void()> inTerminate = [] {}) {
-    InitializerDependencies dependencies{};
-    dependencies[0] = inDependency;
-    mRegistrars.push_back(std::make_unique<InitializerRegistrar>(
-        inName, EInitializerContextFlags(10),
-        [this, name = std::string(inName), inInit](const PropList& inProperties) {
-          mLog.push_back("init " + name);
-          return inInit(inProperties);
-        },
-        [this, name = std::string(inName), inTerminate] {
-          mLog.push_back("term " + name);
-          inTerminate();
-        },
-        dependencies));
-  }
+// An entry, withdrawn when the registrar goes, that logs its init and its
+// termination. Its init answers inInit(); a name starting with '!' has a
+// terminator that throws.
+std::unique_ptr<InitializerRegistrar> Entry(
+    std::string inName, const char* inDependency = nullptr, std::function<bool()> inInit = [] { return true; }) {
+  return std::make_unique<InitializerRegistrar>(
+      inName.c_str(), EInitializerContextFlags(10),
+      [inName, inInit](const PropList& inProperties) {
+        sLog.push_back("init " + inName + inProperties.Get("mode"));
+        return inInit();
+      },
+      [inName] {
+        sLog.push_back("term " + inName);
+        if (inName[0] == '!') throw std::runtime_error("teardown failed");
+      },
+      InitializerDependencies{inDependency});
+}
 
-  std::vector<std::unique_ptr<InitializerRegistrar>> mRegistrars;
-  std::vector<std::string> mLog;
-};
-
-TEST_F(InitializerRegistryTest, DependenciesRunFirstAndTerminationRunsInReverseOrder) {
-  Register("Lib::User", "Lib::Base");
-  Register("Lib::Other", "Lib::NotRegistered");
-  Register("Lib::Base", nullptr, [](const PropList& inProperties) { return inProperties.Get("mode") == "headless"; });
-  EXPECT_TRUE(mLog.empty()) << "nothing runs until the host asks";
-  unsigned int flags = 0;
-  EXPECT_TRUE(InitializerRegistry::IsRegistered("Lib::Base", &flags));
-  EXPECT_EQ(10u, flags);
+// Entries run after what they depend on (a dependency not registered holds
+// nothing back), once, and terminate in the reverse order of their inits'
+// completion. An init function may load a library (registering newcomers,
+// which run in the same pass) and call InitializeAll itself: the nested call
+// leaves an entry that waits for the init still running to the outer call,
+// and that is no failure.
+TEST(InitializerRegistry, EntriesRunInDependencyOrderAndInitFunctionsMayInitializeMore) {
+  sLog.clear();
+  bool nested = false;
+  std::unique_ptr<InitializerRegistrar> loaded;
+  const auto user = Entry("User", "Loader");
+  const auto other = Entry("Other", "NotRegistered");
+  const auto loader = Entry("Loader", nullptr, [&] {
+    loaded = Entry("Loaded", "Other");
+    nested = InitializerRegistry::InitializeAll(PropList());
+    return true;
+  });
   PropList properties;
-  properties.Set("mode", "headless");
+  properties.Set("mode", ":x");
   EXPECT_TRUE(InitializerRegistry::InitializeAll(properties));
+  EXPECT_TRUE(nested);
   EXPECT_TRUE(InitializerRegistry::InitializeAll(properties)) << "initialized entries do not run again";
   InitializerRegistry::TerminateAll();
   InitializerRegistry::TerminateAll();
-  EXPECT_EQ((std::vector<std::string>{"init Lib::Other", "init Lib::Base", "init Lib::User", "term Lib::User",
-                                      "term Lib::Base", "term Lib::Other"}),
-            mLog);
+  EXPECT_EQ((std::vector<std::string>{"init Other:x", "init Loader:x", "init Loaded", "init User:x", "term User",
+                                      "term Loader", "term Loaded", "term Other"}),
+            sLog);
 }
 
-TEST_F(InitializerRegistryTest, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminated) {
+// A cycle fails; a failing or throwing init stops the run and is tried again
+// next time; a withdrawn entry is not terminated; a throwing terminator does
+// not keep the others from running.
+TEST(InitializerRegistry, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminated) {
+  sLog.clear();
+  {
+    const auto egg = Entry("Egg", "Hen");
+    const auto hen = Entry("Hen", "Egg");
+    EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
+  }
   bool succeed = false;
-  Register("Lib::A", nullptr, [](const PropList&) { return true; },
-           [] { throw std::runtime_error("teardown failed"); });
-  Register("Lib::B", nullptr, [&succeed](const PropList&) { return succeed; });
-  Register("Lib::C", nullptr, [](const PropList&) -> bool { throw std::runtime_error("no"); });
-  Register("Lib::D");
+  const auto a = Entry("!A");
+  const auto b = Entry("B", nullptr, [&succeed] { return succeed; });
+  auto c = Entry("C", nullptr, []() -> bool { throw std::runtime_error("no"); });
+  auto d = Entry("D");
   EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
   succeed = true;
-  EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList())) << "a throwing init is a failure";
-  mRegistrars[2].reset();
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  mRegistrars[3].reset();
-  // A throwing terminator does not keep the others from running.
-  EXPECT_THROW(InitializerRegistry::TerminateAll(), std::runtime_error);
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A", "init Lib::B", "init Lib::B", "init Lib::C", "init Lib::D",
-                                      "term Lib::B", "term Lib::A"}),
-            mLog);
-  EXPECT_FALSE(InitializerRegistry::IsRegistered("Lib::D"));
-
-  // A cycle fails and runs neither side.
-  mRegistrars.clear();
-  mLog.clear();
-  Register("Lib::Egg", "Lib::Hen");
-  Register("Lib::Hen", "Lib::Egg");
   EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_TRUE(mLog.empty());
-}
-
-// An init function may load a library (registering newcomers, which run in
-// the same pass) and may itself call InitializeAll. The nested call leaves an
-// entry that depends on the init still running to the outer call; that is
-// no failure.
-TEST_F(InitializerRegistryTest, InitFunctionsMayRegisterAndInitializeMore) {
-  bool nested = false;
-  Register("Lib::Loader", nullptr, [&](const PropList& inProperties) {
-    Register("Lib::Loaded");
-    nested = InitializerRegistry::InitializeAll(inProperties);
-    return true;
-  });
-  Register("Lib::User", "Lib::Loader");
+  c.reset();
   EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_TRUE(nested);
-  EXPECT_EQ((std::vector<std::string>{"init Lib::Loader", "init Lib::Loaded", "init Lib::User"}), mLog);
+  d.reset();
+  EXPECT_THROW(InitializerRegistry::TerminateAll(), std::runtime_error);
+  EXPECT_EQ((std::vector<std::string>{"init !A", "init B", "init B", "init C", "init D", "term B", "term !A"}), sLog);
 }
 
 }  // namespace

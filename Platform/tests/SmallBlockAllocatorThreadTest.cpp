@@ -7,164 +7,126 @@
 #include <pthread.h>
 
 #include <atomic>
+#include <cstdint>
 #include <cstring>
-#include <mutex>
 #include <random>
-#include <thread>
-#include <vector>
 
 using kivcore::utility::SmallBlockAllocator;
-using platform_test::Latch;
-using platform_test::ThreadGroup;
 
 namespace {
 
+// A block filled with one byte: a block shorter than asked, or handed to two
+// owners at once, shows up as a damaged stamp.
 struct Stamped {
-  void* block;
+  unsigned char* block;
   std::size_t size;
-  unsigned char stamp;
-
-  bool Intact() const {
-    for (std::size_t i = 0; i < size; ++i)
-      if (static_cast<const unsigned char*>(block)[i] != stamp) return false;
-    return true;
-  }
 };
 
-// Threads allocate, stamp, check and free at random, mail some blocks to the
-// next thread to free, and leave the rest to outlive them. A block handed to
-// two owners at once shows up as a damaged stamp; the statistics must still
-// add up once the threads (and their caches) are gone.
-TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThem) {
-  constexpr int kThreads = 4;
-  constexpr int kSteps = 30000;
+Stamped Make(std::size_t inSize, int inStamp) {
+  auto* block = static_cast<unsigned char*>(SmallBlockAllocator::Allocate(inSize));
+  if (block != nullptr) std::memset(block, inStamp, inSize + (inSize == 0));
+  return Stamped{block, inSize};
+}
+
+// Disposes of the block; false when it was null, misaligned or damaged.
+bool DisposeIntact(const Stamped& inBlock) {
+  bool intact =
+      inBlock.block != nullptr && reinterpret_cast<std::uintptr_t>(inBlock.block) % alignof(std::max_align_t) == 0;
+  for (std::size_t i = 1; intact && i < inBlock.size; ++i) intact = inBlock.block[i] == inBlock.block[0];
+  SmallBlockAllocator::Dispose(inBlock.block, inBlock.size);
+  return intact;
+}
+
+// The statistics now, against inBefore: blocks and bytes in use, and
+// allocations made since.
+void ExpectCounts(const SmallBlockAllocator::Statistics& inBefore, std::size_t inBlocks, std::size_t inBytes,
+                  std::uint64_t inAllocations) {
+  const auto now = SmallBlockAllocator::GetStatistics();
+  EXPECT_EQ(inBefore.blocksInUse + inBlocks, now.blocksInUse);
+  EXPECT_EQ(inBefore.bytesInUse + inBytes, now.bytesInUse);
+  EXPECT_EQ(inBefore.allocations + inAllocations, now.allocations);
+}
+
+// Small and large requests use up the allowance alike; refusals are not
+// counted; disposal goes on; a negative count ends the failures. The adaptor
+// turns a refusal (or an impossible size) into std::bad_alloc and leaves its
+// container as it was.
+TEST(SmallBlockAllocator, FailAfterRefusesAllocationsOnceTheAllowanceIsUsedUp) {
+  std::vector<int, SmallBlockAllocator::STLAllocator<int>> numbers{1, 2, 3};
   const auto before = SmallBlockAllocator::GetStatistics();
+  SmallBlockAllocator::SetFailAfter(2);
+  const Stamped granted[] = {Make(16, 1), Make(2000, 2)};
+  for (std::size_t size : {16u, 2000u, 0u}) EXPECT_EQ(nullptr, SmallBlockAllocator::Allocate(size)) << size;
+  EXPECT_THROW(numbers.reserve(100), std::bad_alloc);
+  ExpectCounts(before, 2, 2016, 2);
+  EXPECT_TRUE(DisposeIntact(granted[0]) && DisposeIntact(granted[1]));
+  SmallBlockAllocator::SetFailAfter(-1);
+  EXPECT_TRUE(DisposeIntact(Make(8, 4)) && numbers.size() == 3 && numbers[2] == 3);
+  EXPECT_THROW(SmallBlockAllocator::STLAllocator<std::uint64_t>().allocate(std::size_t{1} << 62), std::bad_alloc);
+  SmallBlockAllocator::Dispose(nullptr, 24);
+  ExpectCounts(before, 0, 0, 3);
+}
+
+// Each thread takes a burst of blocks (spanning several pool chunks, and
+// overflowing its cache when they come back), then allocates, checks and
+// frees sizes up to beyond the small limit at random, and leaves the rest
+// to outlive it, freed here. No block is shared, every block is aligned,
+// and the counts of threads (and caches) that are gone still add up.
+TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThem) {
+  const auto before = SmallBlockAllocator::GetStatistics();
+  std::atomic<std::size_t> made{0};
   std::atomic<int> damaged{0};
-  std::atomic<std::uint64_t> made{0};
-  std::mutex mutex;
-  std::vector<Stamped> mail[kThreads];  // guarded by mutex
-  std::vector<Stamped> leftOver;        // guarded by mutex
+  std::vector<Stamped> leftOver[4];  // each thread's, once it is gone
   {
-    Latch start(kThreads);
-    ThreadGroup threads;
-    for (int t = 0; t < kThreads; ++t) {
+    platform_test::ThreadGroup threads;
+    for (unsigned t = 0; t < 4; ++t) {
       threads.Start([&, t] {
-        std::mt19937 random(1234u + static_cast<unsigned>(t));
+        std::mt19937 random(t);
         std::vector<Stamped> live;
-        start.CountDown();
-        start.WaitFor();
-        for (int step = 0; step < kSteps; ++step) {
-          if (random() % 2 == 0 || live.empty()) {
-            const std::size_t size = random() % 4 == 0 ? 1 + random() % 1500 : 1 + random() % 128;
-            Stamped s{SmallBlockAllocator::Allocate(size), size, static_cast<unsigned char>(random())};
-            if (s.block == nullptr) {  // storage is not short here: a refusal is a fault
-              damaged.fetch_add(1);
-              continue;
-            }
+        for (int step = 0; step < 40000; ++step) {
+          if (step < 3000 || random() % 2 == 0 || live.empty()) {
+            live.push_back(Make(step < 3000 ? 48 : random() % 4 == 0 ? random() % 1500 : random() % 128, step));
             made.fetch_add(1);
-            std::memset(s.block, s.stamp, s.size);
-            live.push_back(s);
-            continue;
-          }
-          const std::size_t pick = random() % live.size();
-          const Stamped s = live[pick];
-          live[pick] = live.back();
-          live.pop_back();
-          if (!s.Intact()) damaged.fetch_add(1);
-          std::vector<Stamped> received;
-          {
-            std::lock_guard<std::mutex> lock(mutex);
-            if (step % 4 == 0) mail[(t + 1) % kThreads].push_back(s);
-            received.swap(mail[t]);
-          }
-          if (step % 4 != 0) SmallBlockAllocator::Dispose(s.block, s.size);
-          for (const Stamped& r : received) {
-            if (!r.Intact()) damaged.fetch_add(1);
-            SmallBlockAllocator::Dispose(r.block, r.size);
+          } else {
+            std::swap(live[step < 10000 ? 0 : random() % live.size()], live.back());
+            damaged.fetch_add(!DisposeIntact(live.back()));
+            live.pop_back();
           }
         }
-        std::lock_guard<std::mutex> lock(mutex);
-        leftOver.insert(leftOver.end(), live.begin(), live.end());
+        leftOver[t] = std::move(live);
       });
     }
   }
-  for (auto& box : mail) leftOver.insert(leftOver.end(), box.begin(), box.end());
+  for (int t = 1; t < 4; ++t) leftOver[0].insert(leftOver[0].end(), leftOver[t].begin(), leftOver[t].end());
   std::size_t bytes = 0;
-  for (const Stamped& s : leftOver) bytes += s.size;
-  const auto during = SmallBlockAllocator::GetStatistics();
-  EXPECT_EQ(before.allocations + made.load(), during.allocations);
-  EXPECT_EQ(before.blocksInUse + leftOver.size(), during.blocksInUse);
-  EXPECT_EQ(before.bytesInUse + bytes, during.bytesInUse);
-  for (const Stamped& s : leftOver) {
-    if (!s.Intact()) damaged.fetch_add(1);
-    SmallBlockAllocator::Dispose(s.block, s.size);
-  }
+  for (const Stamped& s : leftOver[0]) bytes += s.size;
+  ExpectCounts(before, leftOver[0].size(), bytes, made);
+  for (const Stamped& s : leftOver[0]) EXPECT_TRUE(DisposeIntact(s));
   EXPECT_EQ(0, damaged.load());
-  const auto after = SmallBlockAllocator::GetStatistics();
-  EXPECT_EQ(before.blocksInUse, after.blocksInUse);
-  EXPECT_EQ(before.bytesInUse, after.bytesInUse);
+  ExpectCounts(before, 0, 0, made);
 }
 
 std::atomic<void*> sLateBlock{nullptr};
-
-// Allocates as its thread exits, after the thread's first allocation: being
-// constructed first, it is destroyed last.
-struct LateUser {
-  ~LateUser() { sLateBlock.store(SmallBlockAllocator::Allocate(40)); }
-};
 
 // A thread's first allocation may come from a thread-specific-data
 // destructor (a GLib or Boost cleanup releasing an object), after the C++
 // thread_local destructors have run. Its cache must still be retired with the
 // thread: otherwise the next thread, reusing that thread's storage, corrupts
 // the registry of caches (lost counts, then GetStatistics looping for ever).
-TEST(SmallBlockAllocatorThreads, AllocationsWhileAThreadExitsAreCountedAndRetiredWithIt) {
+TEST(SmallBlockAllocatorThreads, FirstAllocationInAThreadExitCleanupIsCountedAndRetiredWithTheThread) {
   tarn_test::Watchdog watchdog;
   pthread_key_t key;
-  ASSERT_EQ(0, pthread_key_create(&key, [](void*) { sLateBlock.store(SmallBlockAllocator::Allocate(40)); }));
+  ASSERT_EQ(0, pthread_key_create(&key, [](void*) { sLateBlock = SmallBlockAllocator::Allocate(40); }));
   const auto before = SmallBlockAllocator::GetStatistics();
   for (int round = 1; round <= 20; ++round) {
     std::thread([key] { pthread_setspecific(key, &sLateBlock); }).join();
-    void* fromKeyDestructor = sLateBlock.exchange(nullptr);
-    std::thread([] {
-      static thread_local LateUser user;
-      SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(24), 24);
-    }).join();
-    void* fromThreadLocal = sLateBlock.exchange(nullptr);
-    ASSERT_TRUE(fromKeyDestructor != nullptr && fromThreadLocal != nullptr);
-    EXPECT_EQ(before.blocksInUse + 2, SmallBlockAllocator::GetStatistics().blocksInUse) << "round " << round;
-    SmallBlockAllocator::Dispose(fromKeyDestructor, 40);
-    SmallBlockAllocator::Dispose(fromThreadLocal, 40);
-    const auto now = SmallBlockAllocator::GetStatistics();
-    ASSERT_EQ(before.blocksInUse, now.blocksInUse) << "round " << round;
-    ASSERT_EQ(before.allocations + 3 * round, now.allocations) << "round " << round;
+    ExpectCounts(before, 1, 40, 2 * round - 1);
+    std::thread([] { SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(24), 24); }).join();
+    SmallBlockAllocator::Dispose(sLateBlock.exchange(nullptr), 40);
+    ExpectCounts(before, 0, 0, 2 * round);
+    ASSERT_FALSE(HasFailure()) << "round " << round;
   }
   pthread_key_delete(key);
-}
-
-TEST(SmallBlockAllocatorThreads, FailAfterGrantsExactlyTheAllowanceAcrossThreads) {
-  constexpr int kThreads = 4;
-  constexpr int kAllowed = 300;
-  std::atomic<int> granted{0};
-  std::vector<void*> blocks[kThreads];
-  SmallBlockAllocator::SetFailAfter(kAllowed);
-  {
-    Latch start(kThreads);
-    ThreadGroup threads;
-    for (int t = 0; t < kThreads; ++t) {
-      threads.Start([&, t] {
-        start.CountDown();
-        start.WaitFor();
-        for (int i = 0; i < kAllowed; ++i)
-          if (void* block = SmallBlockAllocator::Allocate(24)) blocks[t].push_back(block);
-        granted.fetch_add(static_cast<int>(blocks[t].size()));
-      });
-    }
-  }
-  SmallBlockAllocator::SetFailAfter(-1);
-  EXPECT_EQ(kAllowed, granted.load());
-  for (auto& list : blocks)
-    for (void* block : list) SmallBlockAllocator::Dispose(block, 24);
 }
 
 }  // namespace
