@@ -17,10 +17,7 @@ namespace {
 
 // A block filled with one byte: a block shorter than asked, or handed to two
 // owners at once, shows up as a damaged stamp.
-struct Stamped {
-  unsigned char* block;
-  std::size_t size;
-};
+using Stamped = std::pair<unsigned char*, std::size_t>;  // a block and its size
 
 Stamped Make(std::size_t inSize, int inStamp) {
   auto* block = static_cast<unsigned char*>(SmallBlockAllocator::Allocate(inSize));
@@ -30,10 +27,10 @@ Stamped Make(std::size_t inSize, int inStamp) {
 
 // Disposes of the block; false when it was null, misaligned or damaged.
 bool DisposeIntact(const Stamped& inBlock) {
-  bool intact =
-      inBlock.block != nullptr && reinterpret_cast<std::uintptr_t>(inBlock.block) % alignof(std::max_align_t) == 0;
-  for (std::size_t i = 1; intact && i < inBlock.size; ++i) intact = inBlock.block[i] == inBlock.block[0];
-  SmallBlockAllocator::Dispose(inBlock.block, inBlock.size);
+  const auto [block, size] = inBlock;
+  bool intact = block != nullptr && reinterpret_cast<std::uintptr_t>(block) % alignof(std::max_align_t) == 0;
+  for (std::size_t i = 1; intact && i < size; ++i) intact = block[i] == block[0];
+  SmallBlockAllocator::Dispose(block, size);
   return intact;
 }
 
@@ -99,7 +96,7 @@ TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThe
   }
   for (int t = 1; t < 4; ++t) leftOver[0].insert(leftOver[0].end(), leftOver[t].begin(), leftOver[t].end());
   std::size_t bytes = 0;
-  for (const Stamped& s : leftOver[0]) bytes += s.size;
+  for (const Stamped& s : leftOver[0]) bytes += s.second;
   ExpectCounts(before, leftOver[0].size(), bytes, made);
   for (const Stamped& s : leftOver[0]) EXPECT_TRUE(DisposeIntact(s));
   EXPECT_EQ(0, damaged.load());
@@ -108,22 +105,34 @@ TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThe
 
 std::atomic<void*> sLateBlock{nullptr};
 
-// A thread's first allocation may come from a thread-specific-data
-// destructor (a GLib or Boost cleanup releasing an object), after the C++
-// thread_local destructors have run. Its cache must still be retired with the
-// thread: otherwise the next thread, reusing that thread's storage, corrupts
-// the registry of caches (lost counts, then GetStatistics looping for ever).
-TEST(SmallBlockAllocatorThreads, FirstAllocationInAThreadExitCleanupIsCountedAndRetiredWithTheThread) {
+// A thread-specific-data destructor (a GLib or Boost cleanup releasing
+// objects): for its thread, the first use of the allocator, or a use after
+// the thread's cache is retired (the allocator's key is older, so its
+// destructor runs first).
+void ExitCleanup(void*) {
+  SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(1000), 1000);
+  SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(24), 24);
+  sLateBlock = SmallBlockAllocator::Allocate(40);
+}
+
+// Such a cleanup runs after the C++ thread_local destructors. A cache it
+// starts must still be retired with the thread: otherwise the next thread,
+// reusing that thread's storage, corrupts the registry of caches (lost
+// counts, then GetStatistics looping for ever).
+TEST(SmallBlockAllocatorThreads, AllocationsInAThreadExitCleanupAreCountedAndRetiredWithTheThread) {
   tarn_test::Watchdog watchdog;
+  SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(8), 8);  // the allocator's key first
   pthread_key_t key;
-  ASSERT_EQ(0, pthread_key_create(&key, [](void*) { sLateBlock = SmallBlockAllocator::Allocate(40); }));
+  ASSERT_EQ(0, pthread_key_create(&key, &ExitCleanup));
   const auto before = SmallBlockAllocator::GetStatistics();
   for (int round = 1; round <= 20; ++round) {
-    std::thread([key] { pthread_setspecific(key, &sLateBlock); }).join();
-    ExpectCounts(before, 1, 40, 2 * round - 1);
+    std::thread([key, round] {
+      pthread_setspecific(key, &sLateBlock);
+      if (round % 2 == 0) SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(24), 24);
+    }).join();
     std::thread([] { SmallBlockAllocator::Dispose(SmallBlockAllocator::Allocate(24), 24); }).join();
     SmallBlockAllocator::Dispose(sLateBlock.exchange(nullptr), 40);
-    ExpectCounts(before, 0, 0, 2 * round);
+    ExpectCounts(before, 0, 0, 4 * round + round / 2);
     ASSERT_FALSE(HasFailure()) << "round " << round;
   }
   pthread_key_delete(key);
