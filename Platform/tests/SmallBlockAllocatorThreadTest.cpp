@@ -64,7 +64,7 @@ TEST(SmallBlockAllocator, FailAfterRefusesAllocationsOnceTheAllowanceIsUsedUp) {
   ExpectCounts(before, 0, 0, 3);
 }
 
-// Each thread takes a burst of blocks (spanning several pool chunks, and
+// Each thread takes bursts of blocks (spanning several pool chunks, and
 // overflowing its cache when they come back), then allocates, checks and
 // frees sizes up to beyond the small limit at random, and leaves the rest
 // to outlive it, freed here. No block is shared, every block is aligned,
@@ -74,26 +74,29 @@ TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThe
   std::atomic<std::size_t> made{0};
   std::atomic<int> damaged{0};
   std::vector<Stamped> leftOver[4];  // each thread's, once it is gone
-  {
-    platform_test::ThreadGroup threads;
-    for (unsigned t = 0; t < 4; ++t) {
-      threads.Start([&, t] {
-        std::mt19937 random(t);
-        std::vector<Stamped> live;
-        for (int step = 0; step < 40000; ++step) {
-          if (step < 3000 || random() % 2 == 0 || live.empty()) {
-            live.push_back(Make(step < 3000 ? 48 : random() % 4 == 0 ? random() % 1500 : random() % 128, step));
-            made.fetch_add(1);
-          } else {
-            std::swap(live[step < 10000 ? 0 : random() % live.size()], live.back());
-            damaged.fetch_add(!DisposeIntact(live.back()));
-            live.pop_back();
-          }
+  platform_test::ThreadGroup threads;
+  for (unsigned t = 0; t < 4; ++t) {
+    threads.Start([&, t] {
+      std::mt19937 random(t);
+      std::vector<Stamped> live;
+      for (int step = 0; step < 40000; ++step) {
+        const int burst = step < 3000   ? 0
+                          : step < 6000 ? 1
+                          : step < 7000 ? 2
+                                        : -1;  // taken, returned, some taken again
+        if (burst == 0 || burst == 2 || (burst < 0 && (random() % 2 == 0 || live.empty()))) {
+          live.push_back(Make(burst >= 0 ? 48 : random() % 4 == 0 ? random() % 1500 : random() % 128, step));
+          made.fetch_add(1);
+        } else {
+          std::swap(live[burst == 1 ? 0 : random() % live.size()], live.back());
+          damaged.fetch_add(!DisposeIntact(live.back()));
+          live.pop_back();
         }
-        leftOver[t] = std::move(live);
-      });
-    }
+      }
+      leftOver[t] = std::move(live);
+    });
   }
+  threads.JoinAll();
   for (int t = 1; t < 4; ++t) leftOver[0].insert(leftOver[0].end(), leftOver[t].begin(), leftOver[t].end());
   std::size_t bytes = 0;
   for (const Stamped& s : leftOver[0]) bytes += s.second;
