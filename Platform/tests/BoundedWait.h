@@ -1,7 +1,8 @@
 // Bounded waits shared by the test suites: a deadline, a latch, polling with
 // a deadline, a group of threads that must finish in time, and a watchdog. A
 // deadlock then fails (or stops) the test with a message naming it, instead
-// of hanging the run.
+// of hanging the run. None of the classes can be copied or moved: each holds
+// a mutex.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -29,8 +30,6 @@ constexpr std::chrono::seconds kDeadline{20};
 class Latch {
 public:
   explicit Latch(int inCount = 1) : mCount(inCount) {}
-  Latch(const Latch&) = delete;
-  Latch& operator=(const Latch&) = delete;
 
   void CountDown() {
     std::lock_guard<std::mutex> lock(mMutex);
@@ -41,13 +40,9 @@ public:
     std::unique_lock<std::mutex> lock(mMutex);
     return mReached.wait_for(lock, inTimeout, [this] { return mCount == 0; });
   }
-  bool IsReleased() const {
-    std::lock_guard<std::mutex> lock(mMutex);
-    return mCount == 0;
-  }
 
 private:
-  mutable std::mutex mMutex;
+  std::mutex mMutex;
   std::condition_variable mReached;
   int mCount;  // guarded by mMutex
 };
@@ -83,9 +78,6 @@ inline void AbortNamingTheTest(const char* inWhat) {
 // stack), so the process stops with a message naming the test.
 class ThreadGroup {
 public:
-  ThreadGroup() = default;
-  ThreadGroup(const ThreadGroup&) = delete;
-  ThreadGroup& operator=(const ThreadGroup&) = delete;
   ~ThreadGroup() { JoinAll(); }
 
   void Start(std::function<void()> inBody) {
@@ -98,14 +90,11 @@ public:
   }
 
   void JoinAll() {
-    {
-      std::unique_lock<std::mutex> lock(mMutex);
-      if (!mChanged.wait_for(lock, kDeadline, [this] { return mFinished == mThreads.size(); })) {
-        detail::AbortNamingTheTest("threads still running after the deadline (deadlock?)");
-      }
-    }
-    for (std::thread& thread : mThreads)
-      if (thread.joinable()) thread.join();
+    std::unique_lock<std::mutex> lock(mMutex);
+    if (!mChanged.wait_for(lock, kDeadline, [this] { return mFinished == mThreads.size(); }))
+      detail::AbortNamingTheTest("threads still running after the deadline (deadlock?)");
+    lock.unlock();
+    for (std::thread& thread : mThreads) thread.join();
     mThreads.clear();
     mFinished = 0;
   }
@@ -128,13 +117,10 @@ public:
           if (!mDisarmed.wait_for(lock, inLimit, [this] { return mDone; }))
             detail::AbortNamingTheTest("still running when the watchdog expired (deadlock?)");
         }) {}
-  Watchdog(const Watchdog&) = delete;
-  Watchdog& operator=(const Watchdog&) = delete;
   ~Watchdog() {
-    {
-      std::lock_guard<std::mutex> lock(mMutex);
-      mDone = true;
-    }
+    std::unique_lock<std::mutex> lock(mMutex);
+    mDone = true;
+    lock.unlock();
     mDisarmed.notify_all();
     mThread.join();
   }

@@ -1,5 +1,3 @@
-#include "TestSupport.h"
-
 #include <kivcore/InitializerRegistry.h>
 
 #include <gtest/gtest.h>
@@ -14,183 +12,78 @@ using kivcore::proplist::PropList;
 
 namespace {
 
-InitializerDependencies NoDependencies() { return InitializerDependencies{}; }
+std::vector<std::string> sLog;  // what the entries below did, in order
 
-InitializerDependencies DependsOn(const char* inName) {
-  InitializerDependencies dependencies{};
-  dependencies[0] = inName;
-  return dependencies;
-}
-
-// Registrars made by a test, and the log of what ran. Every registrar is
-// withdrawn, after a final TerminateAll, when the test ends.
-class InitializerRegistryTest : public ::testing::Test {
-protected:
-  void TearDown() override {
-    InitializerRegistry::TerminateAll();
-    mRegistrars.clear();
-  }
-
-  void Register(const char* inName, const InitializerDependencies& inDependencies = NoDependencies(),
-                std::function<bool()> inInit = [] { return true; }) {
-    mRegistrars.push_back(std::make_unique<InitializerRegistrar>(
-        inName, EInitializerContextFlags(10),
-        [this, name = std::string(inName), inInit](const PropList&) {
-          mLog.push_back("init " + name);
-          return inInit();
-        },
-        [this, name = std::string(inName)] { mLog.push_back("term " + name); }, inDependencies));
-  }
-
-  std::vector<std::unique_ptr<InitializerRegistrar>> mRegistrars;
-  std::vector<std::string> mLog;
-};
-
-TEST_F(InitializerRegistryTest, NothingRunsUntilTheHostAsks) {
-  Register("Lib::A");
-  EXPECT_TRUE(mLog.empty());
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A"}), mLog);
-}
-
-TEST_F(InitializerRegistryTest, InitializersRunInRegistrationOrderAndTerminateInReverse) {
-  Register("Lib::A");
-  Register("Lib::B");
-  Register("Lib::C");
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  InitializerRegistry::TerminateAll();
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A", "init Lib::B", "init Lib::C", "term Lib::C", "term Lib::B",
-                                      "term Lib::A"}),
-            mLog);
-}
-
-TEST_F(InitializerRegistryTest, DependencyRegisteredLaterRunsFirstAndTerminatesLast) {
-  Register("Lib::User", DependsOn("Lib::Base"));
-  Register("Lib::Other");
-  Register("Lib::Base");
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  InitializerRegistry::TerminateAll();
-  EXPECT_EQ((std::vector<std::string>{"init Lib::Other", "init Lib::Base", "init Lib::User", "term Lib::User",
-                                      "term Lib::Base", "term Lib::Other"}),
-            mLog);
-}
-
-TEST_F(InitializerRegistryTest, DependencyThatIsNotRegisteredIsIgnored) {
-  Register("Lib::A", DependsOn("Lib::Missing"));
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A"}), mLog);
-}
-
-TEST_F(InitializerRegistryTest, DependencyCycleIsAFailureAndRunsNeither) {
-  Register("Lib::A", DependsOn("Lib::B"));
-  Register("Lib::B", DependsOn("Lib::A"));
-  EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_TRUE(mLog.empty());
-}
-
-TEST_F(InitializerRegistryTest, FailingInitializerStopsTheRunAndIsRetriedNextTime) {
-  bool succeed = false;
-  Register("Lib::A");
-  Register("Lib::B", NoDependencies(), [&succeed] { return succeed; });
-  Register("Lib::C");
-  EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A", "init Lib::B"}), mLog);
-
-  // Only what was initialized is terminated.
-  InitializerRegistry::TerminateAll();
-  EXPECT_EQ("term Lib::A", mLog.back());
-  EXPECT_EQ(3u, mLog.size());
-
-  mLog.clear();
-  succeed = true;
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A", "init Lib::B", "init Lib::C"}), mLog);
-}
-
-TEST_F(InitializerRegistryTest, ThrowingInitializerCountsAsAFailure) {
-  Register("Lib::A", NoDependencies(), []() -> bool { throw std::runtime_error("no"); });
-  Register("Lib::B");
-  EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A"}), mLog);
-}
-
-TEST_F(InitializerRegistryTest, InitializedEntriesRunOnlyOnceUntilTerminated) {
-  Register("Lib::A");
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  Register("Lib::B");
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  InitializerRegistry::TerminateAll();
-  InitializerRegistry::TerminateAll();
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A", "init Lib::B", "term Lib::B", "term Lib::A", "init Lib::A",
-                                      "init Lib::B"}),
-            mLog);
-}
-
-TEST_F(InitializerRegistryTest, InitializersReceiveTheHostsProperties) {
-  std::string seen;
-  InitializerRegistrar registrar(
-      "Lib::Props", EInitializerContextFlags(0),
-      [&seen](const PropList& inProperties) {
-        seen = inProperties.Get("mode", "none");
-        return true;
+// An entry, withdrawn when the registrar goes, that logs its init and its
+// termination. Its init answers inInit(); a name starting with '!' has a
+// terminator that throws.
+std::unique_ptr<InitializerRegistrar> Entry(
+    std::string inName, const char* inDependency = nullptr, std::function<bool()> inInit = [] { return true; }) {
+  return std::make_unique<InitializerRegistrar>(
+      inName.c_str(), EInitializerContextFlags(10),
+      [inName, inInit](const PropList& inProperties) {
+        sLog.push_back("init " + inName + inProperties.Get("mode"));
+        return inInit();
       },
-      nullptr, NoDependencies());
-  PropList properties;
-  properties.Set("mode", "headless");
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(properties));
-  EXPECT_EQ("headless", seen);
-  InitializerRegistry::TerminateAll();
+      [inName] {
+        sLog.push_back("term " + inName);
+        if (inName[0] == '!') throw std::runtime_error("teardown failed");
+      },
+      InitializerDependencies{inDependency});
 }
 
-TEST_F(InitializerRegistryTest, RegistrationIsVisibleWithItsFlagsUntilWithdrawn) {
-  unsigned int flags = 0;
-  EXPECT_FALSE(InitializerRegistry::IsRegistered("Lib::Flagged"));
-  {
-    InitializerRegistrar registrar("Lib::Flagged", EInitializerContextFlags(10), nullptr, nullptr, NoDependencies());
-    EXPECT_TRUE(InitializerRegistry::IsRegistered("Lib::Flagged", &flags));
-    EXPECT_EQ(10u, flags);
-  }
-  EXPECT_FALSE(InitializerRegistry::IsRegistered("Lib::Flagged"));
-}
-
-TEST_F(InitializerRegistryTest, WithdrawnInitializerIsNeitherInitializedNorTerminated) {
-  Register("Lib::A");
-  Register("Lib::B");
-  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
-  mRegistrars.back().reset();
-  InitializerRegistry::TerminateAll();
-  EXPECT_EQ((std::vector<std::string>{"init Lib::A", "init Lib::B", "term Lib::A"}), mLog);
-}
-
-// An initializer that loads a library registers new initializers while it
-// runs; the registry's lock must not be held then, and the newcomer runs in
-// the same pass.
-TEST_F(InitializerRegistryTest, InitializerMayRegisterAnotherThatRunsInTheSamePass) {
-  bool result = false;
-  platform_test::ThreadGroup threads;
-  threads.Start([&] {
-    Register("Lib::Loader", NoDependencies(), [this] {
-      Register("Lib::Loaded");
-      return true;
-    });
-    result = InitializerRegistry::InitializeAll(PropList());
+// Entries run after what they depend on (a dependency not registered holds
+// nothing back), once, and terminate in the reverse order of their inits'
+// completion. An init function may load a library (registering newcomers,
+// which run in the same pass) and call InitializeAll itself: the nested call
+// leaves an entry that waits for the init still running to the outer call,
+// and that is no failure.
+TEST(InitializerRegistry, EntriesRunInDependencyOrderAndInitFunctionsMayInitializeMore) {
+  sLog.clear();
+  bool nested = false;
+  std::unique_ptr<InitializerRegistrar> loaded;
+  const auto user = Entry("User", "Loader");
+  const auto other = Entry("Other", "NotRegistered");
+  const auto loader = Entry("Loader", nullptr, [&] {
+    loaded = Entry("Loaded", "Other");
+    nested = InitializerRegistry::InitializeAll(PropList());
+    return true;
   });
-  threads.JoinAll();
-  EXPECT_TRUE(result);
-  EXPECT_EQ((std::vector<std::string>{"init Lib::Loader", "init Lib::Loaded"}), mLog);
+  PropList properties;
+  properties.Set("mode", ":x");
+  EXPECT_TRUE(InitializerRegistry::InitializeAll(properties));
+  EXPECT_TRUE(nested);
+  EXPECT_TRUE(InitializerRegistry::InitializeAll(properties)) << "initialized entries do not run again";
+  InitializerRegistry::TerminateAll();
+  InitializerRegistry::TerminateAll();
+  EXPECT_EQ((std::vector<std::string>{"init Other:x", "init Loader:x", "init Loaded", "init User:x", "term User",
+                                      "term Loader", "term Loaded", "term Other"}),
+            sLog);
 }
 
-TEST_F(InitializerRegistryTest, AllTerminatorsRunEvenWhenOneThrows) {
-  InitializerRegistrar first("Lib::First", EInitializerContextFlags(0), nullptr,
-                             [this] { mLog.push_back("term Lib::First"); }, NoDependencies());
-  InitializerRegistrar failing("Lib::Failing", EInitializerContextFlags(0), nullptr,
-                               [] { throw std::runtime_error("teardown failed"); }, NoDependencies());
-  InitializerRegistrar last("Lib::Last", EInitializerContextFlags(0), nullptr,
-                            [this] { mLog.push_back("term Lib::Last"); }, NoDependencies());
+// A cycle fails; a failing or throwing init stops the run and is tried again
+// next time; a withdrawn entry is not terminated; a throwing terminator does
+// not keep the others from running.
+TEST(InitializerRegistry, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminated) {
+  sLog.clear();
+  {
+    const auto egg = Entry("Egg", "Hen");
+    const auto hen = Entry("Hen", "Egg");
+    EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
+  }
+  bool succeed = false;
+  const auto a = Entry("!A");
+  const auto b = Entry("B", nullptr, [&succeed] { return succeed; });
+  auto c = Entry("C", nullptr, []() -> bool { throw std::runtime_error("no"); });
+  auto d = Entry("D");
+  EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
+  succeed = true;
+  EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList()));
+  c.reset();
   EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
+  d.reset();
   EXPECT_THROW(InitializerRegistry::TerminateAll(), std::runtime_error);
-  EXPECT_EQ((std::vector<std::string>{"term Lib::Last", "term Lib::First"}), mLog);
+  EXPECT_EQ((std::vector<std::string>{"init !A", "init B", "init B", "init C", "init D", "term B", "term !A"}), sLog);
 }
 
 }  // namespace

@@ -58,6 +58,29 @@ bool DependenciesReady(const Registry& inRegistry, const Entry& inEntry) {
   return true;
 }
 
+// Whether every entry still waiting could run once the entries now running
+// have finished: true when none waits, or when those left wait only for an
+// init on this thread's stack (InitializeAll called from an init function);
+// false when some wait for one another (a cycle). Caller holds the registry
+// mutex.
+bool OnlyWaitingForRunning(const Registry& inRegistry) {
+  const std::vector<Entry>& entries = inRegistry.entries;
+  std::vector<bool> willRun(entries.size());
+  for (std::size_t i = 0; i < entries.size(); ++i) willRun[i] = entries[i].state != EntryState::kRegistered;
+  for (bool progress = true; progress;) {
+    progress = false;
+    for (std::size_t i = 0; i < entries.size(); ++i) {
+      if (willRun[i]) continue;
+      bool ready = true;
+      for (const std::string& dependency : entries[i].dependencies)
+        for (std::size_t d = 0; d < entries.size() && ready; ++d)
+          ready = entries[d].name != dependency || willRun[d];
+      if (ready) willRun[i] = progress = true;
+    }
+  }
+  return std::find(willRun.begin(), willRun.end(), false) == willRun.end();
+}
+
 Entry* FindById(Registry& ioRegistry, unsigned long inId) {
   for (Entry& entry : ioRegistry.entries)
     if (entry.id == inId) return &entry;
@@ -97,22 +120,20 @@ bool InitializerRegistry::InitializeAll(const proplist::PropList& inProperties) 
   for (;;) {
     unsigned long id = 0;
     InitializerFunction init;
-    bool pending = false;
     {
       std::lock_guard<std::mutex> lock(registry.mutex);
       for (Entry& entry : registry.entries) {
-        if (entry.state != EntryState::kRegistered) continue;
-        pending = true;
-        if (!DependenciesReady(registry, entry)) continue;
+        if (entry.state != EntryState::kRegistered || !DependenciesReady(registry, entry)) continue;
         id = entry.id;
         init = entry.init;  // a copy: the entry may move or go while init runs
         entry.state = EntryState::kRunning;
         break;
       }
+      // Nothing left to run now. Entries left waiting for an init still
+      // running are taken up by the call running it once it has finished;
+      // entries whose dependencies can never be met (a cycle) are a failure.
+      if (id == 0) return OnlyWaitingForRunning(registry);
     }
-    // Nothing left, or only entries whose dependencies can never be met (a
-    // cycle): the latter count as a failure.
-    if (id == 0) return !pending;
 
     bool succeeded = false;
     try {

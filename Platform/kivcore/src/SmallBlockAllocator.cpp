@@ -13,6 +13,17 @@
 // has already flushed its cache at exit (or is in the middle of doing so)
 // takes the locked pool path instead of its cache.
 //
+// A thread's cache lives on the heap, not in thread-local storage, and is
+// flushed by a thread-specific-data destructor, not a C++ thread_local one.
+// A thread's first allocation may come from another library's
+// thread-specific-data destructor (a released object's cleanup), after the
+// C++ thread_local destructors have run: a flush registered then would never
+// run, and a record kept in thread-local storage would stay linked into the
+// registry after the next thread reused that storage. A key set during those
+// destructors makes the runtime call ours in a later round. Only a first use
+// in the runtime's very last round escapes the flush; its cache then stays
+// registered for good: its blocks are stranded, its counts still exact.
+//
 // Statistics: each thread counts into its own record, written only by that
 // thread (relaxed load and store, not read-modify-write, so the fast path
 // costs no bus lock) and read by GetStatistics under the registry mutex.
@@ -28,6 +39,9 @@
 #include <atomic>
 #include <cstdlib>
 #include <mutex>
+#include <new>
+
+#include <pthread.h>
 
 namespace kivcore::utility {
 
@@ -178,30 +192,43 @@ struct FreeList {
   std::uint32_t count = 0;
 };
 
+// One thread's cache. Taken from gSpareCaches or malloc when the thread
+// first allocates, handed back to gSpareCaches when it exits; never freed.
 struct ThreadCache {
-  FreeList lists[kClassCount];
+  FreeList lists[kClassCount];  // owned by the thread
   ThreadCounters counters;
-  CacheState state = CacheState::kUnused;
+  ThreadCache* nextSpare = nullptr;  // guarded by gRegistryMutex
 };
 
-// The cache itself: constant-initialized and trivially destructible; the
-// flush at thread exit is done by ThreadCacheRetirer.
-thread_local ThreadCache tCache;
+ThreadCache* gSpareCaches = nullptr;  // flushed, zeroed caches; guarded by gRegistryMutex
+
+// Constant-initialized and trivially destructible, so that a new thread
+// reusing an old thread's storage starts unused.
+thread_local CacheState tState = CacheState::kUnused;
+thread_local ThreadCache* tCache = nullptr;
 // The fast paths reach the cache through this pointer, set while the cache is
-// live. Initial-exec makes reading it one load relative to the thread
-// pointer; it costs 8 bytes of static TLS, which the loader reserves even
-// when the library is opened late.
+// live (and the pools are not bypassed). Initial-exec makes reading it one
+// load relative to the thread pointer; it costs 8 bytes of static TLS, which
+// the loader reserves even when the library is opened late.
 thread_local ThreadCache* tLiveCache __attribute__((tls_model("initial-exec"))) = nullptr;
 
-void RetireThreadCache() noexcept {
-  ThreadCache& cache = tCache;
-  if (cache.state != CacheState::kLive) return;
+// The key whose destructor flushes a thread's cache at exit. Never deleted:
+// the library is linked not to be unloaded (see Platform/CMakeLists.txt), so
+// the destructor stays callable for every thread.
+pthread_once_t gRetireKeyOnce = PTHREAD_ONCE_INIT;
+pthread_key_t gRetireKey;
+bool gRetireKeyMade = false;  // written once under gRetireKeyOnce
+
+// Runs on the exiting thread itself, as its thread-specific data is destroyed.
+void RetireThreadCache(void* inCache) noexcept {
+  auto* cache = static_cast<ThreadCache*>(inCache);
   // From here on this thread's calls take the locked path, including calls
-  // made by thread-local destructors that run after this one.
+  // made by thread-specific-data destructors that run after this one.
   tLiveCache = nullptr;
-  cache.state = CacheState::kRetired;
+  tCache = nullptr;
+  tState = CacheState::kRetired;
   for (std::size_t c = 0; c < kClassCount; ++c) {
-    FreeList& list = cache.lists[c];
+    FreeList& list = cache->lists[c];
     if (list.head == nullptr) continue;
     Block* last = list.head;
     while (last->next != nullptr) last = last->next;
@@ -210,42 +237,55 @@ void RetireThreadCache() noexcept {
     list.count = 0;
   }
   std::lock_guard<std::mutex> lock(gRegistryMutex);
-  ThreadCounters& mine = cache.counters;
+  ThreadCounters& mine = cache->counters;
   gShared.allocations.fetch_add(mine.allocations.load(std::memory_order_relaxed), std::memory_order_relaxed);
   gShared.disposals.fetch_add(mine.disposals.load(std::memory_order_relaxed), std::memory_order_relaxed);
   gShared.bytes.fetch_add(mine.bytes.load(std::memory_order_relaxed), std::memory_order_relaxed);
+  mine.allocations.store(0, std::memory_order_relaxed);
+  mine.disposals.store(0, std::memory_order_relaxed);
+  mine.bytes.store(0, std::memory_order_relaxed);
   if (mine.previous != nullptr) mine.previous->next = mine.next;
   else gLiveThreads = mine.next;
   if (mine.next != nullptr) mine.next->previous = mine.previous;
   mine.previous = mine.next = nullptr;
+  cache->nextSpare = gSpareCaches;
+  gSpareCaches = cache;
 }
 
-struct ThreadCacheRetirer {
-  ~ThreadCacheRetirer() { RetireThreadCache(); }
-};
+void MakeRetireKey() noexcept { gRetireKeyMade = pthread_key_create(&gRetireKey, &RetireThreadCache) == 0; }
 
-// The calling thread's live cache, started on first use (its counters
-// registered, its flush at thread exit arranged); null once the thread has
-// begun to exit.
+// The calling thread's live cache, started on first use (registered, and its
+// flush at thread exit arranged); null once the thread has begun to exit, or
+// when no cache can be had (the locked path then serves the thread).
 ThreadCache* LiveThreadCache() noexcept {
-  ThreadCache& cache = tCache;
-  if (cache.state == CacheState::kLive) return &cache;
-  if (cache.state == CacheState::kRetired) return nullptr;
-  try {
-    static thread_local ThreadCacheRetirer retirer;
-    (void)retirer;
-  } catch (...) {
-    return nullptr;  // the runtime could not register the thread-exit hook
-  }
+  if (tState == CacheState::kLive) return tCache;
+  if (tState == CacheState::kRetired) return nullptr;
+  if (pthread_once(&gRetireKeyOnce, &MakeRetireKey) != 0 || !gRetireKeyMade) return nullptr;
+  ThreadCache* cache = nullptr;
   {
     std::lock_guard<std::mutex> lock(gRegistryMutex);
-    cache.counters.next = gLiveThreads;
-    if (gLiveThreads != nullptr) gLiveThreads->previous = &cache.counters;
-    gLiveThreads = &cache.counters;
+    if ((cache = gSpareCaches) != nullptr) gSpareCaches = cache->nextSpare;
   }
-  cache.state = CacheState::kLive;
-  if (!kBypassPools) tLiveCache = &cache;
-  return &cache;
+  if (cache == nullptr) {
+    void* storage = std::malloc(sizeof(ThreadCache));
+    if (storage == nullptr) return nullptr;
+    cache = new (storage) ThreadCache;
+  }
+  const bool arranged = pthread_setspecific(gRetireKey, cache) == 0;
+  std::lock_guard<std::mutex> lock(gRegistryMutex);
+  if (!arranged) {
+    cache->nextSpare = gSpareCaches;
+    gSpareCaches = cache;
+    return nullptr;
+  }
+  cache->nextSpare = nullptr;
+  cache->counters.next = gLiveThreads;
+  if (gLiveThreads != nullptr) gLiveThreads->previous = &cache->counters;
+  gLiveThreads = &cache->counters;
+  tCache = cache;
+  tState = CacheState::kLive;
+  if (!kBypassPools) tLiveCache = cache;
+  return cache;
 }
 
 // ---------------------------------------------------------------------------

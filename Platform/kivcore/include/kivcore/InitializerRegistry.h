@@ -59,7 +59,10 @@ class KIVCORE_API InitializerRegistry {
 public:
   /// Runs every registered init not yet run, in registration order (an
   /// initializer whose named dependency is registered later waits for it).
-  /// Stops at the first that returns false or throws, and returns false then.
+  /// Stops at the first that returns false or throws, and returns false then;
+  /// false too when initializers depend on one another in a cycle. An init
+  /// function may call it: entries waiting for an init still running are left
+  /// to the call that runs it, and do not count as a failure.
   static bool InitializeAll(const proplist::PropList& inProperties);
   /// Runs the terminate function of every initialized entry, in reverse order.
   static void TerminateAll();

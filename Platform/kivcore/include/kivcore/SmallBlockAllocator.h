@@ -14,8 +14,10 @@
 ///   struct Node : SmallBlockAllocator::Allocated<Node> { int mValue; };
 /// @endcode
 ///
-/// Threading: all functions may be called from any thread. The adaptors turn a
-/// null block into std::bad_alloc; Allocate itself never throws.
+/// Threading: all functions may be called from any thread, until the thread's
+/// very end: its thread_local and thread-specific-data destructors may
+/// allocate and dispose too. The adaptors turn a null block into
+/// std::bad_alloc; Allocate itself never throws.
 #pragma once
 
 #include <kivcore/Export.h>
