@@ -100,12 +100,31 @@ struct Run {
 // call the nested run could take.
 thread_local Run* tCurrentRun = nullptr;
 
-void RunRemaining(Run& ioRun) {
-  while (ioRun.next < ioRun.calls.size()) {
-    Call& call = ioRun.calls[ioRun.next++];
-    call();
-    // Release what the call holds now rather than at the end of the run.
-    call.clear();
+// Runs what is left of ioRun. When a call throws, the calls after it go back
+// to the front of the queue (they were queued before anything in it), the
+// wakeup handler is called for them, and the exception propagates. The
+// moved-from calls stay in ioRun, to be destroyed outside the lock.
+void RunRemaining(MainThreadState& ioState, Run& ioRun) {
+  try {
+    while (ioRun.next < ioRun.calls.size()) {
+      Call& call = ioRun.calls[ioRun.next++];
+      call();
+      // Release what the call holds now rather than at the end of the run.
+      call.clear();
+    }
+  } catch (...) {
+    WakeupHandler wakeup;
+    std::uint64_t arming = 0;
+    {
+      std::lock_guard<std::mutex> lock(ioState.mutex);
+      const auto rest = ioRun.calls.begin() + static_cast<std::ptrdiff_t>(ioRun.next);
+      ioState.queue.insert(ioState.queue.begin(), std::make_move_iterator(rest), std::make_move_iterator(ioRun.calls.end()));
+      ioRun.next = ioRun.calls.size();
+      wakeup = ArmWakeup(ioState, arming);
+    }
+    // No post may come to schedule the run these calls now wait for.
+    CallWakeup(ioState, wakeup, arming);
+    throw;
   }
 }
 
@@ -121,7 +140,7 @@ AsyncEventLoopAdaptor::~AsyncEventLoopAdaptor() {
 
 void AsyncEventLoopAdaptor::RunPendingCalls() {
   MainThreadState& state = State();
-  if (tCurrentRun != nullptr) RunRemaining(*tCurrentRun);
+  if (tCurrentRun != nullptr) RunRemaining(state, *tCurrentRun);
 
   Run run;
   bool usingSpare = false;
@@ -157,21 +176,7 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
   } finish{state, run, tCurrentRun, usingSpare};
   tCurrentRun = &run;
 
-  try {
-    RunRemaining(run);
-  } catch (...) {
-    WakeupHandler wakeup;
-    std::uint64_t arming = 0;
-    {
-      std::lock_guard<std::mutex> lock(state.mutex);
-      state.queue.insert(state.queue.begin(), std::make_move_iterator(run.calls.begin() + static_cast<std::ptrdiff_t>(run.next)),
-                         std::make_move_iterator(run.calls.end()));
-      wakeup = ArmWakeup(state, arming);
-    }
-    // No post may come to schedule the run these calls now wait for.
-    CallWakeup(state, wakeup, arming);
-    throw;
-  }
+  RunRemaining(state, run);
 }
 
 bool AsyncEventLoopAdaptor::WaitForPendingCalls(int inTimeoutMilliseconds) {

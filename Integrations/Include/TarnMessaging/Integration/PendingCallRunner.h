@@ -115,10 +115,11 @@ public:
       adaptor->RunPendingCalls();
       return 1;
     };
-    // Each pass runs what the last one left: follow-ups it posted, or the
+    // The first pass also finishes a run this destructor is nested in. Each
+    // later pass runs what the last one left: follow-ups it posted, or the
     // calls behind one that threw. The bound keeps a handler that re-posts
     // for ever from hanging the destructor.
-    for (int pass = 0; pass < kDrainPasses && adaptor->PendingCallCount() != 0; ++pass)
+    for (int pass = 0; pass < kDrainPasses && (pass == 0 || adaptor->PendingCallCount() != 0); ++pass)
       kivcore::config::ErrorManager::Get(false)->GuardedCall(runOnce);
   }
 
