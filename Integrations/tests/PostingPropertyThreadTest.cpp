@@ -35,7 +35,7 @@ struct Scenario {
   int mFollowUps = 0;  // posted so far by handlers
   int mDepth = 0;
   bool mTerminating = false;
-  std::atomic<int>* mHeardCount = nullptr;  // heard or dropped, for the producers' pacing
+  std::atomic<int> mSettled{0};  // posts heard or dropped, for the producers' pacing
   AsioLoop mAsio;
 #if TARN_HAVE_GLIB_INTEGRATION
   GLibLoop mGLib;
@@ -61,9 +61,8 @@ Scenario* sRun = nullptr;
 // A copy dropped unheard: only a stopped station or Terminate may explain it.
 void RecordDrop(const Numbered& inMessage) {
   sRun->mDropped[inMessage.mProducer].push_back(inMessage.mSequence);
-  sRun->mHeardCount->fetch_add(1);
-  const bool stopped = sRun->mStopped[inMessage.mSequence % kStations];
-  if (!stopped && !sRun->mTerminating) ++sRun->mUnexplainedDrops;
+  sRun->mSettled.fetch_add(1);
+  if (!sRun->mStopped[inMessage.mSequence % kStations] && !sRun->mTerminating) ++sRun->mUnexplainedDrops;
 }
 
 class Handler : public Tarn::Listener {
@@ -72,7 +71,7 @@ class Handler : public Tarn::Listener {
     message.mHeard = true;
     Scenario& run = *sRun;
     run.mHeard[message.mProducer].push_back(message.mSequence);
-    run.mHeardCount->fetch_add(1);
+    run.mSettled.fetch_add(1);
     if (run.mTerminating) return;
     ++run.mDepth;
     switch (run.Pick(16)) {
@@ -96,14 +95,9 @@ class Handler : public Tarn::Listener {
         break;
       }
       case 4:
-        if (run.mDepth == 1) {
-          // Either order: the new one built before the old one goes, or after.
-          if (run.Pick(2) == 0) run.mIntegration = run.MakeIntegration();
-          else {
-            run.mIntegration.reset();
-            run.mIntegration = run.MakeIntegration();
-          }
-        }
+        // Either order: the new integration built before the old one goes, or after.
+        if (run.mDepth == 1 && run.Pick(2) == 0) run.mIntegration.reset();
+        if (run.mDepth == 1) run.mIntegration = run.MakeIntegration();
         break;
     }
     --run.mDepth;
@@ -127,9 +121,8 @@ TEST_P(PostingPropertyTest, EachProducersPostsAreHeardOnceInOrderOrDroppedForARe
     Tarn::StationUtils::AddListener(run.mStations.back(), &handler);
   }
   run.mIntegration = run.MakeIntegration();
-  std::atomic<int> posted{0}, heard{0};
+  std::atomic<int> posted{0};
   std::atomic<bool> stopped{false};
-  run.mHeardCount = &heard;
   {
     tarn_test::ThreadGroup producers;
     for (int p = 0; p < kProducers; ++p)
@@ -140,7 +133,7 @@ TEST_P(PostingPropertyTest, EachProducersPostsAreHeardOnceInOrderOrDroppedForARe
           posted.fetch_add(1);
           // Keep within reach of the main thread until it stops, so that its
           // handlers run among the posts rather than after them.
-          while (!stopped.load() && posted.load() > heard.load() + 32) std::this_thread::yield();
+          while (!stopped.load() && posted.load() > run.mSettled.load() + 32) std::this_thread::yield();
         }
       });
     // The loop stops at a random point; the integration's destructor drains
@@ -164,11 +157,9 @@ TEST_P(PostingPropertyTest, EachProducersPostsAreHeardOnceInOrderOrDroppedForARe
 
   EXPECT_EQ(0, run.mUnexplainedDrops);
   for (int p = 0; p <= kProducers; ++p) {
-    const int expected = p < kProducers ? kEach : run.mFollowUps;
-    std::vector<int> all(run.mHeard[p]);
+    std::vector<int> all(run.mHeard[p]), each(p < kProducers ? kEach : run.mFollowUps);
     all.insert(all.end(), run.mDropped[p].begin(), run.mDropped[p].end());
     std::sort(all.begin(), all.end());
-    std::vector<int> each(expected);
     std::iota(each.begin(), each.end(), 0);
     EXPECT_EQ(each, all) << "producer " << p << ": heard and dropped must be each post exactly once";
     EXPECT_TRUE(std::is_sorted(run.mHeard[p].begin(), run.mHeard[p].end())) << "producer " << p << " heard out of order";

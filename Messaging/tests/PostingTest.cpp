@@ -58,20 +58,15 @@ TEST(PostingTest, PostsAreDeliveredOnceWithTheirPostedValuesOrDroppedAsDocumente
   PostMessageToUIThread(station, changing, true);
   changing.mValue = 20;
   std::thread([&station] { PostMessageToUIThread(station, NumberMessage(3), false); }).join();
-  Tarn::StationUtils::StopBroadcasting(station);
-  PostMessageToUIThread(station, NumberMessage(4), true);
-  PostMessageToUIThread(Tarn::StationRegistry::UniqueStationID(), NumberMessage(5), true);
+  PostMessageToUIThread(Tarn::StationRegistry::UniqueStationID(), NumberMessage(4), true);
   EXPECT_EQ(1, listener.Calls()) << "deferred posts wait for the flush";
+  FlushPostedMessagesOnUIThread();
+  Tarn::StationUtils::StopBroadcasting(station);
+  PostMessageToUIThread(station, NumberMessage(5), true);
   FlushPostedMessagesOnUIThread();
   Tarn::StationUtils::StartBroadcasting(station);
   FlushPostedMessagesOnUIThread();
-  EXPECT_EQ((std::vector<std::string>{"l:1"}), log.Entries()) << "the stop came before the flush";
-
-  log.Clear();
-  PostMessageToUIThread(station, changing, true);
-  std::thread([&station] { PostMessageToUIThread(station, NumberMessage(3), true); }).join();
-  FlushPostedMessagesOnUIThread();
-  EXPECT_EQ((std::vector<std::string>{"l:20", "l:3"}), log.Entries());
+  EXPECT_EQ((std::vector<std::string>{"l:1", "l:2", "l:3"}), log.Entries());
   Tarn::StationUtils::RemoveListener(station, &listener);
   Tarn::Messaging::Terminate();
   EXPECT_EQ(baseline, SmallBlockAllocator::GetStatistics().blocksInUse) << "every copy freed";

@@ -32,13 +32,8 @@ protected:
     }
   }
   std::string mLog;
-  void Queue(const char* inName, bool inThrows = false) {
-    ASSERT_TRUE(AsyncCallFromMainThread(
-        [this, inName, inThrows] {
-          mLog += inName;
-          if (inThrows) throw std::runtime_error(inName);
-        },
-        0));
+  bool Queue(const char* inName, bool inThrows = false) {
+    return AsyncCallFromMainThread([this, inName, inThrows] { if ((mLog += inName), inThrows) throw std::runtime_error(inName); }, 0);
   }
 };
 
@@ -94,49 +89,37 @@ TEST_F(MainThreadTest, AThrowingCallLeavesTheRestInFrontAndWakesTheLoopForThem) 
   EXPECT_EQ(0u, adaptor->PendingCallCount());
 }
 
-// A post is queued before its wakeup runs; a wakeup that fails must not make
-// the post look failed (a poster retrying would deliver twice).
-TEST_F(MainThreadTest, AFailingWakeupIsReportedAndRetriedNeverTheQueuingsFailure) {
+// A post is queued before its wakeup runs: a wakeup that fails must not make
+// the post look failed (a poster retrying would deliver twice). And of two
+// integrations, the newer one built before the older one goes, the older
+// one's removal must leave the newer one's handler alone.
+TEST_F(MainThreadTest, WakeupsFailWithoutFailingThePostAndAreRemovedOnlyByTheirOwner) {
   auto adaptor = RegisterCurrentThreadAsMainThread();
-  int exceptions = 0;
+  int exceptions = 0, older = 0, newer = 0;
   auto previous = kivcore::config::ErrorManager::SetExceptionHandler([&exceptions](std::exception_ptr) { ++exceptions; });
-  int wakeups = 0;
-  adaptor->SetWakeupHandler([&wakeups] {
-    if (++wakeups == 1) throw std::bad_alloc();
-  });
+  adaptor->SetWakeupHandler([&older] { if (++older == 1) throw std::bad_alloc(); }, &older);
   bool queued = false;
-  EXPECT_NO_THROW(queued = AsyncCallFromMainThread([this] { mLog += "a"; }, 0));
+  EXPECT_NO_THROW(queued = Queue("a"));
   EXPECT_TRUE(queued);
   EXPECT_EQ(1, exceptions);
   Queue("b");
-  EXPECT_EQ(2, wakeups) << "the next call retries the failed wakeup";
+  EXPECT_EQ(2, older) << "the next call retries the failed wakeup";
   kivcore::config::ErrorManager::SetExceptionHandler(previous);
-  adaptor->RunPendingCalls();
-  EXPECT_EQ("ab", mLog);
-}
-
-// Two integrations: the newer one is built before the older one goes, and
-// the older one's removal must leave the newer one's handler alone.
-TEST_F(MainThreadTest, AHandlerIsRemovedOnlyByItsOwnerAndANewOneHearsOfQueuedCalls) {
-  auto adaptor = RegisterCurrentThreadAsMainThread();
-  int older = 0, newer = 0;
-  adaptor->SetWakeupHandler([&older] { ++older; }, &older);
-  Queue("a");
   adaptor->SetWakeupHandler([&newer] { ++newer; }, &newer);
-  EXPECT_EQ(1, newer) << "installed while a call was queued";
+  EXPECT_EQ(1, newer) << "installed while calls were queued";
   EXPECT_FALSE(adaptor->RemoveWakeupHandler(&older));
-  adaptor->RunPendingCalls();
-  Queue("b");
-  EXPECT_EQ(2, newer);
-  EXPECT_EQ(1, older);
-  EXPECT_TRUE(adaptor->RemoveWakeupHandler(&newer));
   adaptor->RunPendingCalls();
   Queue("c");
   EXPECT_EQ(2, newer);
+  EXPECT_TRUE(adaptor->RemoveWakeupHandler(&newer));
+  adaptor->RunPendingCalls();
+  Queue("d");
+  EXPECT_EQ(2, newer);
+  EXPECT_EQ(2, older);
   EXPECT_TRUE(adaptor->WaitForPendingCalls(0));
   adaptor->RunPendingCalls();
   EXPECT_FALSE(adaptor->WaitForPendingCalls(1));
-  EXPECT_EQ("abc", mLog);
+  EXPECT_EQ("abcd", mLog);
 }
 
 }  // namespace
