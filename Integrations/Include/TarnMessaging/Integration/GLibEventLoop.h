@@ -57,6 +57,7 @@
 
 #include <glib.h>
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -109,33 +110,44 @@ private:
     }
 
   private:
-    // On the thread iterating the context. Each source holds a reference on
-    // the runner (freed with the source), and the dispatch takes one more of
+    // What a source's callback data holds: a reference on the runner, freed
+    // with the source. The runner is also published through an atomic, so
+    // that ThreadSanitizer, which does not see GLib's own locks, orders the
+    // dispatching thread after the posting thread that made the reference.
+    struct SourceReference {
+      std::shared_ptr<Runner> mKeep;
+      std::atomic<Runner*> mRunner{nullptr};
+    };
+
+    // On the thread iterating the context. The dispatch takes a reference of
     // its own: a pending call may destroy the GLibEventLoop, whose Uninstall
     // destroys the sources, while this frame still needs the runner.
-    static gboolean Dispatch(gpointer inRunner) {
-      const std::shared_ptr<Runner> runner = *static_cast<std::shared_ptr<Runner>*>(inRunner);
+    static gboolean Dispatch(gpointer inReference) {
+      auto* reference = static_cast<SourceReference*>(inReference);
+      Runner* const raw = reference->mRunner.load(std::memory_order_acquire);
+      std::shared_ptr<Runner> runner;
       {
-        // Taking the lock also orders this thread after the posting thread
-        // for ThreadSanitizer, which does not see GLib's own locks.
-        std::lock_guard<std::mutex> lock(runner->mSourcesMutex);
+        std::lock_guard<std::mutex> lock(raw->mSourcesMutex);
+        runner = reference->mKeep;
         runner->ForgetSource(g_main_current_source());
       }
       runner->RunPending(kToErrorManager);
       return G_SOURCE_REMOVE;
     }
 
-    static void FreeRunnerReference(gpointer inRunner) { delete static_cast<std::shared_ptr<Runner>*>(inRunner); }
+    static void FreeReference(gpointer inReference) { delete static_cast<SourceReference*>(inReference); }
 
     void PostRun() override {
       std::lock_guard<std::mutex> lock(mSourcesMutex);
       // The steps that can throw come before the source exists.
       mSources.reserve(mSources.size() + 1);
-      auto reference = std::make_unique<std::shared_ptr<Runner>>(std::static_pointer_cast<Runner>(shared_from_this()));
+      auto reference = std::make_unique<SourceReference>();
+      reference->mKeep = std::static_pointer_cast<Runner>(shared_from_this());
+      reference->mRunner.store(this, std::memory_order_release);
       GSource* source = g_idle_source_new();
       g_source_set_priority(source, mPriority);
       g_source_set_name(source, "Tarn::Integration::GLibEventLoop");
-      g_source_set_callback(source, &Dispatch, reference.release(), &FreeRunnerReference);
+      g_source_set_callback(source, &Dispatch, reference.release(), &FreeReference);
       mSources.push_back(source);  // our reference, dropped by ForgetSource or DestroySources
       g_source_attach(source, mContext);
     }
