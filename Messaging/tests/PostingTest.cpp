@@ -49,10 +49,7 @@ using Tarn::StationUtils::PostMessageToUIThread;
 // hangs, and the library then comes up and delivers as usual.
 TEST(PostingTest, InitializeAndTerminateSurviveEveryFailingAllocation) {
   Watchdog watchdog;
-  auto failAfter = [](bool inHeap, long long inCount) {
-    if (inHeap) gHeapAllocationsLeft.store(inCount);
-    else SmallBlockAllocator::SetFailAfter(inCount);
-  };
+  auto failAfter = [](bool inHeap, long long inCount) { inHeap ? gHeapAllocationsLeft.store(inCount) : SmallBlockAllocator::SetFailAfter(inCount); };
   for (bool heap : {true, false}) {
     bool allSucceeded = false;
     for (long long n = 0; !allSucceeded && n < 1000; ++n) {
