@@ -17,7 +17,10 @@
 /// thread and in queue order, the calls queued before it started; calls queued
 /// while it runs wait for the next run. Each thread's calls run in the order it
 /// queued them, also when a call runs pending calls itself (the nested run
-/// first finishes the calls the outer run took) and when a call throws.
+/// first finishes the calls the outer run took) and when a call throws. That
+/// order holds for runs on one thread; runs on two threads at once (outside
+/// the contract: runs belong to the main thread) share out the calls, each
+/// still once.
 ///
 /// Wakeups: the wakeup handler is called once per batch, not once per call:
 /// by the first call queued after RunPendingCalls took the queue (or after the
