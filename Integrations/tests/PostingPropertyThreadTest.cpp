@@ -153,7 +153,6 @@ TEST_P(PostingPropertyTest, EachProducersPostsAreHeardOnceInOrderOrDroppedForARe
   for (int s = 0; s < kStations; ++s) Tarn::StationUtils::RemoveListener(run.mStations[s], &handler);
   Tarn::Messaging::Terminate();
   gOnUnheardCopy = nullptr;
-  sRun = nullptr;
 
   EXPECT_EQ(0, run.mUnexplainedDrops);
   for (int p = 0; p <= kDirect; ++p) {
