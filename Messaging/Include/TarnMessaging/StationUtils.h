@@ -17,7 +17,10 @@
 /// PostMessageToUIThread is for. RemoveListener may block as
 /// Broadcaster::RemoveListener does. A post is delivered when the main thread
 /// runs its pending calls, to the listeners attached at that moment, unless
-/// its station is gone or stopped then.
+/// its station is gone or stopped then. Each post is delivered at most once,
+/// and one thread's posts in the order it made them, also across a flush
+/// made from inside a handler; besides a gone or stopped station, only the
+/// last Tarn::Messaging::Terminate drops a post (those still queued then).
 ///
 /// Misuse (a null or expired listener, an empty station ID in SwitchStation)
 /// is reported through the contract-check procedure before the station is
@@ -91,11 +94,14 @@ TARN_MESSAGING_API void SwitchStation(const ImmutableString& inFromStationID, co
 /// On the main thread with inForceAsync false: broadcasts at once, with no
 /// copy and no allocation. Otherwise queues a copy of the message for the main
 /// thread (one small-block allocation; std::bad_alloc when storage is out, and
-/// nothing is queued then). inMessage may be destroyed as soon as this returns.
+/// nothing is queued then). Once queued, the post stands: a host loop that
+/// fails to schedule its run is reported to kivcore's error manager, not to
+/// the poster. inMessage may be destroyed as soon as this returns.
 TARN_MESSAGING_API void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
                                               bool inForceAsync);
 /// Runs every pending call of the main thread now; meant for the main thread.
-/// Does nothing while no main thread is registered.
+/// From inside a handler of a posted message, first runs the posts the outer
+/// run has not reached. Does nothing while no main thread is registered.
 TARN_MESSAGING_API void FlushPostedMessagesOnUIThread();
 
 }  // namespace StationUtils

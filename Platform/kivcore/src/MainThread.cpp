@@ -7,6 +7,15 @@
 // lock and runs the taken calls with the lock released. The two vectors trade
 // places on every run and keep their capacity, so a steady stream of calls
 // allocates nothing beyond the copies of the calls themselves.
+//
+// Invariants, each kept within one hold of the lock:
+// - while a wakeup handler is installed, a non-empty queue has had exactly one
+//   wakeup since it was last taken: the post that finds the queue un-armed
+//   arms it, and the take disarms it;
+// - each producer's calls stay in order: a run nested in another on the same
+//   thread first finishes the outer run's calls, which were queued earlier,
+//   and a run that throws puts the calls it has not run back in front.
+#include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
 #include <boost/weak_ptr.hpp>
@@ -16,6 +25,7 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <cstdint>
 #include <iterator>
 #include <memory>
 #include <mutex>
@@ -40,6 +50,9 @@ struct MainThreadState {
   bool spareInUse = false;             // guarded by mutex
   int waiters = 0;                     // threads in WaitForPendingCalls; guarded by mutex
   WakeupHandler wakeup;                // guarded by mutex
+  const void* wakeupOwner = nullptr;   // the tag wakeup was installed with; guarded by mutex
+  bool wakeupArmed = false;            // the queue's wakeup was called since its last take; guarded by mutex
+  std::uint64_t armings = 0;           // times wakeupArmed was set; guarded by mutex
   boost::weak_ptr<AsyncEventLoopAdaptor> adaptor;  // the live adaptor, if any; guarded by mutex
 };
 
@@ -51,6 +64,69 @@ MainThreadState& State() {
 }
 
 unsigned long CurrentThreadId() noexcept { return static_cast<unsigned long>(pthread_self()); }
+
+// Arms the queue's wakeup if it needs one; returns the handler to call (after
+// the lock is released), or null. state.mutex held.
+WakeupHandler ArmWakeup(MainThreadState& ioState, std::uint64_t& outArming) {
+  if (ioState.wakeupArmed || !ioState.wakeup || ioState.queue.empty()) return nullptr;
+  ioState.wakeupArmed = true;
+  outArming = ++ioState.armings;
+  return ioState.wakeup;
+}
+
+// Calls an armed wakeup handler, outside the lock. Its failure is not the
+// caller's: the calls are queued whatever the handler does. The failure goes
+// to the error manager and the queue is disarmed again, so that the next post
+// retries the wakeup.
+void CallWakeup(MainThreadState& ioState, const WakeupHandler& inHandler, std::uint64_t inArming) noexcept {
+  if (!inHandler) return;
+  const int called = config::ErrorManager::Get(false)->GuardedCall([&inHandler] {
+    (*inHandler)();
+    return 1;
+  });
+  if (called != 0) return;
+  std::lock_guard<std::mutex> lock(ioState.mutex);
+  if (ioState.armings == inArming) ioState.wakeupArmed = false;
+}
+
+// The calls one RunPendingCalls took from the queue, and how far it got.
+struct Run {
+  std::vector<Call> calls;
+  std::size_t next = 0;
+};
+
+// The innermost run on this thread. A run nested in it (a call that runs
+// pending calls itself) finishes it first: its calls were queued before any
+// call the nested run could take.
+thread_local Run* tCurrentRun = nullptr;
+
+// Runs what is left of ioRun. When a call throws, the calls after it go back
+// to the front of the queue (they were queued before anything in it), the
+// wakeup handler is called for them, and the exception propagates. The
+// moved-from calls stay in ioRun, to be destroyed outside the lock.
+void RunRemaining(MainThreadState& ioState, Run& ioRun) {
+  try {
+    while (ioRun.next < ioRun.calls.size()) {
+      Call& call = ioRun.calls[ioRun.next++];
+      call();
+      // Release what the call holds now rather than at the end of the run.
+      call.clear();
+    }
+  } catch (...) {
+    WakeupHandler wakeup;
+    std::uint64_t arming = 0;
+    {
+      std::lock_guard<std::mutex> lock(ioState.mutex);
+      const auto rest = ioRun.calls.begin() + static_cast<std::ptrdiff_t>(ioRun.next);
+      ioState.queue.insert(ioState.queue.begin(), std::make_move_iterator(rest), std::make_move_iterator(ioRun.calls.end()));
+      ioRun.next = ioRun.calls.size();
+      wakeup = ArmWakeup(ioState, arming);
+    }
+    // No post may come to schedule the run these calls now wait for.
+    CallWakeup(ioState, wakeup, arming);
+    throw;
+  }
+}
 
 }  // namespace
 
@@ -64,19 +140,21 @@ AsyncEventLoopAdaptor::~AsyncEventLoopAdaptor() {
 
 void AsyncEventLoopAdaptor::RunPendingCalls() {
   MainThreadState& state = State();
-  std::vector<Call> local;
-  std::vector<Call>* batch = &local;
+  if (tCurrentRun != nullptr) RunRemaining(state, *tCurrentRun);
+
+  Run run;
   bool usingSpare = false;
   {
     std::lock_guard<std::mutex> lock(state.mutex);
     if (state.queue.empty()) return;
-    // A call that runs pending calls itself gets a vector of its own.
     if (!state.spareInUse) {
       state.spareInUse = true;
       usingSpare = true;
-      batch = &state.spare;
+      run.calls.swap(state.spare);
     }
-    batch->swap(state.queue);
+    run.calls.swap(state.queue);
+    // The first call queued from now on wakes the host loop for the next run.
+    state.wakeupArmed = false;
   }
 
   // On every way out, destroys the run (and moved-from) calls outside the
@@ -84,32 +162,21 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
   // and hands the spare vector back.
   struct Finish {
     MainThreadState& state;
-    std::vector<Call>& batch;
+    Run& run;
+    Run* outer;
     bool usingSpare;
     ~Finish() {
-      batch.clear();
-      if (usingSpare) {
-        std::lock_guard<std::mutex> lock(state.mutex);
-        state.spareInUse = false;
-      }
+      tCurrentRun = outer;
+      run.calls.clear();
+      if (!usingSpare) return;
+      std::lock_guard<std::mutex> lock(state.mutex);
+      state.spare.swap(run.calls);
+      state.spareInUse = false;
     }
-  } finish{state, *batch, usingSpare};
+  } finish{state, run, tCurrentRun, usingSpare};
+  tCurrentRun = &run;
 
-  std::size_t next = 0;
-  try {
-    for (; next < batch->size(); ++next) {
-      (*batch)[next]();
-      // Release what the call holds now rather than at the end of the run.
-      (*batch)[next].clear();
-    }
-  } catch (...) {
-    std::lock_guard<std::mutex> lock(state.mutex);
-    // The calls not yet run were queued before anything queued since, so
-    // they go back in front of it.
-    state.queue.insert(state.queue.begin(), std::make_move_iterator(batch->begin() + static_cast<std::ptrdiff_t>(next + 1)),
-                       std::make_move_iterator(batch->end()));
-    throw;
-  }
+  RunRemaining(state, run);
 }
 
 bool AsyncEventLoopAdaptor::WaitForPendingCalls(int inTimeoutMilliseconds) {
@@ -126,14 +193,39 @@ bool AsyncEventLoopAdaptor::WaitForPendingCalls(int inTimeoutMilliseconds) {
 }
 
 void AsyncEventLoopAdaptor::SetWakeupHandler(std::function<void()> inHandler) {
+  SetWakeupHandler(std::move(inHandler), nullptr);
+}
+
+void AsyncEventLoopAdaptor::SetWakeupHandler(std::function<void()> inHandler, const void* inOwner) {
   WakeupHandler handler;
   if (inHandler) handler = std::make_shared<const std::function<void()>>(std::move(inHandler));
   MainThreadState& state = State();
+  WakeupHandler wakeup;
+  std::uint64_t arming = 0;
   {
     std::lock_guard<std::mutex> lock(state.mutex);
     state.wakeup.swap(handler);
+    state.wakeupOwner = inOwner;
+    // Calls already queued were announced to the previous handler, if to
+    // anyone; the new one must hear of them.
+    state.wakeupArmed = false;
+    wakeup = ArmWakeup(state, arming);
   }
+  CallWakeup(state, wakeup, arming);
   // The previous handler is destroyed here, outside the lock.
+}
+
+bool AsyncEventLoopAdaptor::RemoveWakeupHandler(const void* inOwner) {
+  MainThreadState& state = State();
+  WakeupHandler handler;
+  {
+    std::lock_guard<std::mutex> lock(state.mutex);
+    if (!state.wakeup || state.wakeupOwner != inOwner) return false;
+    state.wakeup.swap(handler);
+    state.wakeupOwner = nullptr;
+    state.wakeupArmed = false;
+  }
+  return true;
 }
 
 std::size_t AsyncEventLoopAdaptor::PendingCallCount() const {
@@ -144,10 +236,22 @@ std::size_t AsyncEventLoopAdaptor::PendingCallCount() const {
 
 boost::shared_ptr<AsyncEventLoopAdaptor> RegisterCurrentThreadAsMainThread() {
   MainThreadState& state = State();
+  {
+    std::lock_guard<std::mutex> lock(state.mutex);
+    if (boost::shared_ptr<AsyncEventLoopAdaptor> adaptor = state.adaptor.lock()) {
+      gMainThreadId.store(CurrentThreadId(), std::memory_order_release);
+      return adaptor;
+    }
+  }
+  // Made outside the lock: when its count block cannot be allocated, boost
+  // deletes the new adaptor at once, and the adaptor's destructor takes the
+  // lock. Declared before the lock below, so that an adaptor made in vain
+  // (another thread registered first) also goes after the lock is released.
+  boost::shared_ptr<AsyncEventLoopAdaptor> made(new AsyncEventLoopAdaptor());
   std::lock_guard<std::mutex> lock(state.mutex);
   boost::shared_ptr<AsyncEventLoopAdaptor> adaptor = state.adaptor.lock();
   if (!adaptor) {
-    adaptor.reset(new AsyncEventLoopAdaptor());
+    adaptor = made;
     state.adaptor = adaptor;
   }
   gMainThreadId.store(CurrentThreadId(), std::memory_order_release);
@@ -173,13 +277,14 @@ bool AsyncCallFromMainThread(boost::function<void()>&& inCall, unsigned int /*in
   if (inCall.empty()) return false;
   MainThreadState& state = State();
   WakeupHandler wakeup;
+  std::uint64_t arming = 0;
   {
     std::lock_guard<std::mutex> lock(state.mutex);
     state.queue.push_back(std::move(inCall));
     if (state.waiters > 0) state.callQueued.notify_all();
-    wakeup = state.wakeup;
+    wakeup = ArmWakeup(state, arming);
   }
-  if (wakeup) (*wakeup)();
+  CallWakeup(state, wakeup, arming);
   return true;
 }
 

@@ -13,7 +13,7 @@
 /// While the object lives, the first call queued for the main thread after a
 /// run posts one handler to the io_context, and that handler runs every call
 /// pending by then: a burst of posted messages costs one io_context handler,
-/// not one per message (PendingCallRunner.h explains the coalescing).
+/// not one per message (PendingCallRunner.h explains it).
 /// ScheduledRuns() counts the handlers posted.
 ///
 /// Threading: construct and destroy the object on the main thread, after
@@ -21,18 +21,28 @@
 /// Run the io_context on the main thread only: the handler runs the pending
 /// calls on whichever thread runs it, and a broadcast off the main thread
 /// delivers nothing. Messages may be posted from any thread; the wakeup runs on
-/// the posting thread, takes no lock unless it posts a handler, and never
-/// blocks on the main thread. An exception thrown by a pending call leaves
+/// the posting thread, once per burst, and never blocks on the main thread.
+/// An exception thrown by a pending call leaves
 /// io_context::run() as any handler's exception does; the calls behind it stay
 /// queued and a new handler is posted for them, so calling run() again
 /// carries on.
 ///
 /// Ownership: the object refers to the io_context and does not own it; the
-/// io_context must outlive the object. The main thread's queue has one wakeup
-/// handler for the whole process, so keep one integration (of any kind) at a
-/// time. The destructor removes the wakeup handler and runs the calls still
-/// pending, so that nothing posted before it is lost; a handler of ours still
-/// queued in the io_context then does nothing when it runs.
+/// io_context must outlive the object.
+///
+/// Replacement and destruction: the main thread's queue has one wakeup
+/// handler for the whole process, and the newest integration (of any kind)
+/// holds it. Building a new one before the old one is destroyed
+/// (`loop = std::make_unique<AsioEventLoop>(other)`) moves every later wakeup
+/// to the new one, which is woken at once for calls already queued; the old
+/// one's destructor leaves the new one's handler in place. The destructor runs
+/// on the calling (main) thread every call still queued, and the follow-ups
+/// those calls post, until the queue is empty; a handler that keeps re-posting
+/// is cut off after PendingCallRunner::kDrainPasses runs, and what it posted
+/// last waits for the next integration, FlushPostedMessagesOnUIThread or the
+/// last Tarn::Messaging::Terminate. A handler of ours still queued in the
+/// io_context does nothing when it runs. Nothing posted before the destructor
+/// returns is lost, and nothing is delivered twice.
 #pragma once
 
 #include <TarnMessaging/Integration/PendingCallRunner.h>
@@ -53,7 +63,7 @@ namespace Tarn::Integration {
 /// Construct and destroy on the main thread after Tarn::Messaging::Initialize
 /// and before the last Tarn::Messaging::Terminate; run the io_context on the
 /// main thread only. The io_context is not owned and must outlive this
-/// object. Only one event-loop integration may exist at a time.
+/// object. A newer integration takes the wakeups over from this one.
 class AsioEventLoop {
 public:
   /// Installs the wakeup handler and, when calls are already pending, posts
@@ -64,9 +74,10 @@ public:
     mRunner->Install();
   }
 
-  /// Removes the wakeup handler and runs, on the calling (main) thread, every
-  /// call still pending. Exceptions of those calls go to kivcore's error
-  /// manager.
+  /// Removes the wakeup handler (unless a newer integration replaced it) and
+  /// runs, on the calling (main) thread, the calls still pending and their
+  /// follow-ups until none is left (see "Replacement and destruction").
+  /// Exceptions of those calls go to kivcore's error manager.
   ~AsioEventLoop() { mRunner->Uninstall(); }
 
   AsioEventLoop(const AsioEventLoop&) = delete;

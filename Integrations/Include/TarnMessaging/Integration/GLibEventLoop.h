@@ -13,7 +13,7 @@
 /// While the object lives, the first call queued for the main thread after a
 /// run attaches one idle source to the context, and its dispatch runs every
 /// call pending by then: a burst of posted messages costs one source, not one
-/// per message (PendingCallRunner.h explains the coalescing). ScheduledRuns()
+/// per message (PendingCallRunner.h explains it). ScheduledRuns()
 /// counts the sources attached.
 ///
 /// The source is attached explicitly rather than through
@@ -27,24 +27,37 @@
 /// Threading: construct and destroy the object on the main thread, after
 /// Tarn::Messaging::Initialize and before the last Tarn::Messaging::Terminate.
 /// Iterate the context on the main thread only. Messages may be posted from
-/// any thread; the wakeup runs on the posting thread, takes no lock unless it
-/// attaches a source, and never blocks on the main thread. An exception thrown
+/// any thread; the wakeup runs on the posting thread, once per burst, and never
+/// blocks on the main thread. An exception thrown
 /// by a pending call must not unwind through GLib's C frames: it goes to
 /// kivcore's error manager, the calls behind it stay queued and a new source is
 /// attached for them.
 ///
 /// Ownership: the object holds a reference on the context (g_main_context_ref)
-/// from construction to destruction. The main thread's queue has one wakeup
-/// handler for the whole process, so keep one integration (of any kind) at a
-/// time. The destructor removes the wakeup handler, destroys the sources it
-/// attached that have not run yet, and runs the calls still pending, so that
-/// nothing posted before it is lost.
+/// from construction to destruction, and each source it attached holds one on
+/// the object's internals, so a pending call may destroy the GLibEventLoop
+/// while its source is dispatching.
+///
+/// Replacement and destruction: the main thread's queue has one wakeup
+/// handler for the whole process, and the newest integration (of any kind)
+/// holds it. Building a new one before the old one is destroyed moves every
+/// later wakeup to the new one, which is woken at once for calls already
+/// queued; the old one's destructor leaves the new one's handler in place. The
+/// destructor destroys the sources it attached that have not run yet, then
+/// runs on the calling (main) thread every call still queued, and the
+/// follow-ups those calls post, until the queue is empty; a handler that keeps
+/// re-posting is cut off after PendingCallRunner::kDrainPasses runs, and what
+/// it posted last waits for the next integration,
+/// FlushPostedMessagesOnUIThread or the last Tarn::Messaging::Terminate.
+/// Nothing posted before the destructor returns is lost, and nothing is
+/// delivered twice.
 #pragma once
 
 #include <TarnMessaging/Integration/PendingCallRunner.h>
 
 #include <glib.h>
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -58,8 +71,8 @@ namespace Tarn::Integration {
 ///
 /// Construct and destroy on the main thread after Tarn::Messaging::Initialize
 /// and before the last Tarn::Messaging::Terminate; iterate the context on the
-/// main thread only. Holds a reference on the context while it lives. Only
-/// one event-loop integration may exist at a time.
+/// main thread only. Holds a reference on the context while it lives. A newer
+/// integration takes the wakeups over from this one.
 class GLibEventLoop {
 public:
   /// Installs the wakeup handler for inContext (null: the global default
@@ -73,9 +86,11 @@ public:
     mRunner->Install();
   }
 
-  /// Removes the wakeup handler, runs on the calling (main) thread every call
-  /// still pending, and drops the reference on the context. Exceptions of
-  /// those calls go to kivcore's error manager.
+  /// Removes the wakeup handler (unless a newer integration replaced it),
+  /// runs on the calling (main) thread the calls still pending and their
+  /// follow-ups until none is left (see "Replacement and destruction"), and
+  /// drops the reference on the context. Exceptions of those calls go to
+  /// kivcore's error manager.
   ~GLibEventLoop() { mRunner->Uninstall(); }
 
   GLibEventLoop(const GLibEventLoop&) = delete;
@@ -89,34 +104,50 @@ private:
   public:
     Runner(GMainContext* inContext, int inPriority) : mContext(g_main_context_ref(inContext)), mPriority(inPriority) {}
     ~Runner() override {
-      // Uninstall has normally destroyed the sources and dropped the context.
-      DestroySources();
+      // Sources hold the runner, so none is left here; only a runner never
+      // uninstalled still holds the context.
       if (mContext != nullptr) g_main_context_unref(mContext);
     }
 
   private:
-    // On the thread iterating the context. The runner is alive: Uninstall
-    // destroys every source still attached before the runner can go.
-    static gboolean Dispatch(gpointer inRunner) {
-      auto* runner = static_cast<Runner*>(inRunner);
+    // What a source's callback data holds: a reference on the runner, freed
+    // with the source. The runner is also published through an atomic, so
+    // that ThreadSanitizer, which does not see GLib's own locks, orders the
+    // dispatching thread after the posting thread that made the reference.
+    struct SourceReference {
+      std::shared_ptr<Runner> mKeep;
+      std::atomic<Runner*> mRunner{nullptr};
+    };
+
+    // On the thread iterating the context. The dispatch takes a reference of
+    // its own: a pending call may destroy the GLibEventLoop, whose Uninstall
+    // destroys the sources, while this frame still needs the runner.
+    static gboolean Dispatch(gpointer inReference) {
+      auto* reference = static_cast<SourceReference*>(inReference);
+      Runner* const raw = reference->mRunner.load(std::memory_order_acquire);
+      std::shared_ptr<Runner> runner;
       {
-        // Taking the lock also orders this thread after the posting thread
-        // for ThreadSanitizer, which does not see GLib's own locks.
-        std::lock_guard<std::mutex> lock(runner->mSourcesMutex);
+        std::lock_guard<std::mutex> lock(raw->mSourcesMutex);
+        runner = reference->mKeep;
         runner->ForgetSource(g_main_current_source());
       }
       runner->RunPending(kToErrorManager);
       return G_SOURCE_REMOVE;
     }
 
+    static void FreeReference(gpointer inReference) { delete static_cast<SourceReference*>(inReference); }
+
     void PostRun() override {
       std::lock_guard<std::mutex> lock(mSourcesMutex);
-      // The only step that can throw comes before the source exists.
+      // The steps that can throw come before the source exists.
       mSources.reserve(mSources.size() + 1);
+      auto reference = std::make_unique<SourceReference>();
+      reference->mKeep = std::static_pointer_cast<Runner>(shared_from_this());
+      reference->mRunner.store(this, std::memory_order_release);
       GSource* source = g_idle_source_new();
       g_source_set_priority(source, mPriority);
       g_source_set_name(source, "Tarn::Integration::GLibEventLoop");
-      g_source_set_callback(source, &Dispatch, this, nullptr);
+      g_source_set_callback(source, &Dispatch, reference.release(), &FreeReference);
       mSources.push_back(source);  // our reference, dropped by ForgetSource or DestroySources
       g_source_attach(source, mContext);
     }
@@ -137,13 +168,18 @@ private:
       }
     }
 
+    // Destroying a source frees its reference on the runner, which is not
+    // the last one: Uninstall's caller holds the runner.
     void DestroySources() noexcept {
-      std::lock_guard<std::mutex> lock(mSourcesMutex);
-      for (GSource* source : mSources) {
+      std::vector<GSource*> sources;
+      {
+        std::lock_guard<std::mutex> lock(mSourcesMutex);
+        sources.swap(mSources);
+      }
+      for (GSource* source : sources) {
         g_source_destroy(source);
         g_source_unref(source);
       }
-      mSources.clear();
     }
 
     GMainContext* mContext;  // a counted reference; guarded by the runner's mutex; null after ForgetLoop

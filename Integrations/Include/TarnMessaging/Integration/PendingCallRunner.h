@@ -16,17 +16,22 @@
 /// AsioEventLoop.h and GLibEventLoop.h are the integrations built on it; a
 /// host with another loop derives its own runner the same way.
 ///
-/// Coalescing: an atomic "scheduled" flag stands between the queue and the
-/// loop. The wakeup that finds it clear sets it and posts one run; every later
-/// wakeup finds it set and posts nothing. The run clears the flag before it
-/// takes the queued calls, so a call queued while they run (by a worker, or by
-/// a handler posting with inForceAsync) schedules the next run instead of
-/// waiting for an unrelated wakeup. The one redundant run this allows (a call
-/// queued before the run takes the queue but whose wakeup comes after the flag
-/// is cleared) finds the queue empty and returns at once.
+/// Coalescing: the main thread's queue calls the wakeup handler once per
+/// batch (kivcore/MainThread.h): the first call queued after a run took the
+/// queue wakes us, and we post one run. A run that finds the queue already
+/// taken (by FlushPostedMessagesOnUIThread, say) returns at once.
+///
+/// Replacement and destruction: the wakeup handler is tagged with the
+/// runner, and Uninstall removes only its own, so an integration built before
+/// the one it replaces is destroyed keeps every wakeup. Installing a handler
+/// while calls are queued wakes the new loop for them. Uninstall runs the
+/// calls still queued on the main thread until the queue is empty, follow-ups
+/// posted by those calls included, for at most kDrainPasses runs; calls a
+/// handler keeps re-posting past that stay queued for the next integration,
+/// FlushPostedMessagesOnUIThread or the last Tarn::Messaging::Terminate.
 ///
 /// Threading: Install and Uninstall on the main thread. Wakeup runs on
-/// whichever thread queues a call; it takes mMutex only when it posts a run.
+/// whichever thread queues a call, once per batch, and takes mMutex.
 /// RunPending on the thread that runs the host loop, which must be the main
 /// thread. PostRun and ForgetLoop are called with mMutex held.
 #pragma once
@@ -62,6 +67,9 @@ public:
     kToErrorManager,  ///< Hand it to kivcore's error manager and return normally.
   };
 
+  /// Most runs of the final drain in Uninstall.
+  static constexpr int kDrainPasses = 64;
+
   PendingCallRunner() = default;
   PendingCallRunner(const PendingCallRunner&) = delete;
   PendingCallRunner& operator=(const PendingCallRunner&) = delete;
@@ -79,88 +87,73 @@ public:
     if (!adaptor) throw std::logic_error("Tarn::Integration: no main thread; call Tarn::Messaging::Initialize first");
     mInstalled.store(true, std::memory_order_release);
     std::shared_ptr<PendingCallRunner> self = shared_from_this();
-    adaptor->SetWakeupHandler([self] { self->Wakeup(); });
-    // Calls queued before the handler was in place had no one to wake.
-    if (adaptor->PendingCallCount() != 0) Wakeup();
+    // Calls already queued wake us from inside this call.
+    adaptor->SetWakeupHandler([self] { self->Wakeup(); }, this);
   }
 
-  /// Removes the wakeup handler, lets the host loop go, and runs on the
-  /// calling thread every call still queued, so that nothing posted before
-  /// this returns is lost. Exceptions of those calls go to the error manager.
-  /// A run still queued in the host loop does nothing afterwards. Calls are
-  /// run only on the main thread; after the last Tarn::Messaging::Terminate
-  /// there is no adaptor left, and the handler, unreachable, stays inert.
+  /// Removes this runner's wakeup handler (not one installed since by another
+  /// integration), lets the host loop go, and runs on the calling thread the
+  /// calls still queued until none is left or kDrainPasses runs have passed,
+  /// so that nothing posted before this returns is lost. Exceptions of those
+  /// calls go to the error manager. A run still queued in the host loop does
+  /// nothing afterwards. Calls are run only on the main thread; after the last
+  /// Tarn::Messaging::Terminate there is no adaptor left, and the handler,
+  /// unreachable, stays inert.
   void Uninstall() noexcept {
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
-    if (adaptor) adaptor->SetWakeupHandler(nullptr);
+    if (adaptor) adaptor->RemoveWakeupHandler(this);
     {
-      // A wakeup already past the flag on another thread may be about to
-      // post; once this lock is released none will touch the loop again.
+      // A wakeup already under way on another thread may be about to post;
+      // once this lock is released none will touch the loop again.
       std::lock_guard<std::mutex> lock(mMutex);
       mInstalled.store(false, std::memory_order_release);
       ForgetLoop();
     }
     if (!adaptor || !kivcore::threads::CurrentThreadIsMainThread()) return;
-    // A call that throws leaves the calls behind it queued; each further pass
-    // picks up after it.
     auto runOnce = [&adaptor] {
       adaptor->RunPendingCalls();
       return 1;
     };
-    while (adaptor->PendingCallCount() != 0 && kivcore::config::ErrorManager::Get(false)->GuardedCall(runOnce) == 0) {
-    }
+    // The first pass also finishes a run this destructor is nested in. Each
+    // later pass runs what the last one left: follow-ups it posted, or the
+    // calls behind one that threw. The bound keeps a handler that re-posts
+    // for ever from hanging the destructor.
+    for (int pass = 0; pass < kDrainPasses && (pass == 0 || adaptor->PendingCallCount() != 0); ++pass)
+      kivcore::config::ErrorManager::Get(false)->GuardedCall(runOnce);
   }
 
-  /// The wakeup handler: posts one run unless one is already scheduled.
-  /// Called on the queuing thread. If posting throws (std::bad_alloc), the
-  /// flag is cleared again so that the next wakeup retries, and the
-  /// exception propagates to the queuing thread.
+  /// The wakeup handler: posts one run to the host loop. Called on the
+  /// queuing thread, once per batch. Does nothing after Uninstall. If posting
+  /// throws (std::bad_alloc), the queue reports it to the error manager and
+  /// calls this again on the next post.
   void Wakeup() {
-    // A load first: during a burst the flag is already set, and reading it
-    // keeps the cache line shared instead of taking it over on every post.
-    if (mScheduled.load(std::memory_order_acquire)) return;
-    if (mScheduled.exchange(true, std::memory_order_acq_rel)) return;
     std::lock_guard<std::mutex> lock(mMutex);
     if (!mInstalled.load(std::memory_order_acquire)) return;
-    try {
-      PostRun();
-    } catch (...) {
-      mScheduled.store(false, std::memory_order_release);
-      throw;
-    }
+    PostRun();
     mScheduledRuns.fetch_add(1, std::memory_order_relaxed);
   }
 
   /// Runs every pending call of the main thread; what a posted run calls, on
   /// the thread running the host loop. Does nothing after Uninstall or while
-  /// no main thread is registered.
+  /// no main thread is registered. After an exception the queue has already
+  /// woken us again for the calls behind the one that threw.
   void RunPending(ExceptionPolicy inPolicy) {
     if (!mInstalled.load(std::memory_order_acquire)) return;
-    // Cleared before the queue is taken: see "Coalescing" above.
-    mScheduled.store(false, std::memory_order_release);
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
     if (!adaptor) return;
     if (inPolicy == kPropagate) {
-      try {
-        adaptor->RunPendingCalls();
-      } catch (...) {
-        // The calls behind the one that threw are back in the queue, and no
-        // wakeup will come for them.
-        if (adaptor->PendingCallCount() != 0) Wakeup();
-        throw;
-      }
+      adaptor->RunPendingCalls();
       return;
     }
-    const int completed = kivcore::config::ErrorManager::Get(false)->GuardedCall([&adaptor] {
+    kivcore::config::ErrorManager::Get(false)->GuardedCall([&adaptor] {
       adaptor->RunPendingCalls();
       return 1;
     });
-    if (completed == 0 && adaptor->PendingCallCount() != 0) Wakeup();
   }
 
-  /// Number of runs posted to the host loop so far: one per burst of queued
+  /// Number of runs posted to the host loop so far: one per batch of queued
   /// calls, not one per call. Any thread.
   std::uint64_t ScheduledRuns() const noexcept { return mScheduledRuns.load(std::memory_order_relaxed); }
 
@@ -175,7 +168,6 @@ protected:
 private:
   std::mutex mMutex;                             // serialises PostRun with Uninstall
   std::atomic<bool> mInstalled{false};           // written under mMutex; read by runs without it
-  std::atomic<bool> mScheduled{false};           // set by the wakeup that posts a run; cleared by that run
   std::atomic<std::uint64_t> mScheduledRuns{0};  // statistics only
 };
 

@@ -15,8 +15,19 @@
 /// queued from any thread at any time; a call queued while no main thread is
 /// registered waits for the next one. RunPendingCalls runs, on the calling
 /// thread and in queue order, the calls queued before it started; calls queued
-/// while it runs wait for the next run. The wakeup handler runs on the queuing
-/// thread, outside every lock of the queue.
+/// while it runs wait for the next run. Each thread's calls run in the order it
+/// queued them, also when a call runs pending calls itself (the nested run
+/// first finishes the calls the outer run took) and when a call throws. That
+/// order holds for runs on one thread; runs on two threads at once (outside
+/// the contract: runs belong to the main thread) share out the calls, each
+/// still once.
+///
+/// Wakeups: the wakeup handler is called once per batch, not once per call:
+/// by the first call queued after RunPendingCalls took the queue (or after the
+/// handler was installed), on the queuing thread, outside every lock of the
+/// queue. A handler installed while calls are queued is called at once for
+/// them. A handler that throws is reported through kivcore's error manager and
+/// called again by the next queued call; the call that woke it stays queued.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -40,8 +51,10 @@ public:
   ~AsyncEventLoopAdaptor();
 
   /// Runs every call queued before this call started, in queue order, on the
-  /// calling thread. When a call throws, the calls after it stay queued (at
-  /// the front, in order) and the exception propagates.
+  /// calling thread; called from inside such a call, first runs the calls the
+  /// outer run has not reached. When a call throws, the calls after it stay
+  /// queued (at the front, in order), the wakeup handler is called for them,
+  /// and the exception propagates.
   void RunPendingCalls();
 
   /// Returns true at once when calls are queued; otherwise blocks until one
@@ -49,9 +62,21 @@ public:
   /// without limit.
   bool WaitForPendingCalls(int inTimeoutMilliseconds);
 
-  /// Called on the queuing thread whenever a call is queued, so that a host
-  /// event loop can schedule RunPendingCalls. An empty handler removes it.
+  /// Installs the process's one wakeup handler, replacing any other: called
+  /// on the queuing thread when a call is queued into an empty batch (see
+  /// Wakeups above), so that a host event loop can schedule RunPendingCalls.
+  /// Called at once, on this thread, when calls are already queued. inOwner
+  /// tags the handler for RemoveWakeupHandler. An empty handler removes it.
+  /// @{
   void SetWakeupHandler(std::function<void()> inHandler);
+  void SetWakeupHandler(std::function<void()> inHandler, const void* inOwner);
+  /// @}
+
+  /// Removes the wakeup handler only if it is the one installed with
+  /// inOwner, so that an integration going away leaves alone the handler of
+  /// one that replaced it. Returns whether it removed it. A handler call
+  /// already under way on another thread may still finish after this returns.
+  bool RemoveWakeupHandler(const void* inOwner);
 
   /// Number of calls queued and not yet taken by RunPendingCalls.
   std::size_t PendingCallCount() const;
