@@ -41,22 +41,15 @@
 #include <TarnMessaging/Listener.h>
 #include <TarnMessaging/SafeListener.h>
 
-#include <kivcore/Gate.h>
-#include <kivcore/RecursiveMutex.h>
-#include <kivcore/SmallBlockAllocator.h>
-
 #include <boost/shared_ptr.hpp>
 #include <boost/weak_ptr.hpp>
 
 #include <atomic>
-#include <cstdint>
-#include <map>
 #include <memory>
-#include <utility>
-#include <vector>
 
 namespace Tarn {
 
+class BroadcasterCore;
 class Message;
 
 /// One registration. Exactly one field is set.
@@ -73,8 +66,6 @@ struct TARN_MESSAGING_API ListenerEntry {
   bool operator==(const ListenerEntry& inOther) const noexcept;
   bool operator!=(const ListenerEntry& inOther) const noexcept { return !(*this == inOther); }
   /// @}
-  /// Lexicographic over the plain pointer and the owners of the three others.
-  bool operator<(const ListenerEntry& inOther) const noexcept;
   /// Whether the listener can still be reached: a plain pointer always; a
   /// safe listener that resolves; a weak pointer that locks.
   bool IsLive() const;
@@ -140,50 +131,15 @@ public:
   /// @}
 
 private:
-  template <class T>
-  using Alloc = kivcore::utility::SmallBlockAllocator::STLAllocator<T>;
-  struct GateRecord {
-    boost::shared_ptr<kivcore::threads::Gate> mGate;
-    std::int32_t mCount;  // deliveries to the removed entry still running
-  };
-  // Stored oldest first, so that adding the newest entry is an append and
-  // reading position p (0 = newest) is one subtraction: index size-1-p.
-  using EntryQueue = std::vector<ListenerEntry, Alloc<ListenerEntry>>;
-  using GateMap = std::map<ListenerEntry, GateRecord, std::less<ListenerEntry>,
-                           Alloc<std::pair<const ListenerEntry, GateRecord>>>;
-  using CursorVector = std::vector<std::int32_t, Alloc<std::int32_t>>;
-  // What one running broadcast is delivering right now, beside its cursor.
-  struct DeliverySlot {
-    const ListenerEntry* mEntry;  // the broadcast's copy of the entry it serves; null between deliveries
-    bool mCounted;                // a waiting remover counts this delivery in its gate record
-  };
-  using DeliveryVector = std::vector<DeliverySlot, Alloc<DeliverySlot>>;
-
+  friend class BroadcasterCore;
   struct BroadcastMessageRecord;
   TARN_MESSAGING_LOCAL static int DeliverToListener(const BroadcastMessageRecord& inRecord);
 
-  // Inserts inEntry at the front unless an equal entry exists; true when
-  // inserted.
-  TARN_MESSAGING_LOCAL bool AddEntry(const ListenerEntry& inEntry);
-  // The one removal path (also used to prune dead entries). A non-null
-  // inUnlink drops this broadcaster from that listener's back-links once the
-  // entry is out and before any wait, while a running delivery still keeps
-  // the listener in existence.
-  TARN_MESSAGING_LOCAL void RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink = nullptr);
-  // Linear search from the front (newest); the position, or -1 when absent.
-  // mMutex must be held.
-  TARN_MESSAGING_LOCAL std::int32_t FindEntry(const ListenerEntry& inEntry) const noexcept;
-  // The entry at a position counted from the front. mMutex must be held.
-  const ListenerEntry& EntryAt(std::int32_t inPosition) const noexcept {
-    return mListeners[mListeners.size() - 1 - static_cast<std::size_t>(inPosition)];
-  }
-  std::int32_t EntryCount() const noexcept { return static_cast<std::int32_t>(mListeners.size()); }
-
-  kivcore::threads::RecursiveMutex mMutex;
-  EntryQueue mListeners;           // guarded by mMutex; position 0 (the front) = newest
-  GateMap mGateMap;                // guarded by mMutex; removals waiting on a delivery
-  CursorVector mBroadcastCursors;  // guarded by mMutex; one per running broadcast, outermost first
-  DeliveryVector mDeliveries;      // guarded by mMutex; parallel to mBroadcastCursors
+  // The registry, the running broadcasts and the waiting removals. Shared so
+  // that listeners can hold weak links to it: a listener destroyed while this
+  // broadcaster is destroyed on another thread finds the core closed instead
+  // of freed memory. Set at construction, never changed.
+  std::shared_ptr<BroadcasterCore> mCore;
   std::atomic<bool> mBroadcasting{true};  // unguarded; read by the main thread
 };
 

@@ -32,10 +32,12 @@
 
 #include <atomic>
 #include <list>
+#include <memory>
 
 namespace Tarn {
 
 class Broadcaster;
+class BroadcasterCore;
 class Message;
 
 /// The base of every object that receives messages from a Broadcaster by
@@ -79,23 +81,33 @@ public:
   bool GetListenState() const noexcept { return IsListening(); }
   /// @}
 
-private:
-  friend class Broadcaster;
-  using BroadcasterList = std::list<Broadcaster*, kivcore::utility::SmallBlockAllocator::STLAllocator<Broadcaster*>>;
+protected:
+  /// Detaches this listener from every broadcaster that holds it by plain
+  /// pointer; off the main thread it first waits for deliveries to it running
+  /// on other threads. ~Listener does this too, but by then the derived part
+  /// is gone: a class whose handler may still be called while it is destroyed
+  /// on another thread calls this first in its own destructor, while whole.
+  /// Allocates nothing and throws nothing.
+  void DetachFromBroadcasters() noexcept;
 
-  // For Broadcaster only: record / forget a plain-pointer registration.
-  // RemoveBroadcaster drops one record, so that a removal whose back-link
-  // update lands after the listener was added again (a handler re-adding
-  // itself while a worker removes it) leaves the new registration's record.
-  TARN_MESSAGING_LOCAL void AddBroadcaster(Broadcaster* inBroadcaster);
-  TARN_MESSAGING_LOCAL void RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept;
-  // Drops every record of a broadcaster that is being destroyed.
-  TARN_MESSAGING_LOCAL void ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept;
+private:
+  friend class BroadcasterCore;
+  // One plain-pointer registration: the broadcaster (compared, never
+  // followed) and a weak link to its core (locked to detach).
+  struct BackLink {
+    Broadcaster* mBroadcaster;
+    std::weak_ptr<BroadcasterCore> mCore;
+  };
+  using BackLinkList = std::list<BackLink, kivcore::utility::SmallBlockAllocator::STLAllocator<BackLink>>;
+
+  // For BroadcasterCore only, with the core's lock held: at most one link
+  // per core, so the list is exact.
+  TARN_MESSAGING_LOCAL void AddBroadcaster(Broadcaster* inBroadcaster, const std::weak_ptr<BroadcasterCore>& inCore);
+  TARN_MESSAGING_LOCAL void RemoveBroadcaster(const std::weak_ptr<BroadcasterCore>& inCore) noexcept;
 
   // Broadcasters holding this listener by plain pointer, in attach order.
-  // Guarded by mBroadcastersBusy: a broadcaster on another thread (one being
-  // destroyed, say) may update it while this listener is attached elsewhere.
-  BroadcasterList mBroadcasters;
+  // Guarded by mBroadcastersBusy, which is taken after any core's lock.
+  BackLinkList mBroadcasters;
   mutable std::atomic<bool> mBroadcastersBusy{false};
   std::atomic<bool> mListening{true};  // read by the delivering (main) thread
 };

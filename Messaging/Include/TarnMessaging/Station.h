@@ -23,6 +23,9 @@
 
 #include <kivcore/ImmutableString.h>
 
+#include <atomic>
+#include <cstdint>
+
 namespace Tarn {
 
 /// A named relay: a Broadcaster that listeners attach to, and a Listener
@@ -45,7 +48,14 @@ public:
   kivcore::utility::ImmutableString GetStationID() const { return mStationID; }
 
 private:
+  friend class StationRetirement;
+  // Broadcaster::BroadcastMessage, counted in mBroadcastDepth while it runs.
+  TARN_MESSAGING_LOCAL void BroadcastCounted(const Message& inMessage);
+
   const kivcore::utility::ImmutableString mStationID;
+  // Broadcasts on this station running on the main thread, relays included.
+  // Changed only by the thread that broadcasts; read by the registry.
+  std::atomic<std::int32_t> mBroadcastDepth{0};
 };
 
 }  // namespace Tarn
