@@ -50,22 +50,4 @@ TEST_F(StationTest, RelayDisposedOrReleasedFromInsideItsOwnBroadcastIsDeletedWhe
   }
 }
 
-// A station destructor may dispose of other stations and so re-enter the
-// deletion of queued stations: each is deleted once, in queue order.
-TEST_F(StationTest, QueuedStationsDisposingOthersInTheirDestructorsAreEachDeletedOnce) {
-  const ImmutableString victim = MakeCounted(), first = MakeCounted(), second = MakeCounted();
-  const int serials[] = {Counted(victim)->Serial(), Counted(first)->Serial(), Counted(second)->Serial()};
-  Counted(first)->OnDestroy([victim] { Registry::DisposeStation(victim); });
-  RunOnWorker([&] {
-    Registry::DisposeStation(first);
-    Registry::DisposeStation(second);
-  });
-  EXPECT_EQ(StationLog::Destructions(), 0) << "a worker's disposal deleted at once";
-  DrainPendingStations();
-  for (const int serial : serials) EXPECT_EQ(StationLog::TimesDestroyed(serial), 1) << "station " << serial;
-  std::vector<int> order;
-  for (const Destruction& destruction : StationLog::DestroyedStations()) order.push_back(destruction.mSerial);
-  EXPECT_EQ(order, (std::vector<int>{serials[0], serials[1], serials[2]}));
-}
-
 }  // namespace
