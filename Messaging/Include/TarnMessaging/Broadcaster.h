@@ -26,12 +26,20 @@
 /// manager's GuardedCall and the broadcast goes on with the next listener.
 ///
 /// Threading: every operation except BroadcastMessage may be called from any
-/// thread. RemoveListener on a thread other than the main thread blocks until
-/// a delivery to that listener running on the main thread has returned, so a
-/// listener may be destroyed right after its removal; on the main thread it
-/// never blocks. The broadcaster's lock is never held while a handler runs or
-/// while a remover waits. A broadcaster must not be destroyed while a
-/// broadcast on it runs or a remover waits on it.
+/// thread. A removal returns only when no delivery of that listener runs on
+/// another thread: it blocks until such a delivery has returned, so the
+/// listener may be destroyed right after. It never waits for a delivery on
+/// its own thread (a handler removing itself, even after its thread stopped
+/// being the main thread) and allocates nothing, so destructors may remove.
+/// The broadcaster's lock is never held while a handler runs or while a
+/// remover waits.
+///
+/// Lifetime: the registry lives in a shared core; plain-pointer listeners
+/// hold weak links to it. So a broadcaster and a listener may be destroyed at
+/// the same time on two threads: ~Broadcaster only closes the core and calls
+/// no listener, ~Listener detaches from the cores still open. A broadcaster
+/// destroyed by a handler of its own broadcast leaves that broadcast to end
+/// on the closed core; a remover waiting on it keeps the core alive.
 ///
 /// Misuse (a null or expired listener) is reported through the contract-check
 /// procedure; when the report returns, the call goes on harmlessly.
@@ -75,8 +83,8 @@ struct TARN_MESSAGING_API ListenerEntry {
 /// newest first. Holds listeners without owning them: by plain pointer (with a
 /// back-link), by weak pointer, or by a safe listener's weak reference.
 /// Broadcasts deliver only on the main thread; every other operation may be
-/// called from any thread, and a removal off the main thread waits for a
-/// delivery to that listener in progress on the main thread.
+/// called from any thread, and a removal waits for a delivery to that
+/// listener in progress on another thread.
 class TARN_MESSAGING_API Broadcaster {
 public:
   /// An empty registry, broadcasting.
@@ -84,8 +92,8 @@ public:
   /// A new, empty registry; only the broadcasting state is copied.
   Broadcaster(const Broadcaster& inOther);
   Broadcaster& operator=(const Broadcaster&) = delete;
-  /// Drops the back-links of plain-pointer listeners; tells no weak or safe
-  /// listener. Takes no lock and waits for nothing.
+  /// Closes the core: plain-pointer listeners lose their back-links, weak and
+  /// safe ones are not told. Calls no listener and waits for nothing.
   virtual ~Broadcaster();
 
   /// Delivers inMessage, by reference, to every listener (see above). Does
@@ -105,8 +113,8 @@ public:
 
   /// Removes a registration; one that is not registered is ignored. With
   /// inUpdateListener the broadcaster also drops itself from the listener's
-  /// back-links (only a listener's own destructor passes false). Blocks off
-  /// the main thread while the main thread delivers to that listener.
+  /// back-links (only a listener's own destructor passes false). Blocks while
+  /// another thread delivers to that listener; allocates nothing.
   /// Preconditions as for AddListener (inListener != NULL,
   /// inListener.lock() != NULL).
   /// @{

@@ -17,13 +17,15 @@
 /// other. Listeners held through weak pointers keep no such link.
 ///
 /// Threading: handlers run on the main thread. The listener's destructor
-/// detaches it from its broadcasters; on a thread other than the main thread
-/// that waits until a delivery to this listener that is running on the main
-/// thread has returned (never on the main thread). Because the derived part is
-/// already gone by the time ~Listener runs, a listener that may be destroyed
-/// on a worker while the main thread broadcasts to it should detach itself in
-/// its own destructor. StopListening/StartListening may be called from any
-/// thread and take effect from the next delivery.
+/// detaches it from its broadcasters and returns only when no delivery to
+/// this listener runs on another thread (it never waits for one on its own
+/// thread); it allocates nothing. A broadcaster destroyed at
+/// the same time on another thread is safe: whichever goes first unlinks the
+/// other. Because the derived part is already gone by the time ~Listener
+/// runs, a listener that may be destroyed on a worker while the main thread
+/// delivers to it calls DetachFromBroadcasters() in its own destructor, as
+/// Station does. StopListening/StartListening may be called from any thread
+/// and take effect from the next delivery.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -43,8 +45,8 @@ class Message;
 /// The base of every object that receives messages from a Broadcaster by
 /// plain pointer or through a weak pointer. Handlers run on the main thread.
 /// A listener held by plain pointer and its broadcaster detach from each
-/// other when either is destroyed; off the main thread the listener's
-/// destructor waits for a delivery to it in progress on the main thread.
+/// other when either is destroyed; the listener's destructor waits for a
+/// delivery to it in progress on another thread.
 class TARN_MESSAGING_API Listener {
 public:
   /// A listener attached to nothing, listening.
@@ -83,8 +85,8 @@ public:
 
 protected:
   /// Detaches this listener from every broadcaster that holds it by plain
-  /// pointer; off the main thread it first waits for deliveries to it running
-  /// on other threads. ~Listener does this too, but by then the derived part
+  /// pointer, and returns only when no delivery to it runs on another
+  /// thread. ~Listener does this too, but by then the derived part
   /// is gone: a class whose handler may still be called while it is destroyed
   /// on another thread calls this first in its own destructor, while whole.
   /// Allocates nothing and throws nothing.
