@@ -21,7 +21,8 @@ class StationRetainer {
 public:
   // The ID is copied now: by the release the station may be gone (a handler
   // of its broadcast terminated the library), and the release may delete the
-  // station and the caller's string with it.
+  // station and the caller's string with it, so neither is read after the
+  // broadcast.
   explicit StationRetainer(const ImmutableString& inStationID)
       : mStation(StationRegistry::RetainStation(inStationID)), mStationID(inStationID) {}
   ~StationRetainer() {
