@@ -1,6 +1,7 @@
 #include <TarnMessaging/Broadcaster.h>
 #include <TarnMessaging/Message.h>
 
+#include "BroadcasterCore.h"
 #include "ContractCheck.h"
 
 #include <kivcore/Error.h>
@@ -10,6 +11,7 @@
 #include <boost/function.hpp>
 #include <boost/make_shared.hpp>
 
+#include <algorithm>
 #include <cstdint>
 #include <functional>
 #include <limits>
@@ -17,7 +19,6 @@
 
 namespace Tarn {
 
-using kivcore::threads::Gate;
 using kivcore::threads::RecursiveMutex;
 
 namespace {
@@ -31,20 +32,16 @@ bool OwnerEquivalent(const WeakPtr& inA, const WeakPtr& inB) noexcept {
   return !inA.owner_before(inB) && !inB.owner_before(inA);
 }
 
-// Unlocks on every way out of a locked region, exceptions included.
-class Unlocker {
+// Holds a core's lock for a scope, exceptions included.
+class Locked {
 public:
-  explicit Unlocker(RecursiveMutex& inMutex) noexcept : mMutex(&inMutex) {}
-  ~Unlocker() { Release(); }
-  void Release() noexcept {
-    if (mMutex != nullptr) mMutex->Unlock();
-    mMutex = nullptr;
-  }
-  Unlocker(const Unlocker&) = delete;
-  Unlocker& operator=(const Unlocker&) = delete;
+  Locked(RecursiveMutex& inMutex, const char* inLabel) : mMutex(inMutex) { mMutex.Lock(inLabel); }
+  ~Locked() { mMutex.Unlock(); }
+  Locked(const Locked&) = delete;
+  Locked& operator=(const Locked&) = delete;
 
 private:
-  RecursiveMutex* mMutex;
+  RecursiveMutex& mMutex;
 };
 
 }  // namespace
@@ -58,17 +55,6 @@ bool ListenerEntry::operator==(const ListenerEntry& inOther) const noexcept {
          OwnerEquivalent(mStdWeakListener, inOther.mStdWeakListener);
 }
 
-bool ListenerEntry::operator<(const ListenerEntry& inOther) const noexcept {
-  const auto listener = reinterpret_cast<std::uintptr_t>(mListener);
-  const auto otherListener = reinterpret_cast<std::uintptr_t>(inOther.mListener);
-  if (listener != otherListener) return listener < otherListener;
-  if (mSafeListener.owner_before(inOther.mSafeListener)) return true;
-  if (inOther.mSafeListener.owner_before(mSafeListener)) return false;
-  if (mBoostWeakListener.owner_before(inOther.mBoostWeakListener)) return true;
-  if (inOther.mBoostWeakListener.owner_before(mBoostWeakListener)) return false;
-  return mStdWeakListener.owner_before(inOther.mStdWeakListener);
-}
-
 bool ListenerEntry::IsLive() const {
   if (mListener != nullptr) return true;
   // The temporary references are dropped at once; if they were the last, the
@@ -80,219 +66,298 @@ bool ListenerEntry::IsLive() const {
 }
 
 // ---------------------------------------------------------------------------
-// Construction and destruction
+// The core
 
 struct Broadcaster::BroadcastMessageRecord {
   const ListenerEntry& mEntry;
   const Message& mMessage;
+  bool* mGone;  // set when a weak or safe listener no longer exists
 };
 
-Broadcaster::Broadcaster() = default;
-
-Broadcaster::Broadcaster(const Broadcaster& inOther) : mBroadcasting(inOther.IsBroadcasting()) {}
-
-Broadcaster::~Broadcaster() {
-  for (const ListenerEntry& entry : mListeners) {
-    if (entry.mListener != nullptr) entry.mListener->ForgetBroadcaster(this);
+const BroadcasterCore::Waiter* BroadcasterCore::WaiterList::find(const ListenerEntry& inEntry) const noexcept {
+  for (const Waiter* waiter = mFirst; waiter != nullptr; waiter = waiter->mNext) {
+    if (*waiter->mEntry == inEntry) return waiter;
   }
+  return nullptr;
 }
 
-// ---------------------------------------------------------------------------
-// Registry
-
-std::int32_t Broadcaster::FindEntry(const ListenerEntry& inEntry) const noexcept {
-  const std::int32_t count = EntryCount();
+std::ptrdiff_t BroadcasterCore::Find(const ListenerEntry& inEntry) const noexcept {
+  const std::ptrdiff_t count = static_cast<std::ptrdiff_t>(mEntries.size());
   if (inEntry.mListener != nullptr) {
     // Every entry has one field set, so an entry holding this pointer is a
     // plain one and equal to the probe: the pointer alone decides.
-    for (std::int32_t position = 0; position < count; ++position) {
-      if (EntryAt(position).mListener == inEntry.mListener) return position;
+    for (std::ptrdiff_t index = count - 1; index >= 0; --index) {
+      if (mEntries[static_cast<std::size_t>(index)].mEntry.mListener == inEntry.mListener) return index;
     }
     return -1;
   }
-  for (std::int32_t position = 0; position < count; ++position) {
-    if (EntryAt(position) == inEntry) return position;
+  for (std::ptrdiff_t index = count - 1; index >= 0; --index) {
+    if (mEntries[static_cast<std::size_t>(index)].mEntry == inEntry) return index;
   }
   return -1;
 }
 
-bool Broadcaster::AddEntry(const ListenerEntry& inEntry) {
-  mMutex.Lock("Broadcaster::AddListener");
-  Unlocker unlock(mMutex);
-  {
-    mMutex.Lock("Broadcaster::HasListener");
-    Unlocker unlockSearch(mMutex);
-    if (FindEntry(inEntry) >= 0) return false;
+bool BroadcasterCore::OtherThreadDelivers(const ListenerEntry& inEntry, std::uintptr_t inSelf) const noexcept {
+  for (const Frame* frame = mFrames; frame != nullptr; frame = frame->mNext) {
+    if (frame->mDelivering && frame->mThread != inSelf && frame->mCurrent == inEntry) return true;
   }
-  // Positions are 32-bit; a registry that could not be indexed counts as
-  // exhausted storage.
-  if (mListeners.size() >= static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) throw std::bad_alloc();
-  mListeners.push_back(inEntry);  // the new front
-  // The new entry lies in front of every running broadcast's cursor: each
-  // cursor moves with the entry it stands on, and none of those broadcasts
-  // will serve the newcomer.
-  for (std::int32_t& cursor : mBroadcastCursors) ++cursor;
+  return false;
+}
+
+void BroadcasterCore::EndDelivery(Frame& ioFrame) noexcept {
+  if (!ioFrame.mDelivering) return;
+  ioFrame.mDelivering = false;
+  if (mGateMap.mFirst == nullptr) return;
+  std::lock_guard<std::mutex> wake(mWakeMutex);
+  ++mWakeGeneration;
+  mDeliveryEnded.notify_all();
+}
+
+void BroadcasterCore::Unlink(Frame& ioFrame) noexcept {
+  EndDelivery(ioFrame);
+  for (Frame** link = &mFrames; *link != nullptr; link = &(*link)->mNext) {
+    if (*link == &ioFrame) {
+      *link = ioFrame.mNext;
+      return;
+    }
+  }
+}
+
+bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
+  Locked lock(mMutex, "Broadcaster::AddListener");
+  {
+    Locked search(mMutex, "Broadcaster::HasListener");
+    if (Find(inEntry) >= 0) return false;
+  }
+  // A registry larger than a 32-bit count counts as exhausted storage.
+  if (mEntries.size() >= static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) throw std::bad_alloc();
+  mEntries.push_back(StoredEntry{inEntry, mNextSerial});
+  if (inEntry.mListener != nullptr) {
+    try {
+      inEntry.mListener->AddBroadcaster(mOwner, weak_from_this());
+    } catch (...) {
+      // Without its back-link the listener could not detach itself when it
+      // dies; take the registration back.
+      mEntries.pop_back();
+      throw;
+    }
+  }
+  // Running broadcasts serve only entries older than where they started, so
+  // the newcomer waits for the next broadcast.
+  ++mNextSerial;
   return true;
 }
+
+void BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck) {
+  Locked lock(mMutex, "Broadcaster::RemoveListener1");
+  const std::ptrdiff_t index = Find(inListener);
+  if (index >= 0) {
+    if (inCheck) TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
+    // Running broadcasts hold serials, not positions: erasing moves nothing
+    // they depend on.
+    mEntries.erase(mEntries.begin() + index);
+  }
+  if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(weak_from_this());
+  if (inWait == Wait::kNever) return;
+  // The caller may destroy the listener next, so no delivery to it may still
+  // run elsewhere. Deliveries on this thread are on the caller's own stack
+  // (a handler removing itself, or anything it calls): waiting for them
+  // would never end. Threads are compared, not main-thread registration,
+  // which a handler may drop meanwhile.
+  const std::uintptr_t self = kivcore::threads::CurrentThreadToken();
+  if (!OtherThreadDelivers(inListener, self)) return;
+  Waiter waiter{&inListener, mGateMap.mFirst};
+  mGateMap.mFirst = &waiter;
+  do {
+    // The generation is read before the core's lock is let go, and bumped
+    // only after a delivery ended under that lock: no wake-up is missed.
+    std::unique_lock<std::mutex> wake(mWakeMutex);
+    const std::uint64_t seen = mWakeGeneration;
+    mMutex.Unlock();
+    mDeliveryEnded.wait(wake, [&] { return mWakeGeneration != seen; });
+    wake.unlock();
+    mMutex.Lock("Broadcaster::RemoveListener2");
+  } while (OtherThreadDelivers(inListener, self));
+  for (Waiter** link = &mGateMap.mFirst; *link != nullptr; link = &(*link)->mNext) {
+    if (*link == &waiter) {
+      *link = waiter.mNext;
+      break;
+    }
+  }
+}
+
+bool BroadcasterCore::Contains(const ListenerEntry& inEntry) {
+  Locked lock(mMutex, "Broadcaster::HasListener");
+  return Find(inEntry) >= 0;
+}
+
+bool BroadcasterCore::IsEmpty() {
+  Locked lock(mMutex, "Broadcaster::HasListener");
+  return mEntries.empty();
+}
+
+void BroadcasterCore::Close() noexcept {
+  Locked lock(mMutex, "Broadcaster::~Broadcaster");
+  const std::weak_ptr<BroadcasterCore> self = weak_from_this();
+  for (const StoredEntry& stored : mEntries) {
+    if (stored.mEntry.mListener != nullptr) stored.mEntry.mListener->RemoveBroadcaster(self);
+  }
+  mEntries.clear();
+  mOwner = nullptr;
+}
+
+void BroadcasterCore::Broadcast(const Message& inMessage) {
+  kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
+  Frame frame;
+  frame.mThread = kivcore::threads::CurrentThreadToken();
+  bool currentIsPlain = true;  // frame.mCurrent has no weak field set
+  bool gone = false;
+  // Built once: the record refers to frame.mCurrent, which each pass
+  // refills. The bound call fits inside the boost::function, so nothing is
+  // allocated.
+  const Broadcaster::BroadcastMessageRecord record{frame.mCurrent, inMessage, &gone};
+  const boost::function<int()> delivery(boost::bind(&Broadcaster::DeliverToListener, boost::cref(record)));
+  {
+    Locked lock(mMutex, "Broadcaster::BroadcastMessage1");
+    frame.mNextBelow = mNextSerial;
+    frame.mNext = mFrames;
+    mFrames = &frame;
+  }
+  // Unlinks the frame on every way out, so that no remover waits for a
+  // broadcast that has ended.
+  struct FrameScope {
+    BroadcasterCore& mCore;
+    Frame& mFrame;
+    bool mLinked = true;
+    ~FrameScope() {
+      if (!mLinked) return;
+      Locked lock(mCore.mMutex, "Broadcaster::BroadcastMessage2");
+      mCore.Unlink(mFrame);
+    }
+  } scope{*this, frame};
+
+  for (;;) {
+    {
+      Locked lock(mMutex, "Broadcaster::BroadcastMessage1");
+      EndDelivery(frame);
+      // The newest entry older than the last one served.
+      auto next = std::lower_bound(mEntries.begin(), mEntries.end(), frame.mNextBelow,
+                                   [](const StoredEntry& inStored, std::uint64_t inSerial) { return inStored.mSerial < inSerial; });
+      if (next == mEntries.begin()) {
+        Unlink(frame);
+        scope.mLinked = false;
+        return;
+      }
+      --next;
+      frame.mNextBelow = next->mSerial;
+      if (next->mEntry.mListener != nullptr && currentIsPlain) {
+        // Copying a plain pointer into a copy without weak fields is a
+        // pointer store: no reference-count traffic.
+        frame.mCurrent.mListener = next->mEntry.mListener;
+      } else {
+        // Only weak references are copied under the lock, and the copy that
+        // is replaced holds only weak ones too: no listener can die here.
+        frame.mCurrent = next->mEntry;
+        currentIsPlain = frame.mCurrent.mListener != nullptr;
+      }
+      frame.mDelivering = true;
+    }
+    // No lock is held while the listener runs.
+    gone = false;
+    errors->GuardedCall(delivery);
+    // A weak or safe listener found gone is pruned as the broadcast passes.
+    if (gone) Remove(frame.mCurrent, nullptr, Wait::kNever, false);
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Broadcaster
+
+Broadcaster::Broadcaster()
+    : mCore(std::allocate_shared<BroadcasterCore>(
+          kivcore::utility::SmallBlockAllocator::STLAllocator<BroadcasterCore>(), this)) {}
+
+Broadcaster::Broadcaster(const Broadcaster& inOther) : Broadcaster() {
+  mBroadcasting.store(inOther.IsBroadcasting(), std::memory_order_relaxed);
+}
+
+Broadcaster::~Broadcaster() { mCore->Close(); }
 
 void Broadcaster::AddListener(Listener* inListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kAddListenerName);
   if (inListener == nullptr) return;  // nothing to register and no back-link to make
   ListenerEntry entry;
   entry.mListener = inListener;
-  if (!AddEntry(entry)) return;
-  try {
-    inListener->AddBroadcaster(this);
-  } catch (...) {
-    // Without its back-link the listener could not detach itself when it
-    // dies; take the registration back.
-    RemoveEntry(entry);
-    throw;
-  }
+  mCore->Add(entry);
 }
 
 void Broadcaster::AddListener(InterfaceRef<ISafeListener> inListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kAddListenerName);
-  if (inListener != nullptr) {
-    TARN_CONTRACT_CHECK(IWeakReferenceCapableRef(inListener) != NULL, kAddListenerName);
-  }
+  // The conversion of a null reference is null, so both checks run.
+  TARN_CONTRACT_CHECK(IWeakReferenceCapableRef(inListener) != NULL, kAddListenerName);
   ListenerEntry entry;
   entry.mSafeListener = GetSafeListenerHandle(inListener);
-  AddEntry(entry);
+  mCore->Add(entry);
 }
 
 void Broadcaster::AddListener(const boost::weak_ptr<Listener>& inListener) {
   TARN_CONTRACT_CHECK(inListener.lock() != NULL, kAddListenerName);
   ListenerEntry entry;
   entry.mBoostWeakListener = inListener;
-  AddEntry(entry);
+  mCore->Add(entry);
 }
 
 void Broadcaster::AddListener(const std::weak_ptr<Listener>& inListener) {
   TARN_CONTRACT_CHECK(inListener.lock() != NULL, kAddListenerName);
   ListenerEntry entry;
   entry.mStdWeakListener = inListener;
-  AddEntry(entry);
+  mCore->Add(entry);
 }
 
+// Each removal holds the core for its whole length, so that a broadcaster
+// destroyed while a remover waits leaves the remover a closed core rather
+// than freed memory.
 void Broadcaster::RemoveListener(Listener* inListener, bool inUpdateListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
   if (inListener == nullptr) return;  // never follow a null pointer
   ListenerEntry entry;
   entry.mListener = inListener;
-  RemoveEntry(entry, inUpdateListener ? inListener : nullptr);
+  const std::shared_ptr<BroadcasterCore> core = mCore;
+  core->Remove(entry, inUpdateListener ? inListener : nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 void Broadcaster::RemoveListener(InterfaceRef<ISafeListener> inListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
   ListenerEntry entry;
   entry.mSafeListener = GetSafeListenerHandle(inListener);
-  RemoveEntry(entry);
+  const std::shared_ptr<BroadcasterCore> core = mCore;
+  core->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 void Broadcaster::RemoveListener(const boost::weak_ptr<Listener>& inListener) {
   TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   ListenerEntry entry;
   entry.mBoostWeakListener = inListener;
-  RemoveEntry(entry);
+  const std::shared_ptr<BroadcasterCore> core = mCore;
+  core->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 void Broadcaster::RemoveListener(const std::weak_ptr<Listener>& inListener) {
   TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   ListenerEntry entry;
   entry.mStdWeakListener = inListener;
-  RemoveEntry(entry);
-}
-
-void Broadcaster::RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink) {
-  boost::shared_ptr<Gate> gate;
-  bool ownsGateRecord = false;
-  ListenerEntry gateKey;
-
-  mMutex.Lock("Broadcaster::RemoveListener1");
-  Unlocker unlock(mMutex);
-
-  const std::int32_t position = FindEntry(inListener);
-  if (position >= 0) {
-    TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
-  }
-
-  // A removal on another thread must not return while a delivery to this
-  // listener runs on the main thread: the caller may destroy the listener
-  // next. Deliveries are found by what each running broadcast is serving, not
-  // only by where its cursor stands, so that this also holds when the entry
-  // is already gone (a handler removed itself, or an earlier remover took it
-  // out and still waits). The main thread never waits: its deliveries in
-  // progress are on its own stack.
-  if (!kivcore::threads::CurrentThreadIsMainThread()) {
-    std::int32_t uncounted = 0;
-    for (const DeliverySlot& slot : mDeliveries) {
-      if (slot.mEntry != nullptr && !slot.mCounted && *slot.mEntry == inListener) ++uncounted;
-    }
-    auto existing = mGateMap.find(inListener);
-    if (existing != mGateMap.end() && !existing->second.mGate->IsOpen()) {
-      // An earlier removal still waits: share its gate, and let it also wait
-      // for the deliveries it did not count.
-      gate = existing->second.mGate;
-      existing->second.mCount += uncounted;
-    } else if (uncounted > 0) {
-      // Made (and possibly failing) before anything changes, so that an
-      // exhausted allocator leaves the registry as it was.
-      gate = boost::allocate_shared<Gate>(kivcore::utility::SmallBlockAllocator::STLAllocator<Gate>(), false);
-      gateKey = position >= 0 ? EntryAt(position) : inListener;
-      if (existing != mGateMap.end()) {
-        // The earlier remover's gate is open and it is about to leave; it
-        // erases the record only while the record still holds its gate.
-        existing->second = GateRecord{gate, uncounted};
-      } else {
-        mGateMap.emplace(gateKey, GateRecord{gate, uncounted});
-      }
-      ownsGateRecord = true;
-    }
-    if (gate) {
-      for (DeliverySlot& slot : mDeliveries) {
-        if (slot.mEntry != nullptr && *slot.mEntry == inListener) slot.mCounted = true;
-      }
-    }
-  }
-
-  if (position >= 0) {
-    // A cursor on the removed entry steps back to the entry before it, so its
-    // broadcast goes on with the entry that followed the removed one; cursors
-    // beyond it step back with the entries they stand on.
-    for (std::int32_t& cursor : mBroadcastCursors) {
-      if (cursor >= position) --cursor;
-    }
-    mListeners.erase(mListeners.end() - 1 - position);
-  }
-  unlock.Release();
-  // Whether or not an entry was removed; after the wait the listener may
-  // already be gone (its owner may destroy it as soon as no delivery runs).
-  if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(this);
-
-  if (!gate) return;
-  gate->PassThrough(-1);
-  if (!ownsGateRecord) return;
-  mMutex.Lock("Broadcaster::RemoveListener2");
-  Unlocker unlockCleanup(mMutex);
-  const auto record = mGateMap.find(gateKey);
-  if (record != mGateMap.end() && record->second.mGate == gate) mGateMap.erase(record);
+  const std::shared_ptr<BroadcasterCore> core = mCore;
+  core->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 bool Broadcaster::HasListener(Listener* inListener) {
   TARN_CONTRACT_CHECK(inListener, kHasListenerName);
   ListenerEntry entry;
   entry.mListener = inListener;
-  mMutex.Lock("Broadcaster::HasListener");
-  Unlocker unlock(mMutex);
-  return FindEntry(entry) >= 0;
+  return mCore->Contains(entry);
 }
 
-bool Broadcaster::HasListeners() {
-  mMutex.Lock("Broadcaster::HasListener");
-  Unlocker unlock(mMutex);
-  return !mListeners.empty();
-}
+bool Broadcaster::HasListeners() { return !mCore->IsEmpty(); }
 
 // ---------------------------------------------------------------------------
 // Delivery
@@ -307,131 +372,27 @@ int Broadcaster::DeliverToListener(const BroadcastMessageRecord& inRecord) {
   }
   if (entry.mSafeListener) {
     const ISafeListenerRef listener = ResolveSafeListener(entry.mSafeListener);
-    if (listener != nullptr) listener->ListenToMessage(inRecord.mMessage);
+    if (listener != nullptr) {
+      listener->ListenToMessage(inRecord.mMessage);
+      return 0;
+    }
+  } else if (const boost::shared_ptr<Listener> listener = entry.mBoostWeakListener.lock()) {
+    listener->ProcessMessage(inRecord.mMessage);
     return 0;
-  }
-  if (const boost::shared_ptr<Listener> listener = entry.mBoostWeakListener.lock()) {
+  } else if (const std::shared_ptr<Listener> listener = entry.mStdWeakListener.lock()) {
     listener->ProcessMessage(inRecord.mMessage);
     return 0;
   }
-  if (const std::shared_ptr<Listener> listener = entry.mStdWeakListener.lock()) {
-    listener->ProcessMessage(inRecord.mMessage);
-  }
+  *inRecord.mGone = true;
   return 0;
 }
 
 void Broadcaster::BroadcastMessage(const Message& inMessage) {
   if (!IsBroadcasting() || !kivcore::threads::CurrentThreadIsMainThread()) return;
-
-  kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
-  ListenerEntry current;  // the entry being served, then the one served last
-  bool currentIsPlain = true;  // `current` has no weak field set
-  bool cursorPushed = false;
-  // Built once: the record refers to `current`, which each pass refills. The
-  // bound call fits inside the boost::function, so nothing is allocated.
-  const BroadcastMessageRecord record{current, inMessage};
-  const boost::function<int()> delivery(boost::bind(&Broadcaster::DeliverToListener, boost::cref(record)));
-
-  for (;;) {
-    mMutex.Lock("Broadcaster::BroadcastMessage1");
-    Unlocker unlock(mMutex);
-    try {
-      if (!cursorPushed) {
-        // Room for the delivery slot first, so that neither push can fail
-        // after the other succeeded.
-        mDeliveries.reserve(mBroadcastCursors.size() + 1);
-        mBroadcastCursors.push_back(-1);
-        mDeliveries.push_back(DeliverySlot{nullptr, false});
-        cursorPushed = true;
-      } else {
-        // A remover on another thread may be waiting for the delivery just
-        // made; this broadcast's share of its count ends here.
-        DeliverySlot& slot = mDeliveries.back();
-        if (slot.mCounted) {
-          const auto waiting = mGateMap.find(current);
-          if (waiting != mGateMap.end() && --waiting->second.mCount == 0) waiting->second.mGate->Open();
-        }
-        slot = DeliverySlot{nullptr, false};
-      }
-      // The cursor is re-read through back() on every step: a nested broadcast
-      // pushes behind it (and may move the vector), and removals shift it.
-      std::int32_t cursor = ++mBroadcastCursors.back();
-      bool plainCopied = false;
-      while (cursor < EntryCount()) {
-        const ListenerEntry& atCursor = EntryAt(cursor);
-        if (atCursor.mListener != nullptr) {
-          // Plain pointers are always live. Copying one into a copy whose weak
-          // fields are empty is a pointer store: no reference-count traffic.
-          if (currentIsPlain) {
-            current.mListener = atCursor.mListener;
-          } else {
-            current = atCursor;
-            currentIsPlain = true;
-          }
-          plainCopied = true;
-          break;
-        }
-        if (!atCursor.mSafeListener) {
-          // A weak pointer is tested with expired(), which takes no reference,
-          // so no listener can die here, under the lock. One that dies after
-          // the test is not called by its delivery and is pruned next time.
-          const bool live = atCursor.mBoostWeakListener.empty() ? !atCursor.mStdWeakListener.expired()
-                                                                : !atCursor.mBoostWeakListener.expired();
-          if (live) break;
-          // Prune as the cursor passes: the removal steps this cursor back one.
-          const ListenerEntry dead = atCursor;
-          RemoveEntry(dead);
-          cursor = ++mBroadcastCursors.back();
-          continue;
-        }
-        // A safe listener is resolved, which takes a reference. Test a copy:
-        // dropping the test's reference may destroy the listener, whose
-        // destructor may change this registry (and move the cursor with the
-        // entry it stands on).
-        const ListenerEntry candidate = atCursor;
-        if (candidate.IsLive()) {
-          cursor = mBroadcastCursors.back();
-          if (cursor < EntryCount() && EntryAt(cursor) == candidate) break;
-          // The candidate itself was removed meanwhile, which stepped the
-          // cursor back onto the entry before it: move on past it.
-          cursor = ++mBroadcastCursors.back();
-          continue;
-        }
-        // Prune as the cursor passes: the removal steps this cursor back one.
-        RemoveEntry(candidate);
-        cursor = ++mBroadcastCursors.back();
-      }
-      if (cursor >= EntryCount()) {
-        mBroadcastCursors.pop_back();
-        mDeliveries.pop_back();
-        cursorPushed = false;
-        // Closing sweep, in the same hold of the lock: once no broadcast of
-        // this broadcaster runs any more, no delivery can be in progress, so
-        // any remover still waiting is released.
-        if (mBroadcastCursors.empty() && !mGateMap.empty()) {
-          for (auto& element : mGateMap) {
-            if (element.second.mCount != 0) element.second.mGate->Open();
-          }
-        }
-        break;
-      }
-      if (!plainCopied) {
-        current = EntryAt(cursor);
-        currentIsPlain = current.mListener != nullptr;
-      }
-      mDeliveries.back().mEntry = &current;
-    } catch (...) {
-      if (cursorPushed) {
-        mBroadcastCursors.pop_back();
-        mDeliveries.pop_back();
-      }
-      throw;
-    }
-    unlock.Release();
-
-    // No lock is held while the listener runs.
-    errors->GuardedCall(delivery);
-  }
+  // Held for the whole broadcast: a handler that destroys this broadcaster
+  // leaves the broadcast a closed, empty core to finish on.
+  const std::shared_ptr<BroadcasterCore> core = mCore;
+  core->Broadcast(inMessage);
 }
 
 }  // namespace Tarn

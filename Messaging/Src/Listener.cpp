@@ -1,18 +1,20 @@
 #include <TarnMessaging/Broadcaster.h>
 #include <TarnMessaging/Listener.h>
 
+#include "BroadcasterCore.h"
+
 #include <algorithm>
 #include <thread>
 
 namespace Tarn {
 
 namespace {
-// Holds a listener's back-link lock for a scope. The lock is a spin lock:
-// it guards a few list operations only and is never held across a call into
-// a broadcaster.
+// Holds a listener's back-link lock for a scope. A spin lock: it guards a few
+// list operations, is taken after any core's lock and is never held across a
+// call into a core.
 class BroadcastersLock {
 public:
-  BroadcastersLock(std::atomic<bool>& inBusy) noexcept : mBusy(inBusy) {
+  explicit BroadcastersLock(std::atomic<bool>& inBusy) noexcept : mBusy(inBusy) {
     while (mBusy.exchange(true, std::memory_order_acquire)) std::this_thread::yield();
   }
   ~BroadcastersLock() { mBusy.store(false, std::memory_order_release); }
@@ -22,6 +24,11 @@ public:
 private:
   std::atomic<bool>& mBusy;
 };
+
+template <class WeakPtr>
+bool SameOwner(const WeakPtr& inA, const WeakPtr& inB) noexcept {
+  return !inA.owner_before(inB) && !inB.owner_before(inA);
+}
 }  // namespace
 
 Listener::Listener() noexcept = default;
@@ -33,21 +40,28 @@ Listener& Listener::operator=(const Listener& inOther) noexcept {
   return *this;
 }
 
-Listener::~Listener() {
-  // Take one broadcaster at a time out of the list and detach from it with
-  // the lock released: the removal may wait for the main thread, and a
-  // broadcaster destroyed meanwhile on another thread must still be able to
-  // drop its own link (then it is never called here).
+Listener::~Listener() { DetachFromBroadcasters(); }
+
+void Listener::DetachFromBroadcasters() noexcept {
+  // The link stays in the list until the core takes it out together with the
+  // entry, under the core's lock: a broadcaster closing meanwhile on another
+  // thread then finds either both or neither.
   for (;;) {
-    Broadcaster* broadcaster = nullptr;
+    std::weak_ptr<BroadcasterCore> link;
     {
       BroadcastersLock lock(mBroadcastersBusy);
-      if (mBroadcasters.empty()) break;
-      broadcaster = mBroadcasters.front();
-      mBroadcasters.pop_front();
+      if (mBroadcasters.empty()) return;
+      link = mBroadcasters.front().mCore;
     }
-    // false: the broadcaster must not touch the list we are emptying.
-    if (broadcaster != nullptr) broadcaster->RemoveListener(this, false);
+    if (const std::shared_ptr<BroadcasterCore> core = link.lock()) {
+      ListenerEntry entry;
+      entry.mListener = this;
+      core->Remove(entry, this, BroadcasterCore::Wait::kForOtherThreads, false);
+    } else {
+      // The broadcaster is gone and its core with it; only a link left by a
+      // removal that did not update this listener can be in that state.
+      RemoveBroadcaster(link);
+    }
   }
 }
 
@@ -55,23 +69,22 @@ void Listener::DispatchMessage(const Message& inMessage) { ListenToMessage(inMes
 
 bool Listener::HasBroadcaster(Broadcaster* inBroadcaster) const {
   BroadcastersLock lock(mBroadcastersBusy);
-  return std::find(mBroadcasters.begin(), mBroadcasters.end(), inBroadcaster) != mBroadcasters.end();
+  return std::any_of(mBroadcasters.begin(), mBroadcasters.end(), [&](const BackLink& inLink) {
+    return inLink.mBroadcaster == inBroadcaster && !inLink.mCore.expired();
+  });
 }
 
-void Listener::AddBroadcaster(Broadcaster* inBroadcaster) {
+void Listener::AddBroadcaster(Broadcaster* inBroadcaster, const std::weak_ptr<BroadcasterCore>& inCore) {
   BroadcastersLock lock(mBroadcastersBusy);
-  mBroadcasters.push_back(inBroadcaster);
+  for (const BackLink& link : mBroadcasters) {
+    if (SameOwner(link.mCore, inCore)) return;
+  }
+  mBroadcasters.push_back(BackLink{inBroadcaster, inCore});
 }
 
-void Listener::RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept {
+void Listener::RemoveBroadcaster(const std::weak_ptr<BroadcasterCore>& inCore) noexcept {
   BroadcastersLock lock(mBroadcastersBusy);
-  const auto found = std::find(mBroadcasters.begin(), mBroadcasters.end(), inBroadcaster);
-  if (found != mBroadcasters.end()) mBroadcasters.erase(found);
-}
-
-void Listener::ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept {
-  BroadcastersLock lock(mBroadcastersBusy);
-  mBroadcasters.remove(inBroadcaster);
+  mBroadcasters.remove_if([&](const BackLink& inLink) { return SameOwner(inLink.mCore, inCore); });
 }
 
 }  // namespace Tarn

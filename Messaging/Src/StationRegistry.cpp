@@ -1,11 +1,14 @@
 #include <TarnMessaging/Station.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "StationRetirement.h"
+
 #include <kivcore/Guid.h>
 #include <kivcore/MainThread.h>
 #include <kivcore/RecursiveMutex.h>
 #include <kivcore/SmallBlockAllocator.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cstdint>
 #include <cstdio>
@@ -40,7 +43,17 @@ struct StationRecord {
 // Keys compare by identity (interned handles), never by text.
 using StationMap = std::map<ImmutableString, StationRecord, std::less<ImmutableString>,
                             Alloc<std::pair<const ImmutableString, StationRecord>>>;
-using PendingStationList = std::vector<Station*, Alloc<Station*>>;
+// A station the registry no longer lists but still owns. mRetired: kept for
+// the end of a broadcast on it (else: queued by a disposal off the main
+// thread, for the next main-thread disposal).
+// mClaim: the nesting level of the running deletion sweep that will delete
+// it (0: none).
+struct PendingStation {
+  Station* mStation;
+  bool mRetired;
+  std::uint32_t mClaim = 0;
+};
+using PendingStationList = std::vector<PendingStation, Alloc<PendingStation>>;
 
 // Constant-initialised, with a trivial destructor: usable even by a station
 // destroyed after the registry at process exit.
@@ -87,21 +100,53 @@ public:
   RegistryLock& operator=(const RegistryLock&) = delete;
 };
 
-void DeleteAll(PendingStationList& ioList) {
-  // A station destructor may dispose of another station and re-enter here:
-  // take the list's contents out before deleting, so that each station is
-  // deleted once and newcomers are picked up by the next round.
-  while (!ioList.empty()) {
-    PendingStationList batch;
-    batch.swap(ioList);
-    for (Station* station : batch) delete station;
+// Set while the pending list holds a retired station, so that the end of
+// every station broadcast can tell in one load that there is nothing to do.
+std::atomic<bool> sHasRetired{false};
+
+enum class Sweep {
+  kRetired,   // stations kept for the end of a broadcast on them
+  kAll,       // and those queued by disposals off the main thread
+  kEverything // at static destruction: every station, busy or not
+};
+
+// Deletes the stations of the list that Sweep names and no broadcast holds,
+// in the order they were queued; a busy one stays, retired, for the end of
+// that broadcast. The registry's lock must be held. A station destructor may
+// dispose of another station and re-enter here: each call claims the
+// stations it will delete before deleting any, and a nested call deletes
+// only stations queued after that, so none is deleted twice and none is lost.
+void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
+  static std::uint32_t sSweepDepth = 0;  // guarded by the registry's lock
+  const std::uint32_t sweep = ++sSweepDepth;
+  struct Leave {
+    ~Leave() { --sSweepDepth; }
+  } leave;
+  for (PendingStation& pending : ioList) {
+    if (pending.mClaim != 0) continue;
+    if (inSweep != Sweep::kEverything && StationRetirement::IsBroadcasting(*pending.mStation)) {
+      pending.mRetired = true;
+    } else if (inSweep != Sweep::kRetired || pending.mRetired) {
+      pending.mClaim = sweep;
+    }
   }
+  for (;;) {
+    const auto doomed = std::find_if(ioList.begin(), ioList.end(), [&](const PendingStation& inPending) { return inPending.mClaim == sweep; });
+    if (doomed == ioList.end()) break;
+    Station* const station = doomed->mStation;
+    ioList.erase(doomed);
+    delete station;
+  }
+  sHasRetired.store(std::any_of(ioList.begin(), ioList.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
+  // An empty list keeps no storage, so that a drained registry holds no
+  // blocks beyond its records.
+  if (ioList.empty()) PendingStationList().swap(ioList);
 }
 
 struct PendingStationHolder {
   ~PendingStationHolder() {
     RegistryLock lock(nullptr);
-    DeleteAll(mStations);
+    DeleteAll(mStations, Sweep::kEverything);
   }
   PendingStationList mStations;
 };
@@ -109,6 +154,14 @@ struct PendingStationHolder {
 PendingStationList& GetPendingStationList() {
   static PendingStationHolder sHolder;
   return sHolder.mStations;
+}
+
+// Keeps a station that a main-thread broadcast holds for the end of that
+// broadcast. Room in the list must have been made. The registry's lock must
+// be held.
+void Retire(Station* inStation) {
+  GetPendingStationList().push_back(PendingStation{inStation, true});
+  sHasRetired.store(true);
 }
 
 // Finds the record, making its station through the factory if needed. The
@@ -195,16 +248,32 @@ void ReleaseStation(const ImmutableString& inStationID) {
     if (found == map->end()) return;
     StationRecord& record = found->second;
     if (record.mStation == nullptr) return;
-    --record.mRetainCount;
-    if (record.mRetainCount != 0 || !record.mDisposeRequested) return;
-    doomed = record.mStation;
-    record.mStation = nullptr;
-    map->erase(found);
+    if (record.mRetainCount == 1 && record.mDisposeRequested) {
+      const bool onMainThread = kivcore::threads::CurrentThreadIsMainThread();
+      PendingStationList& pending = GetPendingStationList();
+      // Room is made before anything changes, so an exhausted allocator
+      // leaves the registry as it was.
+      if (onMainThread) pending.reserve(pending.size() + 1);
+      doomed = record.mStation;
+      map->erase(found);
+      // On the main thread, a release from inside a broadcast on the station
+      // (its own relay, say) must not pull the station from under it.
+      if (onMainThread && StationRetirement::IsBroadcasting(*doomed)) {
+        Retire(doomed);
+        return;
+      }
+      if (pending.empty()) PendingStationList().swap(pending);
+    } else {
+      --record.mRetainCount;
+      return;
+    }
   }
   // Deleted after the lock is released: on a worker thread the station's
-  // destructor may wait for the main thread to finish delivering to it, and
-  // the main thread's handlers must be able to reach the registry meanwhile.
-  // The record is already gone, so nobody else can reach the station.
+  // destructor waits for a delivery to it running on the main thread, whose
+  // handlers must be able to reach the registry meanwhile. Nobody else can
+  // reach the station: its record is gone, and a worker never deletes a
+  // station whose destructor is not yet running while the main thread
+  // relays through it, because that destructor detaches it first.
   delete doomed;
 }
 
@@ -219,19 +288,25 @@ void DisposeStation(const ImmutableString& inStationID) {
     return;
   }
   const bool onMainThread = kivcore::threads::CurrentThreadIsMainThread();
+  Station* const station = record.mStation;
+  // Deleted at once on the main thread unless a broadcast on it is in
+  // progress there (a handler disposing of the station it hears from).
+  const bool deleteNow = station != nullptr && onMainThread && !StationRetirement::IsBroadcasting(*station);
   PendingStationList& pending = GetPendingStationList();
   // Room is made before the record goes, so an exhausted allocator cannot
   // leave a station that nobody owns.
-  if (!onMainThread && record.mStation != nullptr) pending.reserve(pending.size() + 1);
-  Station* station = record.mStation;
+  if (station != nullptr && !deleteNow) pending.reserve(pending.size() + 1);
   record.mStation = nullptr;
   map->erase(found);
-  if (onMainThread) {
+  if (deleteNow) {
     delete station;
-    DeleteAll(pending);
+  } else if (station != nullptr && onMainThread) {
+    Retire(station);
   } else if (station != nullptr) {
-    pending.push_back(station);
+    // Waits for the next main-thread disposal.
+    pending.push_back(PendingStation{station, false});
   }
+  if (onMainThread) DeleteAll(pending, Sweep::kAll);
 }
 
 void Terminate() {
@@ -239,16 +314,40 @@ void Terminate() {
   {
     RegistryLock lock("StationRegistry::Terminate");
     StationMapAccess map;
+    // Room for every station, in case each is still broadcasting; made
+    // before anything changes, so an exhausted allocator leaves the registry
+    // as it was.
+    PendingStationList& pending = GetPendingStationList();
+    pending.reserve(pending.size() + map->size());
     doomed.swap(*map);
   }
   // Station destructors run without the registry's lock; each looks itself
-  // up and finds nothing.
+  // up and finds nothing. A station with a broadcast in progress (Terminate
+  // called from one of its handlers) is retired and goes when that broadcast
+  // ends.
   for (auto& element : doomed) {
     Station* station = element.second.mStation;
     element.second.mStation = nullptr;
-    delete station;
+    if (station == nullptr) continue;
+    if (StationRetirement::IsBroadcasting(*station)) {
+      RegistryLock lock("StationRegistry::Terminate");
+      Retire(station);
+    } else {
+      delete station;
+    }
   }
+  RegistryLock lock("StationRegistry::Terminate");
+  PendingStationList& pending = GetPendingStationList();
+  if (kivcore::threads::CurrentThreadIsMainThread()) DeleteAll(pending, Sweep::kRetired);
+  if (pending.empty()) PendingStationList().swap(pending);
 }
 
 }  // namespace StationRegistry
+
+void StationRetirement::DrainRetired() {
+  if (!sHasRetired.load()) return;
+  RegistryLock lock(nullptr);
+  DeleteAll(GetPendingStationList(), Sweep::kRetired);
+}
+
 }  // namespace Tarn

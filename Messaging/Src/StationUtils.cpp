@@ -19,15 +19,14 @@ constexpr const char* kSwitchStationName = "Tarn::StationUtils::SwitchStation";
 // Retains a station for one call and releases it on every way out.
 class StationRetainer {
 public:
+  // The ID is copied now: by the release the station may be gone (a handler
+  // of its broadcast terminated the library), and the release may delete the
+  // station and the caller's string with it, so neither is read after the
+  // broadcast.
   explicit StationRetainer(const ImmutableString& inStationID)
-      : mStation(StationRegistry::RetainStation(inStationID)) {}
+      : mStation(StationRegistry::RetainStation(inStationID)), mStationID(inStationID) {}
   ~StationRetainer() {
-    if (mStation == nullptr) return;
-    // The release may delete the station and its ID with it, so it is given
-    // a copy of the ID, not the caller's string or a reference into the
-    // station.
-    const ImmutableString stationID = mStation->GetStationID();
-    StationRegistry::ReleaseStation(stationID);
+    if (mStation != nullptr) StationRegistry::ReleaseStation(mStationID);
   }
   StationRetainer(const StationRetainer&) = delete;
   StationRetainer& operator=(const StationRetainer&) = delete;
@@ -37,6 +36,7 @@ public:
 
 private:
   Station* const mStation;
+  const ImmutableString mStationID;
 };
 
 // Whether a weak pointer can still be locked; the temporary is dropped at

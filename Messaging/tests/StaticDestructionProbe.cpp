@@ -1,14 +1,9 @@
 // A program for the lifecycle tests, run as a child process so that its exit
 // (and the static destruction that comes with it) can be watched from
-// outside. Each mode leaves one station alive at exit and says on standard
-// output when that station is deleted:
-//
-//   late    a station owned by a static object of this program, deleted
-//           after the station registry's own static destruction; its
-//           destructor's registry lookup must report that on standard error
-//   queued  a station disposed of while no main thread is registered, so
-//           that it waits in the registry's pending list until exit; it must
-//           be deleted while the registry is still alive, silently
+// outside. Mode "queued" disposes of a station while no main thread is
+// registered, so that it waits in the registry's pending list until exit; it
+// must be deleted while the registry is still alive, silently, and says so on
+// standard output.
 //
 // Exit status 0 when the mode ran, 1 for an unknown mode, 2 when the
 // registry did not behave as the mode needs.
@@ -39,22 +34,10 @@ private:
 // so before the registry, which is made on its first use inside main.
 // Static objects are destroyed in the reverse order of their construction,
 // so this one goes after the registry.
-struct LateStationHolder {
-  ~LateStationHolder() { delete mStation; }
-  Tarn::Station* mStation = nullptr;
-};
-LateStationHolder sLateStation;
-
 }  // namespace
 
 int main(int argc, char** argv) {
   if (argc < 2) return 1;
-  if (std::strcmp(argv[1], "late") == 0) {
-    // The registry's first use: its map is made now, after sLateStation.
-    if (Tarn::StationRegistry::FindStation(Tarn::kStation_Idle) != nullptr) return 2;
-    sLateStation.mStation = new AnnouncingStation(ImmutableString::CreateStatic("probe.late"), "late");
-    return 0;
-  }
   if (std::strcmp(argv[1], "queued") == 0) {
     if (kivcore::threads::CurrentThreadIsMainThread()) return 2;
     const ImmutableString id = Tarn::StationRegistry::UniqueStationID();

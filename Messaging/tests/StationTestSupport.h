@@ -1,6 +1,6 @@
 // Helpers of the station, registry, station-utility, posting and lifecycle
 // suites: probe messages whose copies are counted, stations that log their
-// construction and destruction, factories that count, fail or throw, and a
+// construction and destruction, a factory that counts, and a
 // fixture that leaves the process-wide station registry, the main thread and
 // the allocator's fault injection as it found them.
 //
@@ -161,12 +161,6 @@ public:
     std::lock_guard<std::mutex> lock(Mutex());
     return Destroyed();
   }
-  // Serials in the order the stations were destroyed.
-  static std::vector<int> DestroyedSerials() {
-    std::vector<int> serials;
-    for (const Destruction& destruction : DestroyedStations()) serials.push_back(destruction.mSerial);
-    return serials;
-  }
   // How often the station with inSerial was destroyed (more than once is a
   // double delete).
   static int TimesDestroyed(int inSerial) {
@@ -240,36 +234,6 @@ inline int SerialOf(Tarn::Station* inStation) {
   return counted != nullptr ? counted->Serial() : 0;
 }
 
-// A factory that yields null while sFailuresLeft is above 0 and counts down;
-// then makes CountedStations.
-struct FlakyFactory {
-  static inline std::atomic<int> sFailuresLeft{0};
-  static inline std::atomic<int> sCalls{0};
-  static Tarn::Station* Make(const ImmutableString& inStationID) {
-    sCalls.fetch_add(1);
-    if (sFailuresLeft.load() > 0) {
-      sFailuresLeft.fetch_sub(1);
-      return nullptr;
-    }
-    return new CountedStation(inStationID);
-  }
-};
-
-// A factory that throws while sThrowsLeft is above 0 and counts down; then
-// makes CountedStations.
-struct ThrowingFactory {
-  static inline std::atomic<int> sThrowsLeft{0};
-  static inline std::atomic<int> sCalls{0};
-  static Tarn::Station* Make(const ImmutableString& inStationID) {
-    sCalls.fetch_add(1);
-    if (sThrowsLeft.load() > 0) {
-      sThrowsLeft.fetch_sub(1);
-      throw std::runtime_error("factory refuses");
-    }
-    return new CountedStation(inStationID);
-  }
-};
-
 // Runs inBody on a new thread and returns when it has finished; a worker
 // still running after the deadline stops the process, naming the test.
 inline void RunOnWorker(std::function<void()> inBody) {
@@ -291,10 +255,6 @@ protected:
     kivcore::utility::SmallBlockAllocator::SetFailAfter(-1);
     mMainThread.emplace();
     StationLog::Reset();
-    FlakyFactory::sFailuresLeft = 0;
-    FlakyFactory::sCalls = 0;
-    ThrowingFactory::sThrowsLeft = 0;
-    ThrowingFactory::sCalls = 0;
   }
 
   void TearDown() override {

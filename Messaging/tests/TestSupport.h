@@ -390,11 +390,6 @@ private:
 enum class ListenerKind { kPlainPointer, kBoostWeak, kStdWeak, kSafe };
 constexpr ListenerKind kAllListenerKinds[] = {ListenerKind::kPlainPointer, ListenerKind::kBoostWeak,
                                               ListenerKind::kStdWeak, ListenerKind::kSafe};
-// The kinds whose listener has a shared owner that can let go of it while it
-// is registered (a plain-pointer listener detaches itself when it dies).
-constexpr ListenerKind kSharedListenerKinds[] = {ListenerKind::kBoostWeak, ListenerKind::kStdWeak,
-                                                 ListenerKind::kSafe};
-
 inline const char* KindName(ListenerKind inKind) {
   switch (inKind) {
     case ListenerKind::kPlainPointer:

@@ -26,12 +26,20 @@
 /// manager's GuardedCall and the broadcast goes on with the next listener.
 ///
 /// Threading: every operation except BroadcastMessage may be called from any
-/// thread. RemoveListener on a thread other than the main thread blocks until
-/// a delivery to that listener running on the main thread has returned, so a
-/// listener may be destroyed right after its removal; on the main thread it
-/// never blocks. The broadcaster's lock is never held while a handler runs or
-/// while a remover waits. A broadcaster must not be destroyed while a
-/// broadcast on it runs or a remover waits on it.
+/// thread. A removal returns only when no delivery of that listener runs on
+/// another thread: it blocks until such a delivery has returned, so the
+/// listener may be destroyed right after. It never waits for a delivery on
+/// its own thread (a handler removing itself, even after its thread stopped
+/// being the main thread) and allocates nothing, so destructors may remove.
+/// The broadcaster's lock is never held while a handler runs or while a
+/// remover waits.
+///
+/// Lifetime: the registry lives in a shared core; plain-pointer listeners
+/// hold weak links to it. So a broadcaster and a listener may be destroyed at
+/// the same time on two threads: ~Broadcaster only closes the core and calls
+/// no listener, ~Listener detaches from the cores still open. A broadcaster
+/// destroyed by a handler of its own broadcast leaves that broadcast to end
+/// on the closed core; a remover waiting on it keeps the core alive.
 ///
 /// Misuse (a null or expired listener) is reported through the contract-check
 /// procedure; when the report returns, the call goes on harmlessly.
@@ -41,22 +49,15 @@
 #include <TarnMessaging/Listener.h>
 #include <TarnMessaging/SafeListener.h>
 
-#include <kivcore/Gate.h>
-#include <kivcore/RecursiveMutex.h>
-#include <kivcore/SmallBlockAllocator.h>
-
 #include <boost/shared_ptr.hpp>
 #include <boost/weak_ptr.hpp>
 
 #include <atomic>
-#include <cstdint>
-#include <map>
 #include <memory>
-#include <utility>
-#include <vector>
 
 namespace Tarn {
 
+class BroadcasterCore;
 class Message;
 
 /// One registration. Exactly one field is set.
@@ -73,8 +74,6 @@ struct TARN_MESSAGING_API ListenerEntry {
   bool operator==(const ListenerEntry& inOther) const noexcept;
   bool operator!=(const ListenerEntry& inOther) const noexcept { return !(*this == inOther); }
   /// @}
-  /// Lexicographic over the plain pointer and the owners of the three others.
-  bool operator<(const ListenerEntry& inOther) const noexcept;
   /// Whether the listener can still be reached: a plain pointer always; a
   /// safe listener that resolves; a weak pointer that locks.
   bool IsLive() const;
@@ -84,8 +83,8 @@ struct TARN_MESSAGING_API ListenerEntry {
 /// newest first. Holds listeners without owning them: by plain pointer (with a
 /// back-link), by weak pointer, or by a safe listener's weak reference.
 /// Broadcasts deliver only on the main thread; every other operation may be
-/// called from any thread, and a removal off the main thread waits for a
-/// delivery to that listener in progress on the main thread.
+/// called from any thread, and a removal waits for a delivery to that
+/// listener in progress on another thread.
 class TARN_MESSAGING_API Broadcaster {
 public:
   /// An empty registry, broadcasting.
@@ -93,8 +92,8 @@ public:
   /// A new, empty registry; only the broadcasting state is copied.
   Broadcaster(const Broadcaster& inOther);
   Broadcaster& operator=(const Broadcaster&) = delete;
-  /// Drops the back-links of plain-pointer listeners; tells no weak or safe
-  /// listener. Takes no lock and waits for nothing.
+  /// Closes the core: plain-pointer listeners lose their back-links, weak and
+  /// safe ones are not told. Calls no listener and waits for nothing.
   virtual ~Broadcaster();
 
   /// Delivers inMessage, by reference, to every listener (see above). Does
@@ -114,8 +113,8 @@ public:
 
   /// Removes a registration; one that is not registered is ignored. With
   /// inUpdateListener the broadcaster also drops itself from the listener's
-  /// back-links (only a listener's own destructor passes false). Blocks off
-  /// the main thread while the main thread delivers to that listener.
+  /// back-links (only a listener's own destructor passes false). Blocks while
+  /// another thread delivers to that listener; allocates nothing.
   /// Preconditions as for AddListener (inListener != NULL,
   /// inListener.lock() != NULL).
   /// @{
@@ -140,50 +139,15 @@ public:
   /// @}
 
 private:
-  template <class T>
-  using Alloc = kivcore::utility::SmallBlockAllocator::STLAllocator<T>;
-  struct GateRecord {
-    boost::shared_ptr<kivcore::threads::Gate> mGate;
-    std::int32_t mCount;  // deliveries to the removed entry still running
-  };
-  // Stored oldest first, so that adding the newest entry is an append and
-  // reading position p (0 = newest) is one subtraction: index size-1-p.
-  using EntryQueue = std::vector<ListenerEntry, Alloc<ListenerEntry>>;
-  using GateMap = std::map<ListenerEntry, GateRecord, std::less<ListenerEntry>,
-                           Alloc<std::pair<const ListenerEntry, GateRecord>>>;
-  using CursorVector = std::vector<std::int32_t, Alloc<std::int32_t>>;
-  // What one running broadcast is delivering right now, beside its cursor.
-  struct DeliverySlot {
-    const ListenerEntry* mEntry;  // the broadcast's copy of the entry it serves; null between deliveries
-    bool mCounted;                // a waiting remover counts this delivery in its gate record
-  };
-  using DeliveryVector = std::vector<DeliverySlot, Alloc<DeliverySlot>>;
-
+  friend class BroadcasterCore;
   struct BroadcastMessageRecord;
   TARN_MESSAGING_LOCAL static int DeliverToListener(const BroadcastMessageRecord& inRecord);
 
-  // Inserts inEntry at the front unless an equal entry exists; true when
-  // inserted.
-  TARN_MESSAGING_LOCAL bool AddEntry(const ListenerEntry& inEntry);
-  // The one removal path (also used to prune dead entries). A non-null
-  // inUnlink drops this broadcaster from that listener's back-links once the
-  // entry is out and before any wait, while a running delivery still keeps
-  // the listener in existence.
-  TARN_MESSAGING_LOCAL void RemoveEntry(const ListenerEntry& inListener, Listener* inUnlink = nullptr);
-  // Linear search from the front (newest); the position, or -1 when absent.
-  // mMutex must be held.
-  TARN_MESSAGING_LOCAL std::int32_t FindEntry(const ListenerEntry& inEntry) const noexcept;
-  // The entry at a position counted from the front. mMutex must be held.
-  const ListenerEntry& EntryAt(std::int32_t inPosition) const noexcept {
-    return mListeners[mListeners.size() - 1 - static_cast<std::size_t>(inPosition)];
-  }
-  std::int32_t EntryCount() const noexcept { return static_cast<std::int32_t>(mListeners.size()); }
-
-  kivcore::threads::RecursiveMutex mMutex;
-  EntryQueue mListeners;           // guarded by mMutex; position 0 (the front) = newest
-  GateMap mGateMap;                // guarded by mMutex; removals waiting on a delivery
-  CursorVector mBroadcastCursors;  // guarded by mMutex; one per running broadcast, outermost first
-  DeliveryVector mDeliveries;      // guarded by mMutex; parallel to mBroadcastCursors
+  // The registry, the running broadcasts and the waiting removals. Shared so
+  // that listeners can hold weak links to it: a listener destroyed while this
+  // broadcaster is destroyed on another thread finds the core closed instead
+  // of freed memory. Set at construction, never changed.
+  std::shared_ptr<BroadcasterCore> mCore;
   std::atomic<bool> mBroadcasting{true};  // unguarded; read by the main thread
 };
 

@@ -17,13 +17,15 @@
 /// other. Listeners held through weak pointers keep no such link.
 ///
 /// Threading: handlers run on the main thread. The listener's destructor
-/// detaches it from its broadcasters; on a thread other than the main thread
-/// that waits until a delivery to this listener that is running on the main
-/// thread has returned (never on the main thread). Because the derived part is
-/// already gone by the time ~Listener runs, a listener that may be destroyed
-/// on a worker while the main thread broadcasts to it should detach itself in
-/// its own destructor. StopListening/StartListening may be called from any
-/// thread and take effect from the next delivery.
+/// detaches it from its broadcasters and returns only when no delivery to
+/// this listener runs on another thread (it never waits for one on its own
+/// thread); it allocates nothing. A broadcaster destroyed at
+/// the same time on another thread is safe: whichever goes first unlinks the
+/// other. Because the derived part is already gone by the time ~Listener
+/// runs, a listener that may be destroyed on a worker while the main thread
+/// delivers to it calls DetachFromBroadcasters() in its own destructor, as
+/// Station does. StopListening/StartListening may be called from any thread
+/// and take effect from the next delivery.
 #pragma once
 
 #include <TarnMessaging/Export.h>
@@ -32,17 +34,19 @@
 
 #include <atomic>
 #include <list>
+#include <memory>
 
 namespace Tarn {
 
 class Broadcaster;
+class BroadcasterCore;
 class Message;
 
 /// The base of every object that receives messages from a Broadcaster by
 /// plain pointer or through a weak pointer. Handlers run on the main thread.
 /// A listener held by plain pointer and its broadcaster detach from each
-/// other when either is destroyed; off the main thread the listener's
-/// destructor waits for a delivery to it in progress on the main thread.
+/// other when either is destroyed; the listener's destructor waits for a
+/// delivery to it in progress on another thread.
 class TARN_MESSAGING_API Listener {
 public:
   /// A listener attached to nothing, listening.
@@ -79,23 +83,33 @@ public:
   bool GetListenState() const noexcept { return IsListening(); }
   /// @}
 
-private:
-  friend class Broadcaster;
-  using BroadcasterList = std::list<Broadcaster*, kivcore::utility::SmallBlockAllocator::STLAllocator<Broadcaster*>>;
+protected:
+  /// Detaches this listener from every broadcaster that holds it by plain
+  /// pointer, and returns only when no delivery to it runs on another
+  /// thread. ~Listener does this too, but by then the derived part
+  /// is gone: a class whose handler may still be called while it is destroyed
+  /// on another thread calls this first in its own destructor, while whole.
+  /// Allocates nothing and throws nothing.
+  void DetachFromBroadcasters() noexcept;
 
-  // For Broadcaster only: record / forget a plain-pointer registration.
-  // RemoveBroadcaster drops one record, so that a removal whose back-link
-  // update lands after the listener was added again (a handler re-adding
-  // itself while a worker removes it) leaves the new registration's record.
-  TARN_MESSAGING_LOCAL void AddBroadcaster(Broadcaster* inBroadcaster);
-  TARN_MESSAGING_LOCAL void RemoveBroadcaster(Broadcaster* inBroadcaster) noexcept;
-  // Drops every record of a broadcaster that is being destroyed.
-  TARN_MESSAGING_LOCAL void ForgetBroadcaster(Broadcaster* inBroadcaster) noexcept;
+private:
+  friend class BroadcasterCore;
+  // One plain-pointer registration: the broadcaster (compared, never
+  // followed) and a weak link to its core (locked to detach).
+  struct BackLink {
+    Broadcaster* mBroadcaster;
+    std::weak_ptr<BroadcasterCore> mCore;
+  };
+  using BackLinkList = std::list<BackLink, kivcore::utility::SmallBlockAllocator::STLAllocator<BackLink>>;
+
+  // For BroadcasterCore only, with the core's lock held: at most one link
+  // per core, so the list is exact.
+  TARN_MESSAGING_LOCAL void AddBroadcaster(Broadcaster* inBroadcaster, const std::weak_ptr<BroadcasterCore>& inCore);
+  TARN_MESSAGING_LOCAL void RemoveBroadcaster(const std::weak_ptr<BroadcasterCore>& inCore) noexcept;
 
   // Broadcasters holding this listener by plain pointer, in attach order.
-  // Guarded by mBroadcastersBusy: a broadcaster on another thread (one being
-  // destroyed, say) may update it while this listener is attached elsewhere.
-  BroadcasterList mBroadcasters;
+  // Guarded by mBroadcastersBusy, which is taken after any core's lock.
+  BackLinkList mBroadcasters;
   mutable std::atomic<bool> mBroadcastersBusy{false};
   std::atomic<bool> mListening{true};  // read by the delivering (main) thread
 };

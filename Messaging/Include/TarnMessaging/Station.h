@@ -12,9 +12,17 @@
 /// (StationRegistry.h) and reached by name through StationUtils. A station the
 /// registry holds is deleted only by the registry.
 ///
-/// Threading: as Broadcaster and Listener. The destructor takes the registry's
-/// lock for one lookup and, off the main thread, may wait while the main
-/// thread delivers to the station as a listener.
+/// Threading: as Broadcaster and Listener. The destructor first detaches the
+/// station's listener part while the station is still whole (off the main
+/// thread that waits for a relay through it running on the main thread), then
+/// takes the registry's lock for one lookup.
+///
+/// When a station dies: the registry never deletes a station while a
+/// broadcast on it runs on the main thread (its own, or a relay of what it
+/// hears). A disposal, last release or Terminate reached from inside such a
+/// broadcast retires the station instead, and it is deleted when the
+/// outermost of those broadcasts ends. Everywhere else the timing is the
+/// registry's (StationRegistry.h).
 #pragma once
 
 #include <TarnMessaging/Broadcaster.h>
@@ -22,6 +30,9 @@
 #include <TarnMessaging/Listener.h>
 
 #include <kivcore/ImmutableString.h>
+
+#include <atomic>
+#include <cstdint>
 
 namespace Tarn {
 
@@ -45,7 +56,14 @@ public:
   kivcore::utility::ImmutableString GetStationID() const { return mStationID; }
 
 private:
+  friend class StationRetirement;
+  // Broadcaster::BroadcastMessage, counted in mBroadcastDepth while it runs.
+  TARN_MESSAGING_LOCAL void BroadcastCounted(const Message& inMessage);
+
   const kivcore::utility::ImmutableString mStationID;
+  // Broadcasts on this station running on the main thread, relays included.
+  // Changed only by the thread that broadcasts; read by the registry.
+  std::atomic<std::int32_t> mBroadcastDepth{0};
 };
 
 }  // namespace Tarn

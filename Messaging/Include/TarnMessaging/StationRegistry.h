@@ -24,6 +24,13 @@
 /// whatever thread makes the last release, after letting go of the lock (the
 /// destructor may wait for the main thread, whose handlers may need the
 /// registry). Terminate deletes on the calling thread, without the lock.
+///
+/// A station is never deleted under a broadcast on it: a main-thread
+/// disposal, last release or Terminate that meets a station whose broadcast
+/// (or relay) is running on the main thread retires it, and it is deleted
+/// when that broadcast ends. A queued station met by a main-thread disposal
+/// while it relays is retired likewise. Terminate also deletes the retired
+/// stations that no broadcast holds any more.
 #pragma once
 
 #include <TarnMessaging/Export.h>

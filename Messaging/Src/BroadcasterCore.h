@@ -1,0 +1,110 @@
+// The shared state behind a Tarn::Broadcaster: its registry of listeners, the
+// broadcasts running on it and the removals waiting for them.
+//
+// The broadcaster owns its core through a shared_ptr; listeners held by plain
+// pointer keep weak links to it. So a broadcaster and a listener destroyed at
+// the same time on two threads never call into each other's freed memory:
+// ~Broadcaster only closes the core (dropping the back-links of its listeners
+// under the core's lock), and ~Listener locks each link and detaches from the
+// cores that still exist. Entries and back-links change together under the
+// core's lock; a listener's own list lock is always taken last.
+//
+// A running broadcast is a Frame on the broadcasting thread's stack, linked
+// into the core: {newest serial not yet due, entry being delivered, thread}.
+// Entries carry rising serials, so the next entry a broadcast serves is the
+// newest one older than the last it served, whatever was added or removed
+// meanwhile. A removal erases the entry and then waits on one condition
+// variable until no frame on another thread delivers that listener: nothing
+// is allocated, and no thread ever waits for its own stack.
+#pragma once
+
+#include <TarnMessaging/Broadcaster.h>
+
+#include <kivcore/RecursiveMutex.h>
+#include <kivcore/SmallBlockAllocator.h>
+
+#include <condition_variable>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <vector>
+
+namespace Tarn {
+
+class BroadcasterCore : public std::enable_shared_from_this<BroadcasterCore> {
+public:
+  // One running broadcast; lives on the broadcasting thread's stack.
+  struct Frame {
+    std::uint64_t mNextBelow = 0;     // serves entries older than this serial
+    ListenerEntry mCurrent;           // the entry being delivered (a copy)
+    bool mDelivering = false;         // mCurrent is being delivered right now
+    std::uintptr_t mThread = 0;       // the broadcasting thread
+    Frame* mNext = nullptr;           // the next running broadcast
+  };
+  // A removal waiting for deliveries of an equal entry; on the remover's stack.
+  struct Waiter {
+    const ListenerEntry* mEntry;
+    Waiter* mNext;
+  };
+  // The removals that still wait, with the lookup the misuse check reads.
+  struct WaiterList {
+    Waiter* mFirst = nullptr;
+    const Waiter* find(const ListenerEntry& inEntry) const noexcept;
+    const Waiter* end() const noexcept { return nullptr; }
+  };
+  enum class Wait { kForOtherThreads, kNever };
+
+  explicit BroadcasterCore(Broadcaster* inOwner) noexcept : mOwner(inOwner) {}
+  BroadcasterCore(const BroadcasterCore&) = delete;
+  BroadcasterCore& operator=(const BroadcasterCore&) = delete;
+
+  // Inserts inEntry as the newest unless an equal one exists. For a plain
+  // listener the back-link is recorded in the same hold of the lock. True
+  // when inserted.
+  bool Add(const ListenerEntry& inEntry);
+  // Erases an equal entry, if any. inUnlink (a plain listener) also loses its
+  // back-link to this core, whether or not an entry was found. With
+  // kForOtherThreads, returns only once no other thread delivers to an equal
+  // entry. Allocates nothing, so destructors may call it (without inCheck it
+  // throws nothing).
+  // inCheck runs the misuse check of a public removal (a second removal of
+  // an equal entry while an earlier one still waits); it may throw.
+  void Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck);
+  bool Contains(const ListenerEntry& inEntry);
+  bool IsEmpty();
+  // The broadcast itself; see Broadcaster::BroadcastMessage.
+  void Broadcast(const Message& inMessage);
+  // The owner is being destroyed: plain listeners lose their back-links and
+  // every registration goes. Waits for nothing.
+  void Close() noexcept;
+
+private:
+  template <class T>
+  using Alloc = kivcore::utility::SmallBlockAllocator::STLAllocator<T>;
+  struct StoredEntry {
+    ListenerEntry mEntry;
+    std::uint64_t mSerial;
+  };
+  using EntryVector = std::vector<StoredEntry, Alloc<StoredEntry>>;
+
+  // Linear search; the index, or -1. mMutex must be held.
+  std::ptrdiff_t Find(const ListenerEntry& inEntry) const noexcept;
+  bool OtherThreadDelivers(const ListenerEntry& inEntry, std::uintptr_t inSelf) const noexcept;
+  // Ends a frame's delivery and wakes waiting removers. mMutex must be held.
+  void EndDelivery(Frame& ioFrame) noexcept;
+  void Unlink(Frame& ioFrame) noexcept;
+
+  kivcore::threads::RecursiveMutex mMutex;
+  Broadcaster* mOwner;                // guarded by mMutex; null once closed
+  EntryVector mEntries;               // guarded by mMutex; oldest first, serials rising
+  std::uint64_t mNextSerial = 1;      // guarded by mMutex
+  Frame* mFrames = nullptr;           // guarded by mMutex
+  WaiterList mGateMap;                // guarded by mMutex; removals still waiting
+  // Removers sleep on these; a delivery that ends bumps the generation.
+  // Taken inside mMutex, never the other way round.
+  std::mutex mWakeMutex;
+  std::condition_variable mDeliveryEnded;   // waited on with mWakeMutex
+  std::uint64_t mWakeGeneration = 0;        // guarded by mWakeMutex
+};
+
+}  // namespace Tarn
