@@ -43,7 +43,6 @@
 #include <kivcore/kivcore.h>
 
 #include <boost/make_shared.hpp>
-#include <boost/shared_ptr.hpp>
 
 #include <algorithm>
 #include <atomic>
@@ -55,7 +54,7 @@
 #include <memory>
 #include <random>
 #include <string>
-#include <thread>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -70,6 +69,7 @@ class Choices {
 public:
   virtual std::uint32_t Below(std::uint32_t inBound) = 0;  // in [0, inBound); inBound > 0
   virtual bool Exhausted() = 0;
+  virtual std::string Replay() { return std::string(); }  // how to run this sequence again
 
 protected:
   ~Choices() = default;
@@ -89,78 +89,72 @@ enum Way { kPlain, kBoost, kStd, kSafe };
 class Harness;
 inline Harness* sHarness = nullptr;
 inline std::atomic<int> sLiveStations{0};
+void Called(int inSlot);
+void Destroyed(int inSlot);
+void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
 
-class Probe : public Tarn::Listener {
+// A listener in slot mSlot, of either base: Tarn::Listener, or the safe listeners' base.
+template <class Base>
+class Probe : public Base {
 public:
   explicit Probe(int inSlot) : mSlot(inSlot) {}
-  ~Probe() override;
-  void ListenToMessage(const Tarn::Message&) override;
+  ~Probe() override { Destroyed(mSlot); }
+  void ListenToMessage(const Tarn::Message&) override { Called(mSlot); }
   const int mSlot;
 };
+using PlainProbe = Probe<Tarn::Listener>;
 
-class SafeProbe : public Tarn::SafeListenerBase {
-public:
-  explicit SafeProbe(int inSlot) : mSlot(inSlot) {}
-  void ListenToMessage(const Tarn::Message&) override;
-  const int mSlot;
-
-protected:
-  ~SafeProbe() override;
-};
-
+// Reports its life for node mNode (1-4); -1: counted only.
 class TrackedStation : public Tarn::Station {
 public:
-  TrackedStation(const ImmutableString& inStationID, int inNode);
-  ~TrackedStation() override;
-  const int mNode;  // -1: counted only (RunConcurrent)
+  TrackedStation(const ImmutableString& inStationID, int inNode) : Tarn::Station(inStationID), mNode(inNode) {
+    ++sLiveStations;
+    StationLife(mNode, this);
+  }
+  ~TrackedStation() override {
+    --sLiveStations;
+    StationLife(mNode, nullptr);
+  }
+  const int mNode;
 };
 
-inline Tarn::Station* MakeCounted(const ImmutableString& inStationID) { return new TrackedStation(inStationID, -1); }
-inline Tarn::Station* MakeTracked(const ImmutableString& inStationID);
+// What a main thread does for workers: runs their posted calls, deletes the stations they disposed of.
+inline void Drain() {
+  Utils::FlushPostedMessagesOnUIThread();
+  Registry::DisposeStation(Registry::RegisterUniqueStation());
+}
 
-template <class L>
-void RemoveFrom(Tarn::Broadcaster& ioBroadcaster, const L& inListener, bool) {
-  ioBroadcaster.RemoveListener(inListener);
-}
-inline void RemoveFrom(Tarn::Broadcaster& ioBroadcaster, Tarn::Listener* const& inListener, bool inUnlink) {
-  ioBroadcaster.RemoveListener(inListener, inUnlink);
-}
+inline Tarn::Station* MakeCounted(const ImmutableString& inStationID) { return new TrackedStation(inStationID, -1); }
+Tarn::Station* MakeTracked(const ImmutableString& inStationID);
 
 struct Entry {
-  int mToken;  // larger = newer
-  int mWho;    // a slot, kSlots + station, or kTimer
-  int mWay;
+  int mToken, mWho, mWay;  // mToken: larger = newer; mWho: a slot, kSlots + a station relaying, kTimer or kGone
 };
 
 struct Node {
   std::vector<Entry> mEntries;
-  bool mBroadcasting = true;
-  bool mRegistered = false;  // stations: the registry holds a record
-  bool mMade = false;        // the station object lives (node 0: always)
-  bool mDoomed = false;      // no longer registered; deleted once no broadcast on it runs
-  bool mDisposeRequested = false;
-  int mRetains = 0;
-  int mHeld = 0;    // retains the harness took and will release
-  int mFrames = 0;  // broadcasts on it in progress
+  bool mBroadcasting = true, mRegistered = false, mDisposeRequested = false;
+  bool mMade = false;    // the station object lives (node 0: always)
+  bool mDoomed = false;  // no longer registered; deleted once no broadcast on it runs
+  int mRetains = 0, mHeld = 0;  // mHeld: the retains the harness took and will release
+  int mFrames = 0;              // broadcasts on it in progress
 };
 
 struct Object {
   int mKind = -1;  // a Way; -1: never made
   bool mOwned = false, mAlive = false, mListening = true, mDestroyed = false;
-  int mHolds = 0;             // weak or safe deliveries in progress, each keeping it alive
-  int mLinks[kNodes] = {};    // back-link records the listener holds, per node
-  std::unique_ptr<Probe> mPlain;
-  boost::shared_ptr<Probe> mBoost;
-  std::shared_ptr<Probe> mStd;
+  int mHolds = 0;           // weak or safe deliveries in progress, each keeping it alive
+  int mLinks[kNodes] = {};  // back-link records the listener holds, per node
+  std::unique_ptr<PlainProbe> mPlain;
+  boost::shared_ptr<PlainProbe> mBoost;
+  std::shared_ptr<PlainProbe> mStd;
   Tarn::ISafeListenerRef mSafe;
   Tarn::Listener* mListener = nullptr;  // while owned; null for safe listeners
 };
 
 struct Frame {
-  int mNode;
-  int mLast;         // token of the entry served last (at first: the first token it must not serve)
-  int mWho = -1;     // the slot being delivered to, or -1
-  int mWay = kPlain;
+  int mNode, mLast;            // mLast: token served last (at first: the first it must not serve)
+  int mWho = -1, mWay = kPlain;  // the slot being delivered to, or -1
 };
 
 class Harness {
@@ -173,10 +167,7 @@ public:
         [](std::exception_ptr) { sHarness->Fail("an exception left a handler"); });
     mIDs[kIdle] = Tarn::kStation_Idle;
     Initialize();
-    for (int node = 1; node < kIdle; ++node) {
-      mIDs[node] = Registry::UniqueStationID();
-      RegistryOp(node, 0, false);
-    }
+    for (int node = 1; node < kIdle; ++node) mIDs[node] = Registry::UniqueStationID(), RegistryOp(node, 0, false);
   }
   Harness(const Harness&) = delete;
   Harness& operator=(const Harness&) = delete;
@@ -206,13 +197,11 @@ public:
     return mFailure;
   }
 
-  void Fail(const std::string& inWhat) {
-    if (mFailure.empty()) mFailure = inWhat + "\noperations:" + mTrace;
-  }
+  void Fail(const std::string& inWhat) { mFailure += mFailure.empty() ? inWhat + "\noperations:" + mTrace : ""; }
   // The library goes on in freed memory after this: stop here, with the trace.
   [[noreturn]] void Fatal(const char* inWhat) {
     Fail(inWhat);
-    std::fprintf(stderr, "operations harness: %s\n", mFailure.c_str());
+    std::fprintf(stderr, "operations harness: %s\n%s\n", mFailure.c_str(), mChoices.Replay().c_str());
     std::abort();
   }
 
@@ -228,7 +217,7 @@ public:
     mStale = true;
   }
   void OnDestroyed(int inSlot) { mObjects[inSlot].mDestroyed = true; }
-  void OnStation(int inNode, TrackedStation* inStation) {
+  void OnStation(int inNode, Tarn::Station* inStation) {
     const Node& node = mNodes[inNode];
     // Inside the library, after the last handler it called, the model has yet to walk the rest of the innermost
     // broadcast (and the utilities' release at its end): a station may go only if nobody else is to be called.
@@ -240,18 +229,16 @@ public:
     mStations[inNode] = inStation;
   }
   Tarn::Station* Factory(const ImmutableString& inStationID) {
-    for (int node = 1; node < kNodes; ++node)
-      if (mIDs[node] == inStationID) return new TrackedStation(inStationID, node);
-    return nullptr;
+    const int node = static_cast<int>(std::find(mIDs + 1, mIDs + kNodes, inStationID) - mIDs);
+    return node < kNodes ? new TrackedStation(inStationID, node) : nullptr;
   }
 
 private:
   int Pick(int inBound) { return static_cast<int>(mChoices.Below(static_cast<std::uint32_t>(inBound))); }
-  void Note(const char* inText) { mTrace += inText; }
   template <class... Args>
-  void Note(const char* inFormat, int inFirst, Args... inRest) {
+  void Note(const char* inFormat, Args... inArgs) {
     char text[48];
-    std::snprintf(text, sizeof text, inFormat, inFirst, inRest...);
+    std::snprintf(text, sizeof text, inFormat, inArgs..., 0);  // the 0 keeps every call's arguments non-empty
     mTrace += text;
   }
 
@@ -281,17 +268,13 @@ private:
     const bool helper = mMain && Pick(4) == 0;
     switch (op) {
       case 0: return Create(slot);
-      case 1:
-      case 2: return AddOrRemove(slot, node, true, choice, helper);
-      case 3: return AddOrRemove(slot, node, false, choice, helper);
+      case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
       case 4: return Kill(slot, helper);
       case 5: return Listen(slot, choice < 5);
       case 6: return SetBroadcasting(node, choice < 5);
-      case 7:
-      case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
+      case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
       case 9: return Relay(node, choice % kIdle, choice < 5);
-      case 10:
-      case 11: return RegistryOp(node, choice % 5, helper);
+      case 10: case 11: return RegistryOp(node, choice % 5, helper);
       default: return TimerOp(choice);
     }
   }
@@ -307,10 +290,10 @@ private:
     object.mOwned = object.mAlive = true;
     Note(" new%d.%d", inSlot, object.mKind);
     switch (object.mKind) {
-      case kPlain: object.mListener = (object.mPlain = std::make_unique<Probe>(inSlot)).get(); break;
-      case kBoost: object.mListener = (object.mBoost = boost::make_shared<Probe>(inSlot)).get(); break;
-      case kStd: object.mListener = (object.mStd = std::make_shared<Probe>(inSlot)).get(); break;
-      default: object.mSafe = Tarn::ISafeListenerRef(new SafeProbe(inSlot));
+      case kPlain: object.mListener = (object.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
+      case kBoost: object.mListener = (object.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
+      case kStd: object.mListener = (object.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
+      default: object.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot));
     }
   }
 
@@ -323,10 +306,9 @@ private:
     // main thread waits for the worker.
     if (!inAdd && inHelper && Delivering(inSlot, way)) return;
     // Only the harness's broadcaster, which never dies, is left a back-link by a removal that does not unlink.
-    const bool unlink = inNode != 0 || inChoice != 7;
+    const bool unlink = inNode != 0 || inChoice < 6;
     Note(inAdd ? " add%d.%d@%d" : " rm%d.%d@%d", inSlot, way, inNode);
-    if (!unlink) Note("(keep link)");
-    if (inHelper) Note("h");
+    Note(unlink ? "%s" : "(keep link)%s", inHelper ? "h" : "");
     Model(inNode, inSlot, way, inAdd, unlink);
     OnThread(inHelper, [&] {
       WithListener(object, way, [&](const auto& inListener) { Call(inNode, inAdd, unlink, inListener); });
@@ -345,10 +327,10 @@ private:
 
   template <class L>
   void Call(int inNode, bool inAdd, bool inUnlink, const L& inListener) {
-    if (inNode == 0 && inAdd) mB0.AddListener(inListener);
-    else if (inNode == 0) RemoveFrom(mB0, inListener, inUnlink);
-    else if (inAdd) Utils::AddListener(mIDs[inNode], inListener);
-    else Utils::RemoveListener(mIDs[inNode], inListener);
+    if (inAdd) return inNode == 0 ? mB0.AddListener(inListener) : Utils::AddListener(mIDs[inNode], inListener);
+    if (inNode != 0) return Utils::RemoveListener(mIDs[inNode], inListener);
+    if constexpr (std::is_same_v<L, Tarn::Listener*>) mB0.RemoveListener(inListener, inUnlink);
+    else mB0.RemoveListener(inListener);
   }
 
   void Kill(int inSlot, bool inHelper) {
@@ -358,12 +340,7 @@ private:
     Note(inHelper ? " kill%dh" : " kill%d", inSlot);
     object.mOwned = false;
     if (object.mHolds == 0) Die(inSlot);
-    OnThread(inHelper, [&] {
-      object.mPlain.reset();
-      object.mBoost.reset();
-      object.mStd.reset();
-      object.mSafe = nullptr;
-    });
+    OnThread(inHelper, [&] { object.mPlain.reset(), object.mBoost.reset(), object.mStd.reset(), object.mSafe = nullptr; });
   }
 
   void Listen(int inSlot, bool inOn) {
@@ -371,16 +348,14 @@ private:
     if (!object.mOwned || object.mListener == nullptr) return;
     Note(inOn ? " listen%d" : " deaf%d", inSlot);
     object.mListening = inOn;
-    if (inOn) object.mListener->StartListening();
-    else object.mListener->StopListening();
+    inOn ? object.mListener->StartListening() : object.mListener->StopListening();
   }
 
   void SetBroadcasting(int inNode, bool inOn) {
     Note(inOn ? " start@%d" : " stop@%d", inNode);
     if (Reach(inNode)) mNodes[inNode].mBroadcasting = inOn;
     if (inNode == 0) return inOn ? mB0.StartBroadcasting() : mB0.StopBroadcasting();
-    if (inOn) Utils::StartBroadcasting(mIDs[inNode]);
-    else Utils::StopBroadcasting(mIDs[inNode]);
+    inOn ? Utils::StartBroadcasting(mIDs[inNode]) : Utils::StopBroadcasting(mIDs[inNode]);
   }
 
   void Broadcast(int inNode) {
@@ -422,7 +397,6 @@ private:
     Tarn::Station* got = nullptr;
     if (inOp == 0) {  // an ID is registered again only once its last station is gone
       if (node.mRegistered || node.mMade) return;
-      node = Node();
       node.mRegistered = true;
     } else if (inOp == 1 || inOp == 2) {
       if (Reach(inNode) && inOp == 1) ++node.mRetains, ++node.mHeld;
@@ -438,10 +412,8 @@ private:
     } else if (node.mRegistered) {
       Doom(inNode);
     }
-    static const char* const kNames[] = {" register", " retain", " find", " release", " dispose"};
-    Note(kNames[inOp]);
-    Note("@%d", inNode);
-    if (inHelper) Note("h");
+    static const char* const kNames[] = {" register@%d", " retain@%d", " find@%d", " release@%d", " dispose@%d"};
+    Note(kNames[inOp], inNode), Note(inHelper ? "h" : "");
     OnThread(inHelper, [&] {
       switch (inOp) {
         case 0: return Registry::RegisterStation(id, &MakeTracked);
@@ -461,15 +433,12 @@ private:
     if (!mMain) return;
     if (inChoice == 0) return Terminate();
     if (!mTimer) {
-      Note(" timer");
-      mTimer = std::make_unique<Tarn::IdleCountdownTimer>();
+      Note(" timer"), mTimer = std::make_unique<Tarn::IdleCountdownTimer>();
     } else if (inChoice < 5) {
       // Duration 0: it fires at the first idle message that reaches it.
       Note(" arm");
-      if (!mTimerListening && Reach(kIdle)) {
-        mNodes[kIdle].mEntries.push_back(Entry{mToken++, kTimer, kPlain});
-        mTimerListening = true;
-      }
+      if (!mTimerListening && Reach(kIdle)) mNodes[kIdle].mEntries.push_back(Entry{mToken++, kTimer, kPlain});
+      mTimerListening = mTimerListening || Reach(kIdle);
       mTimer->ArmTimer();
     } else {
       DestroyTimer();
@@ -480,8 +449,7 @@ private:
   void DestroyTimer() {
     if (!mTimer) return;
     Note(" ~timer");
-    if (mTimerListening) Model(kIdle, kTimer, kPlain, false, true);
-    mTimerListening = false;
+    if (std::exchange(mTimerListening, false)) Model(kIdle, kTimer, kPlain, false, true);
     mTimer.reset();
     Settle();
   }
@@ -497,12 +465,8 @@ private:
 
   // --- the model
 
-  bool Reach(int inNode) {
-    if (inNode == 0) return true;
-    if (!mNodes[inNode].mRegistered) return false;
-    mNodes[inNode].mMade = true;  // made by the lookup if it was not yet
-    return true;
-  }
+  // Whether the utilities reach the node (a registered station is made by the lookup if it was not yet).
+  bool Reach(int inNode) { return inNode == 0 || (mNodes[inNode].mRegistered && (mNodes[inNode].mMade = true)); }
 
   bool HasEntry(int inNode, int inWho, int inWay) const {
     const std::vector<Entry>& entries = mNodes[inNode].mEntries;
@@ -538,20 +502,13 @@ private:
 
   void Doom(int inNode) {
     Node& node = mNodes[inNode];
-    node.mRegistered = node.mDisposeRequested = false;
-    node.mRetains = node.mHeld = 0;
-    node.mDoomed = node.mMade;
+    node.mRegistered = node.mDisposeRequested = false, node.mRetains = node.mHeld = 0, node.mDoomed = node.mMade;
   }
 
-  // Doomed stations go once no broadcast on them runs. After a worker's operation the main thread
-  // first drains what the worker left for it: posted calls, and stations queued for deletion.
+  // Doomed stations go once no broadcast on them runs (after a worker's operation, once the main thread drained).
   void Settle() {
     for (int node = 1; node < kNodes; ++node)
       if (mNodes[node].mDoomed && mNodes[node].mFrames == 0) Delete(node);
-  }
-  void Drain() {
-    Utils::FlushPostedMessagesOnUIThread();
-    Registry::DisposeStation(Registry::RegisterUniqueStation());
   }
 
   // A station deleted: it leaves the broadcasters it relays, its listeners lose it.
@@ -561,10 +518,7 @@ private:
     for (Node& node : mNodes) Erase(node.mEntries, [&](const Entry& inEntry) { return inEntry.mWho == kSlots + inNode; });
   }
 
-  void Push(int inNode) {
-    mFrames.push_back(Frame{inNode, mToken});
-    ++mNodes[inNode].mFrames;
-  }
+  void Push(int inNode) { mFrames.push_back(Frame{inNode, mToken}), ++mNodes[inNode].mFrames; }
 
   // The slot that the innermost broadcast begun by the harness calls next, or -1 when it is done;
   // walks relays, the timer, stopped listeners and dead weak entries (which it prunes) on the way.
@@ -588,17 +542,13 @@ private:
       }
       frame.mLast = next->mToken;
       const int who = next->mWho, way = next->mWay;
-      if (who == kGone) {
+      if (who == kGone || who == kTimer) {  // the timer fires: it leaves the idle station, broadcasts on its own
         entries.erase(next);
-      } else if (who == kTimer) {  // it fires: it leaves the idle station and broadcasts on its own, which nobody hears
-        entries.erase(next);
-        mTimerListening = false;
+        mTimerListening = mTimerListening && who != kTimer;
       } else if (who >= kSlots) {
         if (mMain && mNodes[who - kSlots].mBroadcasting) Push(who - kSlots);
       } else if (way == kPlain ? mObjects[who].mListening : mObjects[who].mAlive) {
-        frame.mWho = who;
-        frame.mWay = way;
-        if (way != kPlain) ++mObjects[who].mHolds;
+        frame.mWho = who, frame.mWay = way, mObjects[who].mHolds += way != kPlain;
         return who;
       } else if (way != kPlain) {
         entries.erase(next);
@@ -641,7 +591,7 @@ private:
   kivcore::config::ErrorHandler mPreviousErrors;
   kivcore::config::ErrorManager::ExceptionHandler mPreviousExceptions;
   ImmutableString mIDs[kNodes];
-  TrackedStation* mStations[kNodes] = {};  // as the stations report their lives
+  Tarn::Station* mStations[kNodes] = {};  // as the stations report their lives
   Node mNodes[kNodes];
   Object mObjects[kSlots];
   std::vector<Frame> mFrames;
@@ -659,24 +609,13 @@ private:
   Tarn::Broadcaster mB0;  // last: its listeners are gone before it
 };
 
-inline Probe::~Probe() {
-  if (sHarness != nullptr) sHarness->OnDestroyed(mSlot);
+inline void Called(int inSlot) { sHarness->OnCall(inSlot); }
+inline void Destroyed(int inSlot) {
+  if (sHarness != nullptr) sHarness->OnDestroyed(inSlot);
 }
-inline void Probe::ListenToMessage(const Tarn::Message&) { sHarness->OnCall(mSlot); }
-inline SafeProbe::~SafeProbe() {
-  if (sHarness != nullptr) sHarness->OnDestroyed(mSlot);
+inline void StationLife(int inNode, Tarn::Station* inStation) {
+  if (inNode >= 0 && sHarness != nullptr) sHarness->OnStation(inNode, inStation);
 }
-inline void SafeProbe::ListenToMessage(const Tarn::Message&) { sHarness->OnCall(mSlot); }
-inline TrackedStation::TrackedStation(const ImmutableString& inStationID, int inNode)
-    : Tarn::Station(inStationID), mNode(inNode) {
-  ++sLiveStations;
-  if (mNode >= 0) sHarness->OnStation(mNode, this);
-}
-inline TrackedStation::~TrackedStation() {
-  --sLiveStations;
-  if (mNode >= 0 && sHarness != nullptr) sHarness->OnStation(mNode, nullptr);
-}
-
 inline Tarn::Station* MakeTracked(const ImmutableString& inStationID) { return sHarness->Factory(inStationID); }
 
 inline std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse; }
@@ -697,9 +636,7 @@ inline std::string RunSequence(Choices& ioChoices, int inSteps) {
 // For RunConcurrent: a call after the listener's removal returned is a fault.
 class Watcher : public Tarn::Listener {
 public:
-  void ListenToMessage(const Tarn::Message&) override {
-    if (mRemoved) ++sLateCalls;
-  }
+  void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0; }
   std::atomic<bool> mRemoved{false};
   static inline std::atomic<int> sLateCalls{0};
 };
@@ -712,7 +649,6 @@ public:
 inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
   const std::size_t baseline = BlocksInUse();
   const int lateCalls = Watcher::sLateCalls;
-  std::string failure;
   Tarn::Messaging::Initialize();
   {
     Tarn::Broadcaster parent;
@@ -724,11 +660,9 @@ inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
         Registry::RegisterStation(id, &MakeCounted);
         parent.AddListener(Registry::RetainStation(id));
         auto watcher = std::make_unique<Watcher>();
-        Utils::AddListener(id, watcher.get());
-        Utils::AddListener(Tarn::kStation_StatusBar, watcher.get());
+        for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::AddListener(*station, watcher.get());
         if (random() % 2 == 0) {
-          Utils::RemoveListener(id, watcher.get());
-          Utils::RemoveListener(Tarn::kStation_StatusBar, watcher.get());
+          for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::RemoveListener(*station, watcher.get());
           watcher->mRemoved = true;
         }
         if (random() % 2 == 0) watcher.reset();  // destroyed while attached, or once removed
@@ -741,26 +675,17 @@ inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
     for (int round = 0; !done; ++round) {
       parent.BroadcastMessage(Ping());
       Utils::BroadcastMessage(Tarn::kStation_StatusBar, Ping());
-      Utils::FlushPostedMessagesOnUIThread();
-      Registry::DisposeStation(Registry::RegisterUniqueStation());
-      if (round % 16 == 0) {
-        Registry::DisposeStation(Tarn::kStation_StatusBar);
-        Registry::RegisterStation(Tarn::kStation_StatusBar, nullptr);
-      }
-      if (std::chrono::steady_clock::now() > deadline) {
-        std::fprintf(stderr, "operations harness: the worker did not finish (deadlock)\n");
-        std::abort();
-      }
+      Drain();
+      if (round % 16 == 0) Registry::DisposeStation(Tarn::kStation_StatusBar), Registry::RegisterStation(Tarn::kStation_StatusBar, nullptr);
+      if (std::chrono::steady_clock::now() > deadline) std::fprintf(stderr, "operations harness: the worker hangs\n"), std::abort();
     }
     worker.get();
-    Utils::FlushPostedMessagesOnUIThread();
-    Registry::DisposeStation(Registry::RegisterUniqueStation());
+    Drain();
   }
   Tarn::Messaging::Terminate();
-  if (Watcher::sLateCalls != lateCalls) failure = "a listener was called after its removal returned";
-  else if (sLiveStations != 0) failure = "stations outlived Terminate";
-  else if (BlocksInUse() != baseline) failure = "small blocks leaked";
-  return failure;
+  if (Watcher::sLateCalls != lateCalls) return "a listener was called after its removal returned";
+  if (sLiveStations != 0) return "stations outlived Terminate";
+  return BlocksInUse() != baseline ? "small blocks leaked" : "";
 }
 
 }  // namespace operations_harness

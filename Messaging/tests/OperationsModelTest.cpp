@@ -18,11 +18,15 @@ using messaging_test::kSanitizedBuild;
 
 class SeededChoices : public operations_harness::Choices {
 public:
-  explicit SeededChoices(std::uint64_t inSeed) : mRandom(inSeed) {}
+  explicit SeededChoices(std::uint64_t inSeed) : mSeed(inSeed), mRandom(inSeed) {}
   std::uint32_t Below(std::uint32_t inBound) override { return mRandom.Below(inBound); }
   bool Exhausted() override { return false; }
+  std::string Replay() override {
+    return "seed " + std::to_string(mSeed) + ": TARN_TEST_SEED=" + std::to_string(mSeed) + " TARN_TEST_SEQUENCES=1 replays it";
+  }
 
 private:
+  const std::uint64_t mSeed;
   messaging_test::Random mRandom;
 };
 
@@ -37,14 +41,14 @@ TEST(OperationsModelTest, SeededSequencesAgreeWithTheModel) {
   for (std::uint64_t seed = first; seed < first + sequences; ++seed) {
     SeededChoices choices(seed);
     const std::string failure = operations_harness::RunSequence(choices, 20 + static_cast<int>(seed % 41));
-    ASSERT_EQ(failure, "") << "seed " << seed << ": TARN_TEST_SEED=" << seed << " TARN_TEST_SEQUENCES=1 replays it";
+    ASSERT_EQ(failure, "") << choices.Replay();
   }
 }
 
 TEST(OperationsModelTest, StationsAndListenersTornDownOnAWorkerWhileTheMainThreadBroadcasts) {
   tarn_test::Watchdog watchdog(std::chrono::seconds(100));
   const auto seed = static_cast<std::uint32_t>(EnvironmentNumber("TARN_TEST_SEED", 0x5eed0000));
-  EXPECT_EQ(operations_harness::RunConcurrent(static_cast<int>(Volume(4000)), seed), "");
+  EXPECT_EQ(operations_harness::RunConcurrent(static_cast<int>(Volume(30000)), seed), "");
 }
 
 }  // namespace
