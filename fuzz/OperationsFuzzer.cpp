@@ -17,25 +17,19 @@ namespace {
 
 class FuzzChoices : public operations_harness::Choices {
 public:
-  explicit FuzzChoices(FuzzedDataProvider& ioInput) : mInput(ioInput) {}
-  std::uint32_t Below(std::uint32_t inBound) override {
-    return mInput.ConsumeIntegralInRange<std::uint32_t>(0, inBound - 1);
-  }
+  explicit FuzzChoices(const std::uint8_t* inData, std::size_t inSize) : mInput(inData, inSize) {}
+  std::uint32_t Below(std::uint32_t inBound) override { return mInput.ConsumeIntegralInRange<std::uint32_t>(0, inBound - 1); }
   bool Exhausted() override { return mInput.remaining_bytes() == 0; }
 
 private:
-  FuzzedDataProvider& mInput;
+  FuzzedDataProvider mInput;
 };
 
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* inData, std::size_t inSize) {
-  FuzzedDataProvider input(inData, inSize);
-  FuzzChoices choices(input);
+  FuzzChoices choices(inData, inSize);
   const std::string failure = operations_harness::RunSequence(choices, 400);
-  if (!failure.empty()) {
-    std::fprintf(stderr, "tarn_fuzz_operations: %s\n", failure.c_str());
-    std::abort();
-  }
+  if (!failure.empty()) std::fprintf(stderr, "tarn_fuzz_operations: %s\n", failure.c_str()), std::abort();
   return 0;
 }

@@ -46,7 +46,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <chrono>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -54,7 +53,6 @@
 #include <memory>
 #include <random>
 #include <string>
-#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -70,20 +68,14 @@ public:
   virtual std::uint32_t Below(std::uint32_t inBound) = 0;  // in [0, inBound); inBound > 0
   virtual bool Exhausted() = 0;
   virtual std::string Replay() { return std::string(); }  // how to run this sequence again
-
-protected:
-  ~Choices() = default;
 };
 
 struct Ping : Tarn::MessageImpl<Ping> {};
 
-constexpr int kSlots = 5;
-constexpr int kNodes = 5;
-constexpr int kIdle = 4;
-constexpr int kTimer = kSlots + kNodes;  // entry.mWho of the timer; kSlots + n: station n as a relay
-constexpr int kGone = -1;                // entry.mWho of a weak or safe entry whose object died before a slot was reused
-constexpr int kMaxLevels = 3;
-constexpr int kMaxHandlerActions = 200;
+constexpr int kSlots = 5, kNodes = 5, kIdle = 4, kMaxLevels = 3, kMaxHandlerActions = 200;
+// Entry.mWho of the timer, and of a weak or safe entry whose object died before its slot was reused; kSlots + n:
+// station n as a relay.
+constexpr int kTimer = kSlots + kNodes, kGone = -1;
 enum Way { kPlain, kBoost, kStd, kSafe };
 
 class Harness;
@@ -108,21 +100,14 @@ using PlainProbe = Probe<Tarn::Listener>;
 class TrackedStation : public Tarn::Station {
 public:
   TrackedStation(const ImmutableString& inStationID, int inNode) : Tarn::Station(inStationID), mNode(inNode) {
-    ++sLiveStations;
-    StationLife(mNode, this);
+    ++sLiveStations, StationLife(mNode, this);
   }
-  ~TrackedStation() override {
-    --sLiveStations;
-    StationLife(mNode, nullptr);
-  }
+  ~TrackedStation() override { --sLiveStations, StationLife(mNode, nullptr); }
   const int mNode;
 };
 
 // What a main thread does for workers: runs their posted calls, deletes the stations they disposed of.
-inline void Drain() {
-  Utils::FlushPostedMessagesOnUIThread();
-  Registry::DisposeStation(Registry::RegisterUniqueStation());
-}
+inline void Drain() { Utils::FlushPostedMessagesOnUIThread(), Registry::DisposeStation(Registry::RegisterUniqueStation()); }
 
 inline Tarn::Station* MakeCounted(const ImmutableString& inStationID) { return new TrackedStation(inStationID, -1); }
 Tarn::Station* MakeTracked(const ImmutableString& inStationID);
@@ -134,10 +119,11 @@ struct Entry {
 struct Node {
   std::vector<Entry> mEntries;
   bool mBroadcasting = true, mRegistered = false, mDisposeRequested = false;
-  bool mMade = false;    // the station object lives (node 0: always)
-  bool mDoomed = false;  // no longer registered; deleted once no broadcast on it runs
-  int mRetains = 0, mHeld = 0;  // mHeld: the retains the harness took and will release
-  int mFrames = 0;              // broadcasts on it in progress
+  // mMade: the station object lives (node 0: always); mDoomed: no longer registered, and deleted once no broadcast
+  // on it runs.
+  bool mMade = false, mDoomed = false;
+  // mHeld: the retains the harness took and will release; mFrames: broadcasts on it in progress.
+  int mRetains = 0, mHeld = 0, mFrames = 0;
 };
 
 struct Object {
@@ -169,8 +155,6 @@ public:
     Initialize();
     for (int node = 1; node < kIdle; ++node) mIDs[node] = Registry::UniqueStationID(), RegistryOp(node, 0, false);
   }
-  Harness(const Harness&) = delete;
-  Harness& operator=(const Harness&) = delete;
   ~Harness() {
     kivcore::config::SetErrorHandler(std::move(mPreviousErrors));
     kivcore::config::ErrorManager::SetExceptionHandler(std::move(mPreviousExceptions));
@@ -255,10 +239,8 @@ private:
   void OnThread(bool inHelper, Call inCall) {
     if (!inHelper) return inCall();
     auto done = std::async(std::launch::async, inCall);
-    if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
-      std::fprintf(stderr, "operations harness: a helper operation did not return (deadlock)%s\n", mTrace.c_str());
-      std::abort();
-    }
+    if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready)
+      std::fprintf(stderr, "operations harness: a helper operation hangs%s\n", mTrace.c_str()), std::abort();
     done.get();
   }
 
@@ -283,8 +265,7 @@ private:
     Object& object = mObjects[inSlot];
     if (object.mAlive) return;
     for (Node& node : mNodes)
-      for (Entry& entry : node.mEntries)
-        if (entry.mWho == inSlot) entry.mWho = kGone;
+      for (Entry& entry : node.mEntries) entry.mWho = entry.mWho == inSlot ? kGone : entry.mWho;
     object = Object();
     object.mKind = Pick(4);
     object.mOwned = object.mAlive = true;
@@ -365,8 +346,7 @@ private:
     if (retained) ++mNodes[inNode].mRetains;
     mLevels.push_back(Level{mFrames.size(), retained ? inNode : 0});
     if (mMain && (inNode == 0 || retained) && mNodes[inNode].mBroadcasting) Push(inNode);
-    const bool stale = mStale;
-    mStale = true;
+    const bool stale = std::exchange(mStale, true);
     if (inNode == 0) mB0.BroadcastMessage(Ping());
     else if (inNode == kIdle) Utils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
     else Utils::BroadcastMessage(mIDs[inNode], Ping());
@@ -393,7 +373,6 @@ private:
     if (inNode == 0 || inNode == kIdle || !mMain) return;
     Node& node = mNodes[inNode];
     const ImmutableString& id = mIDs[inNode];
-    Tarn::Station* expected = nullptr;
     Tarn::Station* got = nullptr;
     if (inOp == 0) {  // an ID is registered again only once its last station is gone
       if (node.mRegistered || node.mMade) return;
@@ -423,15 +402,13 @@ private:
         default: return Registry::DisposeStation(id);
       }
     });
-    if (inOp == 1 || inOp == 2) expected = node.mRegistered ? mStations[inNode] : nullptr;
-    if (got != expected) Fail("the registry returned another station");
+    if (got != ((inOp == 1 || inOp == 2) && node.mRegistered ? mStations[inNode] : nullptr)) Fail("the registry returned another station");
     if (inHelper) Drain();
     Settle();
   }
 
   void TimerOp(int inChoice) {
-    if (!mMain) return;
-    if (inChoice == 0) return Terminate();
+    if (!mMain || inChoice == 0) return mMain ? Terminate() : void();
     if (!mTimer) {
       Note(" timer"), mTimer = std::make_unique<Tarn::IdleCountdownTimer>();
     } else if (inChoice < 5) {
@@ -494,10 +471,8 @@ private:
   // The object's plain registrations go with it; weak and safe ones stay until a broadcast prunes them.
   void Die(int inSlot) {
     mObjects[inSlot].mAlive = false;
-    for (int node = 0; node < kNodes; ++node) {
-      mObjects[inSlot].mLinks[node] = 0;
-      Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && inEntry.mWay == kPlain; });
-    }
+    for (int node = 0; node < kNodes; ++node)
+      mObjects[inSlot].mLinks[node] = 0, Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && inEntry.mWay == kPlain; });
   }
 
   void Doom(int inNode) {
@@ -525,10 +500,8 @@ private:
   int Next() {
     while (mFrames.size() > mLevels.back().mBase) {
       Frame& frame = mFrames.back();
-      if (frame.mWho >= 0 && frame.mWay != kPlain) {
-        Object& held = mObjects[frame.mWho];
-        if (--held.mHolds == 0 && !held.mOwned && held.mAlive) Die(frame.mWho);
-      }
+      Object& held = mObjects[std::max(frame.mWho, 0)];
+      if (frame.mWho >= 0 && frame.mWay != kPlain && --held.mHolds == 0 && !held.mOwned && held.mAlive) Die(frame.mWho);
       frame.mWho = -1;
       std::vector<Entry>& entries = mNodes[frame.mNode].mEntries;
       auto next = entries.end();
@@ -578,9 +551,8 @@ private:
       if (object.mKind >= 0 && object.mDestroyed == object.mAlive) Fail("slot " + std::to_string(slot) + " lives against the model");
       for (int node = 0; node < kNodes && object.mOwned && object.mListener != nullptr; ++node) {
         Tarn::Broadcaster* broadcaster = node == 0 ? &mB0 : mStations[node];
-        if (broadcaster == nullptr) continue;
-        if (broadcaster->HasListener(object.mListener) != HasEntry(node, slot, kPlain) ||
-            object.mListener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0))
+        if (broadcaster != nullptr && (broadcaster->HasListener(object.mListener) != HasEntry(node, slot, kPlain) ||
+                                       object.mListener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0)))
           Fail("registration or back-link of slot " + std::to_string(slot) + " at " + std::to_string(node));
       }
     }
@@ -595,24 +567,19 @@ private:
   Node mNodes[kNodes];
   Object mObjects[kSlots];
   std::vector<Frame> mFrames;
-  struct Level {
-    std::size_t mBase;  // its first frame
-    int mRetained;      // the station the utilities retained for it, until they release it; 0: none
-  };
+  // Per broadcast begun by the harness: its first frame, and the station the utilities retained for it until they
+  // release it (0: none).
+  struct Level { std::size_t mBase; int mRetained; };
   std::vector<Level> mLevels;  // per broadcast begun by the harness
   bool mStale = false;         // the library runs the innermost broadcast past the last call the model walked to
-  int mToken = 1;
-  int mHandlerActions = 0;
-  bool mMain = true;  // the library is initialized (this thread is its main thread)
-  bool mTimerListening = false;
+  int mToken = 1, mHandlerActions = 0;
+  bool mMain = true, mTimerListening = false;  // mMain: the library is initialized (this thread is its main thread)
   std::unique_ptr<Tarn::IdleCountdownTimer> mTimer;
   Tarn::Broadcaster mB0;  // last: its listeners are gone before it
 };
 
 inline void Called(int inSlot) { sHarness->OnCall(inSlot); }
-inline void Destroyed(int inSlot) {
-  if (sHarness != nullptr) sHarness->OnDestroyed(inSlot);
-}
+inline void Destroyed(int inSlot) { sHarness != nullptr ? sHarness->OnDestroyed(inSlot) : void(); }
 inline void StationLife(int inNode, Tarn::Station* inStation) {
   if (inNode >= 0 && sHarness != nullptr) sHarness->OnStation(inNode, inStation);
 }
@@ -623,14 +590,12 @@ inline std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator:
 // One sequence of at most inSteps operations; returns the failure, or an empty string.
 inline std::string RunSequence(Choices& ioChoices, int inSteps) {
   const std::size_t baseline = BlocksInUse();
-  std::string failure;
-  {
+  const std::string failure = [&] {
     Harness harness(ioChoices);
     harness.Run(inSteps);
-    failure = harness.Finish();
-  }
-  if (failure.empty() && BlocksInUse() != baseline) failure = "small blocks leaked";
-  return failure;
+    return harness.Finish();
+  }();
+  return failure.empty() && BlocksInUse() != baseline ? "small blocks leaked" : failure;
 }
 
 // For RunConcurrent: a call after the listener's removal returned is a fault.
