@@ -13,9 +13,9 @@
 
 namespace {
 
-// Sanitized builds run a fifth of the volume: each operation costs twenty to fifty times as much there.
+// Sanitized builds run a quarter of the volume: each operation costs twenty to fifty times as much there.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr std::uint64_t kShare = 5;
+constexpr std::uint64_t kShare = 4;
 #else
 constexpr std::uint64_t kShare = 1;
 #endif
@@ -39,7 +39,7 @@ std::uint64_t Volume(std::uint64_t inNormal) {
 TEST(OperationsModelTest, SeededSequencesAgreeWithTheModel) {
   tarn_test::Watchdog watchdog(std::chrono::seconds(100));
   const std::uint64_t first = messaging_test::EnvironmentNumber("TARN_TEST_SEED", 0x5eed0000);
-  const std::uint64_t sequences = messaging_test::EnvironmentNumber("TARN_TEST_SEQUENCES", Volume(3000));
+  const std::uint64_t sequences = messaging_test::EnvironmentNumber("TARN_TEST_SEQUENCES", Volume(10000));
   for (std::uint64_t seed = first; seed < first + sequences; ++seed) {
     SeededChoices choices(seed);
     const std::string failure = operations_harness::RunSequence(choices, 20 + static_cast<int>(seed % 41));
