@@ -246,7 +246,8 @@ private:
 
   // One operation, from the top (inLevel 0) or from a handler.
   void Act(int inLevel) {
-    const int slot = Pick(kSlots), node = Pick(kNodes), op = Pick(13), choice = Pick(8);
+    // Low slots come more often, so that operations meet on the same listener.
+    const int slot = std::min(Pick(kSlots), Pick(kSlots)), node = Pick(kNodes), op = Pick(13), choice = Pick(8);
     const bool helper = mMain && Pick(4) == 0;
     switch (op) {
       case 0: return Create(slot);
