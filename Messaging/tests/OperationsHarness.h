@@ -63,8 +63,7 @@ namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
 
 // Where the harness's choices come from.
-class Choices {
-public:
+struct Choices {
   virtual std::uint32_t Below(std::uint32_t inBound) = 0;  // in [0, inBound); inBound > 0
   virtual bool Exhausted() = 0;
   virtual std::string Replay() { return std::string(); }  // how to run this sequence again
@@ -87,8 +86,7 @@ void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
 
 // A listener in slot mSlot, of either base: Tarn::Listener, or the safe listeners' base.
 template <class Base>
-class Probe : public Base {
-public:
+struct Probe : Base {
   explicit Probe(int inSlot) : mSlot(inSlot) {}
   ~Probe() override { Destroyed(mSlot); }
   void ListenToMessage(const Tarn::Message&) override { Called(mSlot); }
@@ -97,8 +95,7 @@ public:
 using PlainProbe = Probe<Tarn::Listener>;
 
 // Reports its life for node mNode (1-4); -1: counted only.
-class TrackedStation : public Tarn::Station {
-public:
+struct TrackedStation : Tarn::Station {
   TrackedStation(const ImmutableString& inStationID, int inNode) : Tarn::Station(inStationID), mNode(inNode) {
     ++sLiveStations, StationLife(mNode, this);
   }
@@ -184,8 +181,7 @@ public:
   void Fail(const std::string& inWhat) { mFailure += mFailure.empty() ? inWhat + "\noperations:" + mTrace : ""; }
   // The library goes on in freed memory after this: stop here, with the trace.
   [[noreturn]] void Fatal(const char* inWhat) {
-    Fail(inWhat);
-    std::fprintf(stderr, "operations harness: %s\n%s\n", mFailure.c_str(), mChoices.Replay().c_str());
+    Fail(inWhat), std::fprintf(stderr, "operations harness: %s\n%s\n", mFailure.c_str(), mChoices.Replay().c_str());
     std::abort();
   }
 
@@ -428,17 +424,14 @@ private:
     if (!mTimer) return;
     Note(" ~timer");
     if (std::exchange(mTimerListening, false)) Model(kIdle, kTimer, kPlain, false, true);
-    mTimer.reset();
-    Settle();
+    mTimer.reset(), Settle();
   }
 
   void Terminate() {
     DestroyTimer();
     Note(" terminate");
     for (int node = 1; node < kNodes; ++node) Doom(node);
-    mMain = false;
-    Tarn::Messaging::Terminate();
-    Settle();
+    mMain = false, Tarn::Messaging::Terminate(), Settle();
   }
 
   // --- the model
@@ -600,8 +593,7 @@ inline std::string RunSequence(Choices& ioChoices, int inSteps) {
 }
 
 // For RunConcurrent: a call after the listener's removal returned is a fault.
-class Watcher : public Tarn::Listener {
-public:
+struct Watcher : Tarn::Listener {
   void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0; }
   std::atomic<bool> mRemoved{false};
   static inline std::atomic<int> sLateCalls{0};
