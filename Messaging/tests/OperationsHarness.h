@@ -26,16 +26,20 @@
 // (lockstep), and after each step: every station's life, every plain
 // registration and back-link, every listener's life. A station must never be
 // deleted while a broadcast on it runs; one disposed of meanwhile goes when
-// that broadcast ends. After the final Terminate no station or listener may
-// remain and every small block must be back.
+// that broadcast ends, and one a worker let go is gone once the main thread
+// has run its posted calls and disposed of a registered station. After the
+// final Terminate no station or listener may remain and every small block
+// must be back. Any contract report is a failure: the harness makes no bad
+// calls.
 //
 // RunConcurrent is the same library under real concurrency: a worker makes,
 // relays and lets go of stations and listeners while the main thread
 // broadcasts through them; no call may follow a removal that returned.
 //
 // Threading: one sequence at a time, from the thread that is to be the main
-// thread. A helper operation that does not return within 20 s (a deadlock)
-// stops the process with the trace.
+// thread. A helper operation that does not return within 20 s (a deadlock),
+// and a station deleted while a broadcast on it runs (the library would go on
+// in freed memory), stop the process at once with the trace.
 #pragma once
 
 #include <TarnMessaging.h>
