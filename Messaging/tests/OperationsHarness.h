@@ -1,0 +1,653 @@
+// One model of the library's operations over its public API, driven two
+// ways: on seeded random sequences by OperationsModelTest (ctest), and on
+// fuzzer bytes by fuzz/OperationsFuzzer.cpp (libFuzzer). Every choice comes
+// from a Choices object, so the same checks serve both drivers.
+//
+//   SeededChoices choices(seed);                       // or bytes from libFuzzer
+//   std::string failure = operations_harness::RunSequence(choices, 60);
+//   if (!failure.empty()) ...                          // what went wrong, and the operations that led there
+//
+// The world: a broadcaster of the harness's own (node 0), three registry
+// stations made by a factory that reports their lives (nodes 1-3), the idle
+// station (node 4), five listener slots of the four kinds (plain pointer,
+// boost::weak_ptr, std::weak_ptr, safe listener), an idle countdown timer.
+// Operations: listeners made, attached, detached, stopped and killed;
+// broadcasting stopped and started; broadcasts, also nested from handlers;
+// stations attached as relays to the broadcaster or to lower stations (chains,
+// never cycles); register, retain, find, release and dispose; timers made,
+// armed and destroyed; the library terminated (and initialized again when the
+// step ends). Handlers run operations too, and some operations run on a
+// helper thread while the main thread waits (inside a handler as well).
+//
+// The model numbers every registration; a running broadcast serves the newest
+// entry older than the one it served last and never one added after it
+// began. Relays are broadcasts of their own inside the delivery to the
+// station. Each listener call is checked against the model when it happens
+// (lockstep), and after each step: every station's life, every plain
+// registration and back-link, every listener's life. A station must never be
+// deleted while a broadcast on it runs; one disposed of meanwhile goes when
+// that broadcast ends, and one a worker let go is gone once the main thread
+// has run its posted calls and disposed of a registered station. After the
+// final Terminate no station or listener may remain and every small block
+// must be back. Any contract report is a failure: the harness makes no bad
+// calls.
+//
+// RunConcurrent is the same library under real concurrency: a worker makes,
+// relays and lets go of stations and listeners while the main thread
+// broadcasts through them; no call may follow a removal that returned.
+//
+// Threading: one sequence at a time, from the thread that is to be the main
+// thread. A helper operation that does not return within 20 s (a deadlock),
+// and a station deleted while a broadcast on it runs (the library would go on
+// in freed memory), stop the process at once with the trace.
+#pragma once
+
+#include <TarnMessaging.h>
+
+#include <kivcore/kivcore.h>
+
+#include <boost/make_shared.hpp>
+
+#include <algorithm>
+#include <atomic>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <future>
+#include <memory>
+#include <random>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace operations_harness {
+
+using kivcore::utility::ImmutableString;
+namespace Registry = Tarn::StationRegistry;
+namespace Utils = Tarn::StationUtils;
+
+// Where the harness's choices come from.
+struct Choices {
+  virtual std::uint32_t Below(std::uint32_t inBound) = 0;  // in [0, inBound); inBound > 0
+  virtual bool Exhausted() = 0;
+  virtual std::string Replay() { return std::string(); }  // how to run this sequence again
+};
+
+struct Ping : Tarn::MessageImpl<Ping> {};
+
+constexpr int kSlots = 5, kNodes = 5, kIdle = 4, kMaxLevels = 3, kMaxHandlerActions = 200;
+// Entry.mWho of the timer, and of a weak or safe entry whose object died before its slot was reused; kSlots + n:
+// station n as a relay.
+constexpr int kTimer = kSlots + kNodes, kGone = -1;
+enum Way { kPlain, kBoost, kStd, kSafe };
+
+class Harness;
+inline Harness* sHarness = nullptr;
+inline std::atomic<int> sLiveStations{0};
+void Called(int inSlot);
+void Destroyed(int inSlot);
+void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
+
+// A listener in slot mSlot, of either base: Tarn::Listener, or the safe listeners' base.
+template <class Base>
+struct Probe : Base {
+  explicit Probe(int inSlot) : mSlot(inSlot) {}
+  ~Probe() override { Destroyed(mSlot); }
+  void ListenToMessage(const Tarn::Message&) override { Called(mSlot); }
+  const int mSlot;
+};
+using PlainProbe = Probe<Tarn::Listener>;
+
+// Reports its life for node mNode (1-4); -1: counted only.
+struct TrackedStation : Tarn::Station {
+  TrackedStation(const ImmutableString& inStationID, int inNode) : Tarn::Station(inStationID), mNode(inNode) {
+    ++sLiveStations, StationLife(mNode, this);
+  }
+  ~TrackedStation() override { --sLiveStations, StationLife(mNode, nullptr); }
+  const int mNode;
+};
+
+// What a main thread does for workers: runs their posted calls, deletes the stations they disposed of.
+inline void Drain() { Utils::FlushPostedMessagesOnUIThread(), Registry::DisposeStation(Registry::RegisterUniqueStation()); }
+
+inline Tarn::Station* MakeCounted(const ImmutableString& inStationID) { return new TrackedStation(inStationID, -1); }
+Tarn::Station* MakeTracked(const ImmutableString& inStationID);
+
+struct Entry {
+  int mToken, mWho, mWay;  // mToken: larger = newer; mWho: a slot, kSlots + a station relaying, kTimer or kGone
+};
+
+struct Node {
+  std::vector<Entry> mEntries;
+  bool mBroadcasting = true, mRegistered = false, mDisposeRequested = false;
+  // mMade: the station object lives (node 0: always); mDoomed: no longer registered, and deleted once no broadcast
+  // on it runs.
+  bool mMade = false, mDoomed = false;
+  // mHeld: the retains the harness took and will release; mFrames: broadcasts on it in progress.
+  int mRetains = 0, mHeld = 0, mFrames = 0;
+};
+
+struct Object {
+  int mKind = -1;  // a Way; -1: never made
+  bool mOwned = false, mAlive = false, mListening = true, mDestroyed = false;
+  int mHolds = 0;           // weak or safe deliveries in progress, each keeping it alive
+  int mLinks[kNodes] = {};  // back-link records the listener holds, per node
+  std::unique_ptr<PlainProbe> mPlain;
+  boost::shared_ptr<PlainProbe> mBoost;
+  std::shared_ptr<PlainProbe> mStd;
+  Tarn::ISafeListenerRef mSafe;
+  Tarn::Listener* mListener = nullptr;  // while owned; null for safe listeners
+};
+
+struct Frame {
+  int mNode, mLast;            // mLast: token served last (at first: the first it must not serve)
+  int mWho = -1, mWay = kPlain;  // the slot being delivered to, or -1
+};
+
+class Harness {
+public:
+  explicit Harness(Choices& ioChoices) : mChoices(ioChoices) {
+    sHarness = this;
+    mPreviousErrors = kivcore::config::SetErrorHandler(
+        [](const kivcore::config::ErrorReport& inReport) { sHarness->Fail("contract report: " + inReport.key); });
+    mPreviousExceptions = kivcore::config::ErrorManager::SetExceptionHandler(
+        [](std::exception_ptr) { sHarness->Fail("an exception left a handler"); });
+    mIDs[kIdle] = Tarn::kStation_Idle;
+    Initialize();
+    for (int node = 1; node < kIdle; ++node) mIDs[node] = Registry::UniqueStationID(), RegistryOp(node, 0, false);
+  }
+  ~Harness() {
+    kivcore::config::SetErrorHandler(std::move(mPreviousErrors));
+    kivcore::config::ErrorManager::SetExceptionHandler(std::move(mPreviousExceptions));
+    sHarness = nullptr;
+  }
+
+  void Run(int inSteps) {
+    for (int step = 0; step < inSteps && mFailure.empty() && !mChoices.Exhausted(); ++step) {
+      Note("\n%d:", step);
+      Act(0);
+      if (!mMain) Initialize();
+      Compare();
+    }
+  }
+
+  // Lets everything go, terminates the library, and returns the first
+  // failure with the operations that led to it (empty: none).
+  std::string Finish() {
+    Note("\nfinish:");
+    for (int slot = 0; slot < kSlots; ++slot) Kill(slot, false);
+    Terminate();
+    Compare();
+    if (sLiveStations != 0) Fail("stations outlived Terminate");
+    return mFailure;
+  }
+
+  void Fail(const std::string& inWhat) { mFailure += mFailure.empty() ? inWhat + "\noperations:" + mTrace : ""; }
+  // The library goes on in freed memory after this: stop here, with the trace.
+  [[noreturn]] void Fatal(const char* inWhat) {
+    Fail(inWhat), std::fprintf(stderr, "operations harness: %s\n%s\n", mFailure.c_str(), mChoices.Replay().c_str());
+    std::abort();
+  }
+
+  // A probe was called: the model must name it, then its handler acts.
+  void OnCall(int inSlot) {
+    if (!mFailure.empty()) return;
+    const int expected = mLevels.empty() ? -1 : Next();
+    if (expected != inSlot) return Fail("slot " + std::to_string(inSlot) + " called; the model expects " + std::to_string(expected));
+    Note(" [%d]", inSlot);
+    mStale = false;
+    const int actions = Pick(5) < 3 || mHandlerActions >= kMaxHandlerActions ? 0 : 1 + Pick(2);
+    for (int action = 0; action < actions && mFailure.empty(); ++action, ++mHandlerActions) Act(static_cast<int>(mLevels.size()));
+    mStale = true;
+  }
+  void OnDestroyed(int inSlot) { mObjects[inSlot].mDestroyed = true; }
+  void OnStation(int inNode, Tarn::Station* inStation) {
+    const Node& node = mNodes[inNode];
+    // Inside the library, after the last handler it called, the model has yet to walk the rest of the innermost
+    // broadcast (and the utilities' release at its end): a station may go only if nobody else is to be called.
+    if (inStation == nullptr && mStale && mFailure.empty() && Next() >= 0)
+      Fatal("a station was deleted while a broadcast on it runs");
+    if (inStation != nullptr && mStations[inNode] != nullptr) Fail("two stations of one ID alive");
+    if (inStation == nullptr && node.mFrames > 0) Fatal("a station was deleted while a broadcast on it runs");
+    if (inStation == nullptr && node.mMade && !node.mDoomed) Fail("a station was deleted that the registry should keep");
+    mStations[inNode] = inStation;
+  }
+  Tarn::Station* Factory(const ImmutableString& inStationID) {
+    const int node = static_cast<int>(std::find(mIDs + 1, mIDs + kNodes, inStationID) - mIDs);
+    return node < kNodes ? new TrackedStation(inStationID, node) : nullptr;
+  }
+
+private:
+  int Pick(int inBound) { return static_cast<int>(mChoices.Below(static_cast<std::uint32_t>(inBound))); }
+  template <class... Args>
+  void Note(const char* inFormat, Args... inArgs) {
+    char text[48];
+    std::snprintf(text, sizeof text, inFormat, inArgs..., 0);  // the 0 keeps every call's arguments non-empty
+    mTrace += text;
+  }
+
+  // The idle station is registered first, with the factory that reports station lives; the library's own
+  // registration of it then changes nothing.
+  void Initialize() {
+    Registry::RegisterStation(Tarn::kStation_Idle, &MakeTracked);
+    Tarn::Messaging::Initialize();
+    mMain = mNodes[kIdle].mRegistered = true;
+  }
+
+  // Runs inCall on a helper thread while this thread waits, or here.
+  template <class Call>
+  void OnThread(bool inHelper, Call inCall) {
+    if (!inHelper) return inCall();
+    auto done = std::async(std::launch::async, inCall);
+    if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready)
+      std::fprintf(stderr, "operations harness: a helper operation hangs%s\n", mTrace.c_str()), std::abort();
+    done.get();
+  }
+
+  // One operation, from the top (inLevel 0) or from a handler.
+  void Act(int inLevel) {
+    // Low slots come more often, so that operations meet on the same listener.
+    const int slot = std::min(Pick(kSlots), Pick(kSlots)), node = Pick(kNodes), op = Pick(13), choice = Pick(8);
+    const bool helper = mMain && Pick(4) == 0;
+    switch (op) {
+      case 0: return Create(slot);
+      case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
+      case 4: return Kill(slot, helper);
+      case 5: return Listen(slot, choice < 5);
+      case 6: return SetBroadcasting(node, choice < 5);
+      case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
+      case 9: return Relay(node, choice % kIdle, choice < 5);
+      case 10: case 11: return RegistryOp(node, choice % 5, helper);
+      default: return TimerOp(choice);
+    }
+  }
+
+  void Create(int inSlot) {
+    Object& object = mObjects[inSlot];
+    if (object.mAlive) return;
+    for (Node& node : mNodes)
+      for (Entry& entry : node.mEntries) entry.mWho = entry.mWho == inSlot ? kGone : entry.mWho;
+    object = Object();
+    object.mKind = Pick(4);
+    object.mOwned = object.mAlive = true;
+    Note(" new%d.%d", inSlot, object.mKind);
+    switch (object.mKind) {
+      case kPlain: object.mListener = (object.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
+      case kBoost: object.mListener = (object.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
+      case kStd: object.mListener = (object.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
+      default: object.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot));
+    }
+  }
+
+  void AddOrRemove(int inSlot, int inNode, bool inAdd, int inChoice, bool inHelper) {
+    Object& object = mObjects[inSlot];
+    if (!object.mOwned) return;
+    // Objects owned by a shared pointer are sometimes registered by plain pointer: a second entry.
+    const int way = (object.mKind == kBoost || object.mKind == kStd) && inChoice < 3 ? kPlain : object.mKind;
+    // A worker's removal of a listener the main thread is delivering to waits for that delivery, and here the
+    // main thread waits for the worker.
+    if (!inAdd && inHelper && Delivering(inSlot, way)) return;
+    // Only the harness's broadcaster, which never dies, is left a back-link by a removal that does not unlink.
+    const bool unlink = inNode != 0 || inChoice < 6;
+    Note(inAdd ? " add%d.%d@%d" : " rm%d.%d@%d", inSlot, way, inNode);
+    Note(unlink ? "%s" : "(keep link)%s", inHelper ? "h" : "");
+    Model(inNode, inSlot, way, inAdd, unlink);
+    OnThread(inHelper, [&] {
+      WithListener(object, way, [&](const auto& inListener) { Call(inNode, inAdd, unlink, inListener); });
+    });
+  }
+
+  template <class Use>
+  static void WithListener(Object& ioObject, int inWay, Use inUse) {
+    switch (inWay) {
+      case kPlain: return inUse(ioObject.mListener);
+      case kBoost: return inUse(boost::weak_ptr<Tarn::Listener>(ioObject.mBoost));
+      case kStd: return inUse(std::weak_ptr<Tarn::Listener>(ioObject.mStd));
+      default: return inUse(ioObject.mSafe);
+    }
+  }
+
+  template <class L>
+  void Call(int inNode, bool inAdd, bool inUnlink, const L& inListener) {
+    if (inAdd) return inNode == 0 ? mB0.AddListener(inListener) : Utils::AddListener(mIDs[inNode], inListener);
+    if (inNode != 0) return Utils::RemoveListener(mIDs[inNode], inListener);
+    if constexpr (std::is_same_v<L, Tarn::Listener*>) mB0.RemoveListener(inListener, inUnlink);
+    else mB0.RemoveListener(inListener);
+  }
+
+  void Kill(int inSlot, bool inHelper) {
+    Object& object = mObjects[inSlot];
+    // Destroying a listener while a plain delivery to it runs is the owner's fault, not the library's.
+    if (!object.mOwned || Delivering(inSlot, kPlain)) return;
+    Note(inHelper ? " kill%dh" : " kill%d", inSlot);
+    object.mOwned = false;
+    if (object.mHolds == 0) Die(inSlot);
+    OnThread(inHelper, [&] { object.mPlain.reset(), object.mBoost.reset(), object.mStd.reset(), object.mSafe = nullptr; });
+  }
+
+  void Listen(int inSlot, bool inOn) {
+    Object& object = mObjects[inSlot];
+    if (!object.mOwned || object.mListener == nullptr) return;
+    Note(inOn ? " listen%d" : " deaf%d", inSlot);
+    object.mListening = inOn;
+    inOn ? object.mListener->StartListening() : object.mListener->StopListening();
+  }
+
+  void SetBroadcasting(int inNode, bool inOn) {
+    Note(inOn ? " start@%d" : " stop@%d", inNode);
+    if (Reach(inNode)) mNodes[inNode].mBroadcasting = inOn;
+    if (inNode == 0) return inOn ? mB0.StartBroadcasting() : mB0.StopBroadcasting();
+    inOn ? Utils::StartBroadcasting(mIDs[inNode]) : Utils::StopBroadcasting(mIDs[inNode]);
+  }
+
+  void Broadcast(int inNode) {
+    Note(" bc@%d{", inNode);
+    // The utilities retain the station for the length of the broadcast.
+    const bool retained = inNode != 0 && Reach(inNode);
+    if (retained) ++mNodes[inNode].mRetains;
+    mLevels.push_back(Level{mFrames.size(), retained ? inNode : 0});
+    if (mMain && (inNode == 0 || retained) && mNodes[inNode].mBroadcasting) Push(inNode);
+    const bool stale = std::exchange(mStale, true);
+    if (inNode == 0) mB0.BroadcastMessage(Ping());
+    else if (inNode == kIdle) Utils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
+    else Utils::BroadcastMessage(mIDs[inNode], Ping());
+    mStale = stale;
+    const int missed = mFailure.empty() ? Next() : -1;
+    if (missed >= 0) Fail("a broadcast ended without calling slot " + std::to_string(missed));
+    mLevels.pop_back();
+    Note("}%d", inNode);
+  }
+
+  // Station inNode (1-3) attached to or detached from inParent, a lower node: chains, no cycles.
+  void Relay(int inNode, int inParent, bool inAttach) {
+    if (inNode == 0 || inNode == kIdle || !mMain || !mNodes[inNode].mRegistered) return;
+    inParent %= inNode;
+    Note(inAttach ? " relay%d@%d" : " unrelay%d@%d", inNode, inParent);
+    Reach(inNode);
+    Tarn::Listener* station = Registry::FindStation(mIDs[inNode]);
+    if (station == nullptr || station != mStations[inNode]) return Fail("FindStation returned another station");
+    Model(inParent, kSlots + inNode, kPlain, inAttach, true);
+    Call(inParent, inAttach, true, station);
+  }
+
+  void RegistryOp(int inNode, int inOp, bool inHelper) {
+    if (inNode == 0 || inNode == kIdle || !mMain) return;
+    Node& node = mNodes[inNode];
+    const ImmutableString& id = mIDs[inNode];
+    Tarn::Station* got = nullptr;
+    if (inOp == 0) {  // an ID is registered again only once its last station is gone
+      if (node.mRegistered || node.mMade) return;
+      node.mRegistered = true;
+    } else if (inOp == 1 || inOp == 2) {
+      if (Reach(inNode) && inOp == 1) ++node.mRetains, ++node.mHeld;
+    } else if (inOp == 3) {
+      if (node.mHeld == 0) return;  // only what was retained is released
+      const bool last = node.mRetains == 1 && node.mDisposeRequested;
+      // A worker's last release deletes the station, which waits for the relay delivery the main thread is in.
+      if (last && inHelper && node.mFrames > 0) return;
+      --node.mHeld, --node.mRetains;
+      if (last) Doom(inNode);
+    } else if (node.mRegistered && node.mRetains > 0) {
+      node.mDisposeRequested = true;
+    } else if (node.mRegistered) {
+      Doom(inNode);
+    }
+    static const char* const kNames[] = {" register@%d", " retain@%d", " find@%d", " release@%d", " dispose@%d"};
+    Note(kNames[inOp], inNode), Note(inHelper ? "h" : "");
+    OnThread(inHelper, [&] {
+      switch (inOp) {
+        case 0: return Registry::RegisterStation(id, &MakeTracked);
+        case 1: got = Registry::RetainStation(id); return;
+        case 2: got = Registry::FindStation(id); return;
+        case 3: return Registry::ReleaseStation(id);
+        default: return Registry::DisposeStation(id);
+      }
+    });
+    if (got != ((inOp == 1 || inOp == 2) && node.mRegistered ? mStations[inNode] : nullptr)) Fail("the registry returned another station");
+    if (inHelper) Drain();
+    Settle();
+  }
+
+  void TimerOp(int inChoice) {
+    if (!mMain || inChoice == 0) return mMain ? Terminate() : void();
+    if (!mTimer) {
+      Note(" timer"), mTimer = std::make_unique<Tarn::IdleCountdownTimer>();
+    } else if (inChoice < 5) {
+      // Duration 0: it fires at the first idle message that reaches it.
+      Note(" arm");
+      if (!mTimerListening && Reach(kIdle)) mNodes[kIdle].mEntries.push_back(Entry{mToken++, kTimer, kPlain});
+      mTimerListening = mTimerListening || Reach(kIdle);
+      mTimer->ArmTimer();
+    } else {
+      DestroyTimer();
+    }
+  }
+
+  // Its destructor disposes of its station on the main thread, which also deletes stations disposed of on workers.
+  void DestroyTimer() {
+    if (!mTimer) return;
+    Note(" ~timer");
+    if (std::exchange(mTimerListening, false)) Model(kIdle, kTimer, kPlain, false, true);
+    mTimer.reset(), Settle();
+  }
+
+  void Terminate() {
+    DestroyTimer();
+    Note(" terminate");
+    for (int node = 1; node < kNodes; ++node) Doom(node);
+    mMain = false, Tarn::Messaging::Terminate(), Settle();
+  }
+
+  // --- the model
+
+  // Whether the utilities reach the node (a registered station is made by the lookup if it was not yet).
+  bool Reach(int inNode) { return inNode == 0 || (mNodes[inNode].mRegistered && (mNodes[inNode].mMade = true)); }
+
+  bool HasEntry(int inNode, int inWho, int inWay) const {
+    const std::vector<Entry>& entries = mNodes[inNode].mEntries;
+    return std::any_of(entries.begin(), entries.end(),
+                       [&](const Entry& inEntry) { return inEntry.mWho == inWho && inEntry.mWay == inWay; });
+  }
+
+  void Model(int inNode, int inWho, int inWay, bool inAdd, bool inUnlink) {
+    if (!Reach(inNode)) return;  // the utilities do nothing for an ID that is not registered
+    std::vector<Entry>& entries = mNodes[inNode].mEntries;
+    const bool plainSlot = inWho < kSlots && inWay == kPlain;
+    if (inAdd && !HasEntry(inNode, inWho, inWay)) {
+      entries.push_back(Entry{mToken++, inWho, inWay});
+      if (plainSlot) ++mObjects[inWho].mLinks[inNode];
+    }
+    if (!inAdd) Erase(entries, [&](const Entry& inEntry) { return inEntry.mWho == inWho && inEntry.mWay == inWay; });
+    if (!inAdd && inUnlink && plainSlot) mObjects[inWho].mLinks[inNode] = 0;
+  }
+
+  template <class Predicate>
+  static void Erase(std::vector<Entry>& ioEntries, Predicate inWhich) {
+    ioEntries.erase(std::remove_if(ioEntries.begin(), ioEntries.end(), inWhich), ioEntries.end());
+  }
+
+  // The object's plain registrations go with it; weak and safe ones stay until a broadcast prunes them.
+  void Die(int inSlot) {
+    mObjects[inSlot].mAlive = false;
+    for (int node = 0; node < kNodes; ++node)
+      mObjects[inSlot].mLinks[node] = 0, Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && inEntry.mWay == kPlain; });
+  }
+
+  void Doom(int inNode) {
+    Node& node = mNodes[inNode];
+    node.mRegistered = node.mDisposeRequested = false, node.mRetains = node.mHeld = 0, node.mDoomed = node.mMade;
+  }
+
+  // Doomed stations go once no broadcast on them runs (after a worker's operation, once the main thread drained).
+  void Settle() {
+    for (int node = 1; node < kNodes; ++node)
+      if (mNodes[node].mDoomed && mNodes[node].mFrames == 0) Delete(node);
+  }
+
+  // A station deleted: it leaves the broadcasters it relays, its listeners lose it.
+  void Delete(int inNode) {
+    mNodes[inNode] = Node();
+    for (Object& object : mObjects) object.mLinks[inNode] = 0;
+    for (Node& node : mNodes) Erase(node.mEntries, [&](const Entry& inEntry) { return inEntry.mWho == kSlots + inNode; });
+  }
+
+  void Push(int inNode) { mFrames.push_back(Frame{inNode, mToken}), ++mNodes[inNode].mFrames; }
+
+  // The slot that the innermost broadcast begun by the harness calls next, or -1 when it is done;
+  // walks relays, the timer, stopped listeners and dead weak entries (which it prunes) on the way.
+  int Next() {
+    while (mFrames.size() > mLevels.back().mBase) {
+      Frame& frame = mFrames.back();
+      Object& held = mObjects[std::max(frame.mWho, 0)];
+      if (frame.mWho >= 0 && frame.mWay != kPlain && --held.mHolds == 0 && !held.mOwned && held.mAlive) Die(frame.mWho);
+      frame.mWho = -1;
+      std::vector<Entry>& entries = mNodes[frame.mNode].mEntries;
+      auto next = entries.end();
+      for (auto entry = entries.begin(); entry != entries.end(); ++entry)
+        if (entry->mToken < frame.mLast && (next == entries.end() || entry->mToken > next->mToken)) next = entry;
+      if (next == entries.end()) {
+        const int node = frame.mNode;
+        mFrames.pop_back();
+        if (--mNodes[node].mFrames == 0 && mNodes[node].mDoomed) Delete(node);
+        continue;
+      }
+      frame.mLast = next->mToken;
+      const int who = next->mWho, way = next->mWay;
+      if (who == kGone || who == kTimer) {  // the timer fires: it leaves the idle station, broadcasts on its own
+        entries.erase(next);
+        mTimerListening = mTimerListening && who != kTimer;
+      } else if (who >= kSlots) {
+        if (mMain && mNodes[who - kSlots].mBroadcasting) Push(who - kSlots);
+      } else if (way == kPlain ? mObjects[who].mListening : mObjects[who].mAlive) {
+        frame.mWho = who, frame.mWay = way, mObjects[who].mHolds += way != kPlain;
+        return who;
+      } else if (way != kPlain) {
+        entries.erase(next);
+      }
+    }
+    // Done: the utilities release the station they retained.
+    const int released = std::exchange(mLevels.back().mRetained, 0);
+    Node& node = mNodes[released];
+    if (released != 0 && node.mRegistered && --node.mRetains == 0 && node.mDisposeRequested) Doom(released);
+    Settle();
+    return -1;
+  }
+
+  bool Delivering(int inSlot, int inWay) const {
+    return std::any_of(mFrames.begin(), mFrames.end(),
+                       [&](const Frame& inFrame) { return inFrame.mWho == inSlot && inFrame.mWay == inWay; });
+  }
+
+  // What the library answers between steps, against the model.
+  void Compare() {
+    if (!mFailure.empty()) return;
+    if (mB0.HasListeners() != !mNodes[0].mEntries.empty()) Fail("HasListeners disagrees with the model");
+    for (int node = 1; node < kNodes; ++node)
+      if ((mStations[node] != nullptr) != mNodes[node].mMade) Fail("station " + std::to_string(node) + " lives against the model");
+    for (int slot = 0; slot < kSlots; ++slot) {
+      Object& object = mObjects[slot];
+      if (object.mKind >= 0 && object.mDestroyed == object.mAlive) Fail("slot " + std::to_string(slot) + " lives against the model");
+      for (int node = 0; node < kNodes && object.mOwned && object.mListener != nullptr; ++node) {
+        Tarn::Broadcaster* broadcaster = node == 0 ? &mB0 : mStations[node];
+        if (broadcaster != nullptr && (broadcaster->HasListener(object.mListener) != HasEntry(node, slot, kPlain) ||
+                                       object.mListener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0)))
+          Fail("registration or back-link of slot " + std::to_string(slot) + " at " + std::to_string(node));
+      }
+    }
+  }
+
+  Choices& mChoices;
+  std::string mFailure, mTrace;
+  kivcore::config::ErrorHandler mPreviousErrors;
+  kivcore::config::ErrorManager::ExceptionHandler mPreviousExceptions;
+  ImmutableString mIDs[kNodes];
+  Tarn::Station* mStations[kNodes] = {};  // as the stations report their lives
+  Node mNodes[kNodes];
+  Object mObjects[kSlots];
+  std::vector<Frame> mFrames;
+  // Per broadcast begun by the harness: its first frame, and the station the utilities retained for it until they
+  // release it (0: none).
+  struct Level { std::size_t mBase; int mRetained; };
+  std::vector<Level> mLevels;  // per broadcast begun by the harness
+  bool mStale = false;         // the library runs the innermost broadcast past the last call the model walked to
+  int mToken = 1, mHandlerActions = 0;
+  bool mMain = true, mTimerListening = false;  // mMain: the library is initialized (this thread is its main thread)
+  std::unique_ptr<Tarn::IdleCountdownTimer> mTimer;
+  Tarn::Broadcaster mB0;  // last: its listeners are gone before it
+};
+
+inline void Called(int inSlot) { sHarness->OnCall(inSlot); }
+inline void Destroyed(int inSlot) { sHarness != nullptr ? sHarness->OnDestroyed(inSlot) : void(); }
+inline void StationLife(int inNode, Tarn::Station* inStation) {
+  if (inNode >= 0 && sHarness != nullptr) sHarness->OnStation(inNode, inStation);
+}
+inline Tarn::Station* MakeTracked(const ImmutableString& inStationID) { return sHarness->Factory(inStationID); }
+
+inline std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse; }
+
+// One sequence of at most inSteps operations; returns the failure, or an empty string.
+inline std::string RunSequence(Choices& ioChoices, int inSteps) {
+  const std::size_t baseline = BlocksInUse();
+  const std::string failure = [&] {
+    Harness harness(ioChoices);
+    harness.Run(inSteps);
+    return harness.Finish();
+  }();
+  return failure.empty() && BlocksInUse() != baseline ? "small blocks leaked" : failure;
+}
+
+// For RunConcurrent: a call after the listener's removal returned is a fault.
+struct Watcher : Tarn::Listener {
+  void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0; }
+  std::atomic<bool> mRemoved{false};
+  static inline std::atomic<int> sLateCalls{0};
+};
+
+// A worker tears down while the main thread broadcasts. Each round the worker makes a station, attaches it as a
+// relay to a broadcaster the main thread broadcasts on, gives it a listener (which also hears a well-known station),
+// removes or destroys the listener, and lets the station go by disposal and last release. Meanwhile the main thread
+// broadcasts on both, drains, and now and then disposes of the well-known station and registers it again.
+// Returns the failure, or an empty string.
+inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
+  const std::size_t baseline = BlocksInUse();
+  const int lateCalls = Watcher::sLateCalls;
+  Tarn::Messaging::Initialize();
+  {
+    Tarn::Broadcaster parent;
+    std::atomic<bool> done{false};
+    auto worker = std::async(std::launch::async, [&] {
+      std::minstd_rand random(inSeed);
+      for (int round = 0; round < inRounds; ++round) {
+        const ImmutableString id = Registry::UniqueStationID();
+        Registry::RegisterStation(id, &MakeCounted);
+        parent.AddListener(Registry::RetainStation(id));
+        auto watcher = std::make_unique<Watcher>();
+        for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::AddListener(*station, watcher.get());
+        if (random() % 2 == 0) {
+          for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::RemoveListener(*station, watcher.get());
+          watcher->mRemoved = true;
+        }
+        if (random() % 2 == 0) watcher.reset();  // destroyed while attached, or once removed
+        Registry::DisposeStation(id);
+        Registry::ReleaseStation(id);  // the last: the station goes while the main thread may be relaying through it
+      }
+      done = true;
+    });
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+    for (int round = 0; !done; ++round) {
+      parent.BroadcastMessage(Ping());
+      Utils::BroadcastMessage(Tarn::kStation_StatusBar, Ping());
+      Drain();
+      if (round % 16 == 0) Registry::DisposeStation(Tarn::kStation_StatusBar), Registry::RegisterStation(Tarn::kStation_StatusBar, nullptr);
+      if (std::chrono::steady_clock::now() > deadline) std::fprintf(stderr, "operations harness: the worker hangs\n"), std::abort();
+    }
+    worker.get();
+    Drain();
+  }
+  Tarn::Messaging::Terminate();
+  if (Watcher::sLateCalls != lateCalls) return "a listener was called after its removal returned";
+  if (sLiveStations != 0) return "stations outlived Terminate";
+  return BlocksInUse() != baseline ? "small blocks leaked" : "";
+}
+
+}  // namespace operations_harness
