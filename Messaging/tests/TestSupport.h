@@ -105,7 +105,6 @@ public:
               state->mViolations.push_back(ContractViolation{inCondition != nullptr ? inCondition : "",
                                                              inFile != nullptr ? inFile : "",
                                                              inFunction != nullptr ? inFunction : "", inLine});
-              state->mChanged.notify_all();
               return state->mAnswer;
             })) {}
   ContractDialogRecorder(const ContractDialogRecorder&) = delete;
@@ -120,11 +119,6 @@ public:
     std::lock_guard<std::mutex> lock(mState->mMutex);
     return mState->mViolations.size();
   }
-  // True when at least inCount violations were recorded before inTimeout.
-  bool WaitForCount(std::size_t inCount, std::chrono::milliseconds inTimeout = kDeadline) const {
-    std::unique_lock<std::mutex> lock(mState->mMutex);
-    return mState->mChanged.wait_for(lock, inTimeout, [&] { return mState->mViolations.size() >= inCount; });
-  }
   void Clear() {
     std::lock_guard<std::mutex> lock(mState->mMutex);
     mState->mViolations.clear();
@@ -134,7 +128,6 @@ private:
   struct State {
     explicit State(bool inAnswer) : mAnswer(inAnswer) {}
     mutable std::mutex mMutex;
-    std::condition_variable mChanged;
     std::vector<ContractViolation> mViolations;  // guarded by mMutex
     const bool mAnswer;
   };
@@ -314,7 +307,6 @@ public:
   CallRecorder& operator=(const CallRecorder&) = delete;
   ~CallRecorder() { mProbe->mDestroyed.store(true); }
 
-  const std::string& Name() const { return mName; }
   int Calls() const { return mProbe->mCalls.load(); }
   const std::shared_ptr<Probe>& GetProbe() const { return mProbe; }
   // Runs on every call, on the delivering thread, after the call is logged.
@@ -390,19 +382,6 @@ private:
 enum class ListenerKind { kPlainPointer, kBoostWeak, kStdWeak, kSafe };
 constexpr ListenerKind kAllListenerKinds[] = {ListenerKind::kPlainPointer, ListenerKind::kBoostWeak,
                                               ListenerKind::kStdWeak, ListenerKind::kSafe};
-inline const char* KindName(ListenerKind inKind) {
-  switch (inKind) {
-    case ListenerKind::kPlainPointer:
-      return "PlainPointer";
-    case ListenerKind::kBoostWeak:
-      return "BoostWeak";
-    case ListenerKind::kStdWeak:
-      return "StdWeak";
-    case ListenerKind::kSafe:
-      return "Safe";
-  }
-  return "?";
-}
 
 // One recording listener held the way inKind says, so that one test body can
 // run for every kind. The handle owns the listener: a plain-pointer listener
@@ -521,13 +500,6 @@ private:
   std::shared_ptr<RecordingListener> mStd;
   Tarn::ISafeListenerRef mSafe;
   std::shared_ptr<CallRecorder::Probe> mProbe;  // outlives the listener
-};
-
-// Names gtest parameterised suites over ListenerKind.
-struct KindParamName {
-  std::string operator()(const ::testing::TestParamInfo<ListenerKind>& inInfo) const {
-    return KindName(inInfo.param);
-  }
 };
 
 }  // namespace messaging_test
