@@ -1,10 +1,12 @@
 # The two entry points of the project, around scripts/setup.sh and the CMake
 # presets:
 #   make demo   set up, build, and run the demo host application
-#   make test   set up, build, and run every test: the normal build, the
-#               threaded tests under ThreadSanitizer, the whole suite under
-#               AddressSanitizer, and the fuzzer for FUZZ_SECONDS
-#   make bench  the benchmarks against the peer libraries
+#   make test   set up, build, and run every test: the normal build (with the
+#               install check), the threaded tests under ThreadSanitizer, the
+#               whole suite under AddressSanitizer, and the fuzzer for
+#               FUZZ_SECONDS
+#   make bench  the benchmarks against the peer libraries: the table, the
+#               ratio against each performance target, and the chart
 #   make fuzz   the fuzzer alone (FUZZ_SECONDS=600 make fuzz for longer)
 # WERROR=ON turns warnings into errors (CI does this).
 
@@ -54,7 +56,11 @@ fuzz: setup
 	@if command -v clang++ > /dev/null; then ./fuzz/run.sh $(FUZZ_SECONDS); \
 	else echo "fuzz: clang++ not found, fuzzer skipped (apt-get install clang)"; fi
 
-bench: build
+# Builds only the benchmark program; the report and chart need python3 and
+# gnuplot (both optional in setup).
+bench: setup
+	$(call CONFIGURE,default)
+	cmake --build --preset default -j $(JOBS) --target tarn-bench
 	./bench/run.sh
 
 docs: build

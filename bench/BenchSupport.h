@@ -1,34 +1,32 @@
-// What every benchmark of this folder shares: the message, the handlers that
-// consume it, the correctness checks, and the general-heap allocation
+// What every benchmark of this folder shares: the message, the handler that
+// consumes it, the correctness check, and the general-heap allocation
 // counter.
-//
-//   TarnBench::Tally tally;                          // one per handler
-//   TarnBench::TarnTallyListener listener(&tally);   // a Tarn::Listener
-//   ...                                              // broadcast K times
-//   TarnBench::Verify(state, TarnBench::AllEqual(tallies, K), "missed a call");
 //
 // The message is a struct of two ints; every handler, whatever library calls
 // it, adds the two into its Tally and counts the call, so that a check after
-// the run can prove that each handler was called exactly as often as it had
-// to be. A benchmark that fails its check is reported as an error (with
+// the run proves that each handler was called exactly as often as it had to
+// be. A benchmark that fails its check is reported as an error (with
 // SkipWithError) and makes the program exit non-zero, so a fast wrong result
 // never reaches the table.
 //
-// Threading: Tally and the handlers are not synchronised; each is touched by
-// the thread that delivers to it (the main thread in every scenario) and read
-// after the run. The allocation counter is process-wide and thread-safe.
+// Threading: a Tally and its handler are touched by the thread that delivers
+// to it (the main thread in every scenario) and read after the run. The
+// allocation counter is process-wide and thread-safe.
 #pragma once
 
 #include <TarnMessaging.h>
 
+#include <kivcore/SmallBlockAllocator.h>
+
 #include <benchmark/benchmark.h>
 
-#include <atomic>
-#include <cstddef>
 #include <cstdint>
 #include <vector>
 
 namespace TarnBench {
+
+constexpr int kA = 3;
+constexpr int kB = 4;
 
 // The peers' message.
 struct PairArgs {
@@ -64,8 +62,8 @@ private:
 };
 
 // The floor: a plain interface called through a vector of pointers. Made in
-// another translation unit so the compiler cannot see the concrete type at
-// the call site and must make a real virtual call, as a library would.
+// another translation unit so that the call site cannot see the concrete
+// type and makes a real virtual call, as a library would.
 class PairSink {
 public:
   virtual ~PairSink() = default;
@@ -73,46 +71,45 @@ public:
 };
 PairSink* NewTallySink(Tally* inTally);
 
-// True when every tally counted exactly inCalls calls and summed inSum.
-bool AllEqual(const std::vector<Tally>& inTallies, std::int64_t inCalls, std::int64_t inSum);
+// True when every tally counted exactly inCalls calls of (kA, kB).
+bool AllCalled(const std::vector<Tally>& inTallies, std::int64_t inCalls);
 
 // Reports a failed check as the benchmark's error and remembers that the
 // program must exit non-zero. Returns inOk.
 bool Verify(benchmark::State& ioState, bool inOk, const char* inWhat);
-// Whether any check has failed so far.
-bool AnyCheckFailed();
 
-// Adds "min" and "max" over the repetitions to a benchmark's aggregates. On a
-// shared machine other work only ever slows a run down, so the fastest
-// repetition estimates the undisturbed cost; the table shows it beside the
-// median.
+// Adds "min" and "max" over the repetitions to a benchmark's aggregates: on
+// a shared machine other work only slows a run down, so the best repetition
+// is shown beside the median.
 benchmark::internal::Benchmark* WithBestOf(benchmark::internal::Benchmark* ioBenchmark);
 
-// Ensures the calling thread is Tarn's main thread; a benchmark that runs
-// elsewhere would measure a broadcast that does nothing.
+// A Tarn scenario off the main thread would measure a broadcast that does
+// nothing; this makes it fail instead.
 bool VerifyMainThread(benchmark::State& ioState);
 
-// Counts of the replaced global operator new, process-wide. Counting is off
-// unless a HeapCounting scope is open, so that timed benchmarks pay one
-// relaxed load per allocation and nothing more.
-struct HeapCounts {
-  std::uint64_t mAllocations;
-  std::int64_t mBytes;  // allocated minus freed, as usable sizes
-};
-HeapCounts CurrentHeapCounts() noexcept;
+// A station of the bench's own, registered on first use.
+const kivcore::utility::ImmutableString& BenchStationID();
 
-class HeapCounting {
+// Allocations through the replaced global operator new, and small-block
+// allocations, since construction. Counting of the former is off outside
+// such a scope, so that timed benchmarks pay one relaxed load per
+// allocation. The small-block figures are exact while no other thread
+// allocates.
+class AllocationCounts {
 public:
-  HeapCounting() noexcept;
-  ~HeapCounting();
-  HeapCounting(const HeapCounting&) = delete;
-  HeapCounting& operator=(const HeapCounting&) = delete;
-  // Counts since this scope opened.
-  std::uint64_t Allocations() const noexcept;
-  std::int64_t Bytes() const noexcept;
+  AllocationCounts() noexcept;
+  ~AllocationCounts();
+  AllocationCounts(const AllocationCounts&) = delete;
+  AllocationCounts& operator=(const AllocationCounts&) = delete;
+  std::uint64_t HeapAllocations() const noexcept;
+  std::int64_t HeapBytes() const noexcept;  // allocated minus freed, as usable sizes
+  std::uint64_t SmallBlocks() const;
+  std::int64_t SmallBytes() const;
 
 private:
-  HeapCounts mStart;
+  std::uint64_t mHeapStart;
+  std::int64_t mHeapBytesStart;
+  kivcore::utility::SmallBlockAllocator::Statistics mSmallStart;
 };
 
 }  // namespace TarnBench

@@ -1,26 +1,25 @@
-// Posting from worker threads to the main thread.
-//
-// Throughput: P producers post 50,000 messages each as fast as they can; the
-// figure is posts per second from the first post to the last delivery. Tarn
-// posts with StationUtils::PostMessageToUIThread onto a station with one
-// listener, the main thread waiting with the adaptor's WaitForPendingCalls
-// and running the calls with StationUtils::FlushPostedMessagesOnUIThread.
-// Peers: boost::asio::io_context (post, the main thread in run()) and a
-// std::mutex + std::deque + std::condition_variable queue of std::function.
-//
-// Latency: one producer posts 10,000 messages a second (paced with a steady
-// clock); the figure is the time from just before the post call to the start
-// of the handler, median and 99th percentile.
-//
-// Both depend on where the operating system puts the threads: with producer
-// and consumer on one CPU there is no cross-CPU traffic and no wake-up
-// latency, on two CPUs there is, and an unpinned run gets either at random.
-// So that every peer is measured alike, the main thread is pinned to the
-// first CPU the process may use and every producer to the second (when there
-// are two); the main thread's own affinity is restored afterwards.
+// Posting from worker threads to the main thread, for Tarn
+// (StationUtils::PostMessageToUIThread onto a station with one listener, the
+// main thread waiting with the adaptor's WaitForPendingCalls and running
+// FlushPostedMessagesOnUIThread), boost::asio::io_context (post, run), a
+// std::mutex + std::deque + std::condition_variable queue of std::function,
+// and Qt 5 (QMetaObject::invokeMethod with Qt::QueuedConnection, a
+// QEventLoop on the main thread).
+//   Posting/<peer>/P     P producers post 50,000 messages each as fast as
+//                        they can: posts per second from the first post to
+//                        the last delivery
+//   Latency/<peer>       one producer posts 10,000 messages a second: the
+//                        time from just before the post call to the start of
+//                        the handler, p50 and p99
+//   Alloc/Post/<case>    allocations per post, 10,000 posts delivered
 //
 // Every message carries its producer and sequence number; after each run a
 // check proves that each was delivered exactly once.
+//
+// Where the operating system puts the threads decides these figures (one
+// CPU: no wake-up latency and no cross-CPU traffic; two: both), so the main
+// thread is pinned to the first CPU the process may use and every producer
+// to the second, for every peer alike.
 #include "BenchSupport.h"
 
 #include <kivcore/MainThread.h>
@@ -28,11 +27,17 @@
 #include <pthread.h>
 #include <sched.h>
 
-#include <boost/asio/executor_work_guard.hpp>
 #include <boost/asio/io_context.hpp>
 #include <boost/asio/post.hpp>
+#include <boost/asio/steady_timer.hpp>
+
+#if defined(TARN_BENCH_HAVE_QT)
+#include <QEventLoop>
+#include <QTimer>
+#endif
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <deque>
@@ -49,75 +54,57 @@ using Clock = std::chrono::steady_clock;
 constexpr int kPostsPerProducer = 50000;
 constexpr int kLatencyPosts = 5000;
 constexpr auto kLatencyInterval = std::chrono::microseconds(100);  // 10,000 posts a second
-// A run that takes longer than this has lost a message; it fails instead of
+constexpr int kAllocPosts = 10000;
+// A run that takes longer than this has lost a message: it fails instead of
 // hanging.
 constexpr auto kRunLimit = std::chrono::seconds(30);
-constexpr int kWaitSliceMilliseconds = 100;
-
-const kivcore::utility::ImmutableString& PostingStationID() {
-  static const kivcore::utility::ImmutableString sStationID = [] {
-    const auto id = kivcore::utility::ImmutableString::CreateStatic("tarn.bench.posting");
-    Tarn::StationRegistry::RegisterStation(id, nullptr);
-    return id;
-  }();
-  return sStationID;
-}
 
 // What the main thread records of the deliveries of one run.
 class DeliveryRecord {
 public:
-  DeliveryRecord(int inProducers, int inPostsPerProducer, bool inStampTimes)
-      : mProducers(inProducers),
-        mPostsPerProducer(inPostsPerProducer),
-        mSeen(static_cast<std::size_t>(inProducers) * static_cast<std::size_t>(inPostsPerProducer), 0),
+  DeliveryRecord(int inProducers, int inPostsEach, bool inStampTimes)
+      : mPostsEach(inPostsEach),
+        mSeen(static_cast<std::size_t>(inProducers * inPostsEach), 0),
         mPostTimes(inStampTimes ? mSeen.size() : 0),
-        mDeliveryTimes(inStampTimes ? mSeen.size() : 0) {}
+        mDeliveryTimes(mPostTimes.size()) {}
 
-  // A message (sequence, producer) as the handler sees it.
-  void Deliver(int inSequence, int inProducer) {
+  // Returns true for the delivery that completes the run.
+  bool Deliver(int inSequence, int inProducer) {
     const std::size_t index = Index(inSequence, inProducer);
-    if (index < mSeen.size()) {
-      ++mSeen[index];
-      if (!mDeliveryTimes.empty()) mDeliveryTimes[index] = Clock::now();
-    }
-    mTally.Add(inSequence, inProducer);
+    if (index < mSeen.size() && mSeen[index]++ == 0) ++mDistinct;
+    else mExtra = true;
+    if (!mDeliveryTimes.empty() && index < mSeen.size()) mDeliveryTimes[index] = Clock::now();
+    if (!Complete()) return false;
+    mEnd = Clock::now();
+    return true;
   }
-  // The producer's time stamp, taken just before its post call.
+  // Taken by the producer just before its post call.
   void StampPost(int inSequence, int inProducer) { mPostTimes[Index(inSequence, inProducer)] = Clock::now(); }
 
   std::int64_t Total() const noexcept { return static_cast<std::int64_t>(mSeen.size()); }
-  bool Complete() const noexcept { return mTally.mCalls >= Total(); }
+  bool Complete() const noexcept { return mDistinct == mSeen.size(); }
+  bool ExactlyOnce() const noexcept { return Complete() && !mExtra; }
+  Clock::time_point End() const noexcept { return mEnd; }
 
-  // Every message delivered exactly once, and nothing else.
-  bool ExactlyOnce() const {
-    if (mTally.mCalls != Total()) return false;
-    if (std::any_of(mSeen.begin(), mSeen.end(), [](std::uint8_t inCount) { return inCount != 1; })) return false;
-    const std::int64_t per = mPostsPerProducer;
-    const std::int64_t producers = mProducers;
-    return mTally.mSum == producers * per * (per - 1) / 2 + per * producers * (producers - 1) / 2;
-  }
-
-  // Post-to-delivery latencies in microseconds, sorted.
-  std::vector<double> SortedLatencies() const {
+  std::vector<double> LatenciesMicroseconds() const {
     std::vector<double> latencies;
     for (std::size_t i = 0; i < mPostTimes.size(); ++i)
       latencies.push_back(std::chrono::duration<double, std::micro>(mDeliveryTimes[i] - mPostTimes[i]).count());
-    std::sort(latencies.begin(), latencies.end());
     return latencies;
   }
 
 private:
   std::size_t Index(int inSequence, int inProducer) const noexcept {
-    return static_cast<std::size_t>(inProducer) * static_cast<std::size_t>(mPostsPerProducer) +
-           static_cast<std::size_t>(inSequence);
+    return static_cast<std::size_t>(inProducer * mPostsEach + inSequence);
   }
 
-  const int mProducers;
-  const int mPostsPerProducer;
-  std::vector<std::uint8_t> mSeen;  // deliveries per message; main thread
-  std::vector<Clock::time_point> mPostTimes;      // written by the producer before its post
+  const int mPostsEach;
+  std::vector<std::uint8_t> mSeen;                // main thread
+  std::size_t mDistinct = 0;                      // main thread
+  bool mExtra = false;                            // a duplicate or unknown message; main thread
+  Clock::time_point mEnd;                         // main thread
+  std::vector<Clock::time_point> mPostTimes;      // each slot written by its producer before the post
   std::vector<Clock::time_point> mDeliveryTimes;  // main thread
-  Tally mTally;                                   // main thread
 };
 
 class RecordingListener : public Tarn::Listener {
@@ -133,227 +120,172 @@ private:
   DeliveryRecord* mRecord;
 };
 
-void PinCurrentThread(int inCpu) {
+void Pin(pthread_t inThread, int inCpu) {
   cpu_set_t set;
   CPU_ZERO(&set);
   CPU_SET(inCpu, &set);
-  pthread_setaffinity_np(pthread_self(), sizeof set, &set);
+  pthread_setaffinity_np(inThread, sizeof set, &set);
 }
 
-// Pins the calling (main) thread to the first CPU it may use and chooses
-// another for the producers; restores the thread's affinity when destroyed.
-// Without two usable CPUs nothing is pinned (ProducerCpu() is -1).
+// Pins the main thread to its first allowed CPU and chooses the second for
+// the producers (-1, nothing pinned, with fewer than two); restores the
+// main thread's affinity when destroyed.
 class ThreadPinning {
 public:
   ThreadPinning() {
-    CPU_ZERO(&mSaved);
     if (pthread_getaffinity_np(pthread_self(), sizeof mSaved, &mSaved) != 0) return;
-    int first = -1;
-    for (int cpu = 0; cpu < CPU_SETSIZE; ++cpu) {
-      if (!CPU_ISSET(cpu, &mSaved)) continue;
-      if (first < 0) {
-        first = cpu;
-      } else {
-        mProducerCpu = cpu;
-        break;
-      }
-    }
-    if (mProducerCpu >= 0) PinCurrentThread(first);
+    std::vector<int> cpus;
+    for (int cpu = 0; cpu < CPU_SETSIZE && cpus.size() < 2; ++cpu)
+      if (CPU_ISSET(cpu, &mSaved)) cpus.push_back(cpu);
+    if (cpus.size() < 2) return;
+    Pin(pthread_self(), cpus[0]);
+    mProducerCpu = cpus[1];
   }
   ~ThreadPinning() {
     if (mProducerCpu >= 0) pthread_setaffinity_np(pthread_self(), sizeof mSaved, &mSaved);
   }
   ThreadPinning(const ThreadPinning&) = delete;
   ThreadPinning& operator=(const ThreadPinning&) = delete;
-  int ProducerCpu() const noexcept { return mProducerCpu; }
+  int mProducerCpu = -1;
 
 private:
   cpu_set_t mSaved;
-  int mProducerCpu = -1;
 };
 
-// Producers that start together on a signal and remember when the first of
-// them made its first post.
-class Producers {
-public:
-  // inPost(sequence, producer) posts one message. With inCpu >= 0 every
-  // producer runs on that CPU.
-  Producers(int inCount, int inPostsEach, bool inPaced, DeliveryRecord* inRecord,
-            std::function<void(int, int)> inPost, int inCpu = -1)
-      : mPost(std::move(inPost)) {
-    for (int producer = 0; producer < inCount; ++producer) {
-      mThreads.emplace_back([this, producer, inPostsEach, inPaced, inRecord, inCpu] {
-        if (inCpu >= 0) PinCurrentThread(inCpu);
-        while (!mGo.load(std::memory_order_acquire)) std::this_thread::yield();
-        const Clock::time_point start = Clock::now();
-        {
-          std::lock_guard<std::mutex> lock(mStartMutex);
-          if (!mStarted || start < mFirstPost) mFirstPost = start;
-          mStarted = true;
+// One run: producers that start together, each calling inPost(sequence,
+// producer) for its messages, while inServe(deadline) delivers on the main
+// thread. Returns the seconds from the first post to the last delivery, or
+// -1 when the run did not complete in time.
+double RunProducers(int inProducers, int inPostsEach, bool inPaced, int inCpu, DeliveryRecord& ioRecord,
+                    const std::function<void(int, int)>& inPost,
+                    const std::function<void(Clock::time_point)>& inServe) {
+  std::atomic<bool> go{false};
+  std::atomic<Clock::rep> firstPost{Clock::time_point::max().time_since_epoch().count()};
+  std::vector<std::thread> threads;
+  for (int producer = 0; producer < inProducers; ++producer) {
+    threads.emplace_back([&, producer] {
+      if (inCpu >= 0) Pin(pthread_self(), inCpu);
+      while (!go.load(std::memory_order_acquire)) std::this_thread::yield();
+      const Clock::time_point start = Clock::now();
+      Clock::rep first = firstPost.load();
+      while (start.time_since_epoch().count() < first &&
+             !firstPost.compare_exchange_weak(first, start.time_since_epoch().count())) {
+      }
+      for (int sequence = 0; sequence < inPostsEach; ++sequence) {
+        if (inPaced) {
+          std::this_thread::sleep_until(start + sequence * kLatencyInterval);
+          ioRecord.StampPost(sequence, producer);
         }
-        for (int sequence = 0; sequence < inPostsEach; ++sequence) {
-          if (inPaced) {
-            std::this_thread::sleep_until(start + sequence * kLatencyInterval);
-            inRecord->StampPost(sequence, producer);
-          }
-          mPost(sequence, producer);
-        }
-      });
-    }
-  }
-  ~Producers() { Join(); }
-
-  void Go() { mGo.store(true, std::memory_order_release); }
-  void Join() {
-    for (std::thread& thread : mThreads)
-      if (thread.joinable()) thread.join();
-  }
-  Clock::time_point FirstPost() {
-    std::lock_guard<std::mutex> lock(mStartMutex);
-    return mFirstPost;
-  }
-
-private:
-  std::function<void(int, int)> mPost;
-  std::atomic<bool> mGo{false};
-  std::mutex mStartMutex;
-  bool mStarted = false;          // guarded by mStartMutex
-  Clock::time_point mFirstPost;   // guarded by mStartMutex
-  std::vector<std::thread> mThreads;
-};
-
-// Calls inExpire on its own thread unless disarmed within the time limit.
-class Watchdog {
-public:
-  explicit Watchdog(std::function<void()> inExpire) : mExpire(std::move(inExpire)) {
-    mThread = std::thread([this] {
-      std::unique_lock<std::mutex> lock(mMutex);
-      if (!mDisarmed.wait_for(lock, kRunLimit, [this] { return mDone; })) mExpire();
+        inPost(sequence, producer);
+      }
     });
   }
-  ~Watchdog() {
-    {
-      std::lock_guard<std::mutex> lock(mMutex);
-      mDone = true;
-    }
-    mDisarmed.notify_all();
-    mThread.join();
-  }
+  go.store(true, std::memory_order_release);
+  inServe(Clock::now() + kRunLimit);
+  for (std::thread& thread : threads) thread.join();
+  if (!ioRecord.Complete()) return -1.0;
+  return std::chrono::duration<double>(ioRecord.End() - Clock::time_point(Clock::duration(firstPost.load()))).count();
+}
 
-private:
-  std::function<void()> mExpire;
-  std::mutex mMutex;
-  std::condition_variable mDisarmed;
-  bool mDone = false;  // guarded by mMutex
-  std::thread mThread;
-};
-
-// The simple queue a team might write instead: producers append under a
-// mutex; the consumer takes everything queued at once.
-class MutexQueue {
-public:
-  void Post(std::function<void()> inCall) {
-    {
-      std::lock_guard<std::mutex> lock(mMutex);
-      mQueue.push_back(std::move(inCall));
-    }
-    mQueued.notify_one();
-  }
-  // Runs every queued call, waiting up to inTimeout for the first.
-  void RunFor(std::chrono::milliseconds inTimeout) {
-    std::deque<std::function<void()>> batch;
-    {
-      std::unique_lock<std::mutex> lock(mMutex);
-      if (!mQueued.wait_for(lock, inTimeout, [this] { return !mQueue.empty(); })) return;
-      batch.swap(mQueue);
-    }
-    for (std::function<void()>& call : batch) call();
-  }
-
-private:
-  std::mutex mMutex;
-  std::condition_variable mQueued;
-  std::deque<std::function<void()>> mQueue;  // guarded by mMutex
-};
-
-// One run of Tarn posting; returns the seconds from the first post to the
-// last delivery, or a negative value when the run timed out.
-double RunTarn(int inProducers, int inPostsEach, bool inPaced, DeliveryRecord& ioRecord, int inCpu) {
-  const kivcore::utility::ImmutableString& stationID = PostingStationID();
+double RunTarn(int inProducers, int inPostsEach, bool inPaced, int inCpu, DeliveryRecord& ioRecord) {
+  const kivcore::utility::ImmutableString& stationID = BenchStationID();
   RecordingListener listener(&ioRecord);
   Tarn::StationUtils::AddListener(stationID, &listener);
   const auto adaptor = kivcore::threads::GetRegisteredMainThread();
-  Producers producers(inProducers, inPostsEach, inPaced, &ioRecord, [&stationID](int inSequence, int inProducer) {
-    Tarn::StationUtils::PostMessageToUIThread(stationID, PairMessage(inSequence, inProducer), false);
-  }, inCpu);
-  const Clock::time_point deadline = Clock::now() + kRunLimit;
-  producers.Go();
-  while (!ioRecord.Complete() && Clock::now() < deadline) {
-    if (adaptor->WaitForPendingCalls(kWaitSliceMilliseconds)) Tarn::StationUtils::FlushPostedMessagesOnUIThread();
-  }
-  const Clock::time_point end = Clock::now();
-  producers.Join();
+  const double seconds = RunProducers(
+      inProducers, inPostsEach, inPaced, inCpu, ioRecord,
+      [&stationID](int inSequence, int inProducer) {
+        Tarn::StationUtils::PostMessageToUIThread(stationID, PairMessage(inSequence, inProducer), false);
+      },
+      [&](Clock::time_point inDeadline) {
+        while (!ioRecord.Complete() && Clock::now() < inDeadline)
+          if (adaptor->WaitForPendingCalls(100)) Tarn::StationUtils::FlushPostedMessagesOnUIThread();
+      });
   Tarn::StationUtils::RemoveListener(stationID, &listener);
-  if (!ioRecord.Complete()) return -1.0;
-  return std::chrono::duration<double>(end - producers.FirstPost()).count();
+  return seconds;
 }
 
-double RunAsio(int inProducers, int inPostsEach, bool inPaced, DeliveryRecord& ioRecord, int inCpu) {
+double RunAsio(int inProducers, int inPostsEach, bool inPaced, int inCpu, DeliveryRecord& ioRecord) {
   boost::asio::io_context context;
-  auto work = boost::asio::make_work_guard(context);
-  Clock::time_point end;
-  Producers producers(inProducers, inPostsEach, inPaced, &ioRecord,
-                      [&context, &ioRecord, &work, &end](int inSequence, int inProducer) {
-                        boost::asio::post(context, [&ioRecord, &work, &end, inSequence, inProducer] {
-                          ioRecord.Deliver(inSequence, inProducer);
-                          if (ioRecord.Complete()) {
-                            end = Clock::now();
-                            work.reset();  // run() returns once nothing is left
-                          }
-                        });
-                      },
-                      inCpu);
-  {
-    Watchdog watchdog([&context] { context.stop(); });
-    producers.Go();
-    context.run();
-  }
-  producers.Join();
-  if (!ioRecord.Complete()) return -1.0;
-  return std::chrono::duration<double>(end - producers.FirstPost()).count();
+  boost::asio::steady_timer limit(context);  // keeps run() going until stopped
+  return RunProducers(
+      inProducers, inPostsEach, inPaced, inCpu, ioRecord,
+      [&context, &ioRecord](int inSequence, int inProducer) {
+        boost::asio::post(context, [&context, &ioRecord, inSequence, inProducer] {
+          if (ioRecord.Deliver(inSequence, inProducer)) context.stop();
+        });
+      },
+      [&](Clock::time_point inDeadline) {
+        limit.expires_at(inDeadline);
+        limit.async_wait([&context](const boost::system::error_code&) { context.stop(); });
+        context.run();
+      });
 }
 
-double RunMutexQueue(int inProducers, int inPostsEach, bool inPaced, DeliveryRecord& ioRecord, int inCpu) {
-  MutexQueue queue;
-  Producers producers(inProducers, inPostsEach, inPaced, &ioRecord, [&queue, &ioRecord](int inSequence, int inProducer) {
-    queue.Post([&ioRecord, inSequence, inProducer] { ioRecord.Deliver(inSequence, inProducer); });
-  }, inCpu);
-  const Clock::time_point deadline = Clock::now() + kRunLimit;
-  producers.Go();
-  while (!ioRecord.Complete() && Clock::now() < deadline) queue.RunFor(std::chrono::milliseconds(kWaitSliceMilliseconds));
-  const Clock::time_point end = Clock::now();
-  producers.Join();
-  if (!ioRecord.Complete()) return -1.0;
-  return std::chrono::duration<double>(end - producers.FirstPost()).count();
+// The simple queue a team might write instead: producers append under a
+// mutex; the consumer takes everything queued at once.
+double RunMutexQueue(int inProducers, int inPostsEach, bool inPaced, int inCpu, DeliveryRecord& ioRecord) {
+  std::mutex mutex;
+  std::condition_variable queued;
+  std::deque<std::function<void()>> queue;  // guarded by mutex
+  return RunProducers(
+      inProducers, inPostsEach, inPaced, inCpu, ioRecord,
+      [&](int inSequence, int inProducer) {
+        {
+          std::lock_guard<std::mutex> lock(mutex);
+          queue.push_back([&ioRecord, inSequence, inProducer] { ioRecord.Deliver(inSequence, inProducer); });
+        }
+        queued.notify_one();
+      },
+      [&](Clock::time_point inDeadline) {
+        while (!ioRecord.Complete() && Clock::now() < inDeadline) {
+          std::deque<std::function<void()>> batch;
+          {
+            std::unique_lock<std::mutex> lock(mutex);
+            queued.wait_until(lock, inDeadline, [&queue] { return !queue.empty(); });
+            batch.swap(queue);
+          }
+          for (std::function<void()>& call : batch) call();
+        }
+      });
 }
 
-// (producers, posts each, paced, record, producer CPU or -1)
-using RunFunction = double (*)(int, int, bool, DeliveryRecord&, int);
+#if defined(TARN_BENCH_HAVE_QT)
+double RunQt(int inProducers, int inPostsEach, bool inPaced, int inCpu, DeliveryRecord& ioRecord) {
+  QObject receiver;  // lives on the main thread, so its queued calls run there
+  QEventLoop loop;
+  return RunProducers(
+      inProducers, inPostsEach, inPaced, inCpu, ioRecord,
+      [&](int inSequence, int inProducer) {
+        QMetaObject::invokeMethod(
+            &receiver,
+            [&ioRecord, &loop, inSequence, inProducer] {
+              if (ioRecord.Deliver(inSequence, inProducer)) loop.quit();
+            },
+            Qt::QueuedConnection);
+      },
+      [&](Clock::time_point inDeadline) {
+        QTimer::singleShot(std::chrono::duration_cast<std::chrono::milliseconds>(inDeadline - Clock::now()), &loop,
+                           &QEventLoop::quit);
+        loop.exec();
+      });
+}
+#endif
+
+using RunFunction = double (*)(int, int, bool, int, DeliveryRecord&);
 
 void Throughput(benchmark::State& ioState, RunFunction inRun) {
   if (!VerifyMainThread(ioState)) return;
-  const int producerCount = static_cast<int>(ioState.range(0));
-  std::int64_t posts = 0;
+  const int producers = static_cast<int>(ioState.range(0));
   const ThreadPinning pinning;
   for (auto _ : ioState) {
-    DeliveryRecord record(producerCount, kPostsPerProducer, false);
-    const double seconds = inRun(producerCount, kPostsPerProducer, false, record, pinning.ProducerCpu());
-    if (!Verify(ioState, seconds >= 0.0, "a post was not delivered within the time limit")) return;
-    if (!Verify(ioState, record.ExactlyOnce(), "a post was not delivered exactly once")) return;
+    DeliveryRecord record(producers, kPostsPerProducer, false);
+    const double seconds = inRun(producers, kPostsPerProducer, false, pinning.mProducerCpu, record);
+    if (!Verify(ioState, seconds >= 0.0 && record.ExactlyOnce(), "a post was not delivered exactly once in time"))
+      return;
     ioState.SetIterationTime(seconds);
-    posts += record.Total();
   }
-  ioState.SetItemsProcessed(posts);
+  ioState.SetItemsProcessed(static_cast<std::int64_t>(ioState.iterations()) * producers * kPostsPerProducer);
 }
 
 void Latency(benchmark::State& ioState, RunFunction inRun) {
@@ -362,11 +294,11 @@ void Latency(benchmark::State& ioState, RunFunction inRun) {
   const ThreadPinning pinning;
   for (auto _ : ioState) {
     DeliveryRecord record(1, kLatencyPosts, true);
-    const double seconds = inRun(1, kLatencyPosts, true, record, pinning.ProducerCpu());
-    if (!Verify(ioState, seconds >= 0.0, "a post was not delivered within the time limit")) return;
-    if (!Verify(ioState, record.ExactlyOnce(), "a post was not delivered exactly once")) return;
+    const double seconds = inRun(1, kLatencyPosts, true, pinning.mProducerCpu, record);
+    if (!Verify(ioState, seconds >= 0.0 && record.ExactlyOnce(), "a post was not delivered exactly once in time"))
+      return;
     ioState.SetIterationTime(seconds);
-    const std::vector<double> run = record.SortedLatencies();
+    const std::vector<double> run = record.LatenciesMicroseconds();
     latencies.insert(latencies.end(), run.begin(), run.end());
   }
   std::sort(latencies.begin(), latencies.end());
@@ -375,28 +307,100 @@ void Latency(benchmark::State& ioState, RunFunction inRun) {
   };
   ioState.counters["p50_us"] = at(0.50);
   ioState.counters["p99_us"] = at(0.99);
-  ioState.counters["posts"] = static_cast<double>(latencies.size());
+}
+
+// Allocations per post: inPost() posts one message from the calling thread,
+// inRun() delivers on the main thread what was posted. With inFromWorker the
+// posts come from a worker started before counting begins. Three rounds: the
+// first two let the queues reach the capacity they keep.
+template <class Post, class Run>
+void CountPosts(benchmark::State& ioState, const Tally& inTally, bool inFromWorker, Post inPost, Run inRun) {
+  for (auto _ : ioState) {
+    double heap = 0, small = 0;
+    for (int round = 0; round < 3; ++round) {
+      std::atomic<int> step{0};
+      const auto postAll = [&] {
+        for (int i = 0; i < kAllocPosts; ++i) inPost();
+      };
+      std::thread worker;
+      if (inFromWorker)
+        worker = std::thread([&] {
+          while (step.load() == 0) std::this_thread::yield();
+          postAll();
+          step.store(2);
+        });
+      {
+        AllocationCounts counts;
+        step.store(1);
+        if (inFromWorker)
+          while (step.load() != 2) std::this_thread::yield();
+        else postAll();
+        inRun();
+        heap = static_cast<double>(counts.HeapAllocations());
+        small = static_cast<double>(counts.SmallBlocks());
+      }
+      if (worker.joinable()) worker.join();
+    }
+    if (!Verify(ioState, inTally.mCalls == 3 * kAllocPosts, "a post was not delivered exactly once")) return;
+    ioState.counters["heap_allocs_per_op"] = heap / kAllocPosts;
+    ioState.counters["small_blocks_per_op"] = small / kAllocPosts;
+  }
+}
+
+// Tarn: deferred from a worker or from the main thread, or direct (on the
+// main thread with inForceAsync false the post is a broadcast).
+void AllocTarnPost(benchmark::State& ioState, bool inFromWorker, bool inForceAsync) {
+  if (!VerifyMainThread(ioState)) return;
+  Tally tally;
+  TarnTallyListener listener(&tally);
+  Tarn::StationUtils::AddListener(BenchStationID(), &listener);
+  CountPosts(
+      ioState, tally, inFromWorker,
+      [inForceAsync] {
+        Tarn::StationUtils::PostMessageToUIThread(BenchStationID(), PairMessage(kA, kB), inForceAsync);
+      },
+      [] { Tarn::StationUtils::FlushPostedMessagesOnUIThread(); });
+  Tarn::StationUtils::RemoveListener(BenchStationID(), &listener);
+}
+
+void AllocAsioPost(benchmark::State& ioState) {
+  Tally tally;
+  boost::asio::io_context context;
+  CountPosts(
+      ioState, tally, true, [&] { boost::asio::post(context, [&tally] { tally.Add(kA, kB); }); },
+      [&context] {
+        context.run();
+        context.restart();
+      });
 }
 
 const bool sRegistered = [] {
-  const std::pair<const char*, RunFunction> rows[] = {
-      {"Tarn", &RunTarn}, {"Asio", &RunAsio}, {"MutexQueue", &RunMutexQueue}};
-  for (const auto& row : rows) {
-    const RunFunction run = row.second;
-    WithBestOf(benchmark::RegisterBenchmark((std::string("Posting/") + row.first).c_str(),
-                                            [run](benchmark::State& ioState) { Throughput(ioState, run); }))
+  const std::pair<const char*, RunFunction> peers[] = {{"Tarn", &RunTarn},
+                                                       {"Asio", &RunAsio},
+                                                       {"MutexQueue", &RunMutexQueue},
+#if defined(TARN_BENCH_HAVE_QT)
+                                                       {"Qt", &RunQt}
+#endif
+  };
+  for (const auto& [name, run] : peers) {
+    WithBestOf(benchmark::RegisterBenchmark((std::string("Posting/") + name).c_str(),
+                                            [run = run](benchmark::State& ioState) { Throughput(ioState, run); }))
         ->Arg(1)
         ->Arg(2)
         ->UseManualTime()
         ->MinTime(0.3);
-  }
-  for (const auto& row : rows) {
-    const RunFunction run = row.second;
-    WithBestOf(benchmark::RegisterBenchmark((std::string("Latency/") + row.first).c_str(),
-                                            [run](benchmark::State& ioState) { Latency(ioState, run); }))
+    WithBestOf(benchmark::RegisterBenchmark((std::string("Latency/") + name).c_str(),
+                                            [run = run](benchmark::State& ioState) { Latency(ioState, run); }))
         ->Iterations(1)
         ->UseManualTime();
   }
+  const auto once = [](const char* inName, auto inFunction) {
+    benchmark::RegisterBenchmark(inName, inFunction)->Iterations(1)->Repetitions(1);
+  };
+  once("Alloc/Post/TarnDirect", [](benchmark::State& ioState) { AllocTarnPost(ioState, false, false); });
+  once("Alloc/Post/TarnDeferredMain", [](benchmark::State& ioState) { AllocTarnPost(ioState, false, true); });
+  once("Alloc/Post/TarnDeferredWorker", [](benchmark::State& ioState) { AllocTarnPost(ioState, true, false); });
+  once("Alloc/Post/AsioWorker", &AllocAsioPost);
   return true;
 }();
 

@@ -16,7 +16,10 @@ optional=(
   doxygen           # the API reference: the docs target and the docs_build test
   clang-tidy        # the lint target
   clang             # the fuzzer (libFuzzer) and the clang++ header check
-  libsigc++-3.0-dev # one more peer row in the benchmarks
+  libsigc++-3.0-dev # more peer rows in the benchmarks
+  qtbase5-dev       # more peer rows in the benchmarks (Qt 5 signals and queued calls)
+  python3           # the benchmark report (bench/report.py)
+  gnuplot-nox       # the benchmark chart
 )
 
 installed() {

@@ -1,0 +1,62 @@
+#!/usr/bin/env bash
+# Installs a build into a scratch prefix and builds and runs a small consumer
+# (examples/consumer) against it the two ways the README documents:
+#   1. find_package(TarnMessaging) in a CMake project;
+#   2. pkg-config, as C++17 with LD_LIBRARY_PATH and as C++20 with an rpath
+#      (the .pc files must leave the language level to the consumer).
+# Each consumer must load the libraries of the prefix, not of the build tree.
+#
+#   scripts/check-install.sh BUILD_DIR [WORK_DIR]
+#
+# Run by ctest (the install_consumer test). Exits non-zero on the first step
+# that fails, naming it.
+set -euo pipefail
+
+[ $# -ge 1 ] || { echo "usage: $0 BUILD_DIR [WORK_DIR]" >&2; exit 2; }
+source_dir=$(cd "$(dirname "$0")/.." && pwd)
+build_dir=$(cd "$1" && pwd)
+work=${2:-$build_dir/consumer-check}
+prefix=$work/prefix
+consumer=$source_dir/examples/consumer
+CXX=${CXX:-c++}
+
+step() { echo "check-install: $*"; }
+fail() { echo "check-install: FAILED: $*" >&2; exit 1; }
+
+rm -rf "$work"
+mkdir -p "$work"
+step "install into $prefix"
+cmake --install "$build_dir" --prefix "$prefix" > "$work/install.log" || fail "cmake --install (see $work/install.log)"
+libdir=$(dirname "$(find "$prefix" -name 'libTarnMessaging.so*' -print -quit)")
+[ -d "$libdir" ] || fail "no libTarnMessaging.so under $prefix"
+
+# The consumer must have resolved libTarnMessaging to the prefix.
+uses_prefix() {
+  local loaded
+  loaded=$(ldd "$1") || fail "ldd $1"
+  grep -q "libTarnMessaging.so.* => $libdir/" <<< "$loaded" || fail "$1 does not load libTarnMessaging from $libdir"
+}
+
+step "find_package route"
+cmake -S "$consumer" -B "$work/cmake-build" -DCMAKE_PREFIX_PATH="$prefix" -DCMAKE_BUILD_TYPE=Release \
+  -DCMAKE_FIND_PACKAGE_NO_PACKAGE_REGISTRY=ON > "$work/cmake.log" || fail "configuring the consumer (see $work/cmake.log)"
+cmake --build "$work/cmake-build" -j 2 >> "$work/cmake.log" || fail "building the consumer (see $work/cmake.log)"
+uses_prefix "$work/cmake-build/tarn-consumer"
+"$work/cmake-build/tarn-consumer" || fail "the find_package consumer"
+
+step "pkg-config route"
+export PKG_CONFIG_PATH=$libdir/pkgconfig
+cflags=$(pkg-config --cflags TarnMessaging) || fail "pkg-config --cflags TarnMessaging"
+libs=$(pkg-config --libs TarnMessaging) || fail "pkg-config --libs TarnMessaging"
+case " $cflags " in *" -std="*) fail "pkg-config --cflags forces a language level: $cflags" ;; esac
+[ "$(pkg-config --variable=libdir TarnMessaging)" = "$libdir" ] || fail "the .pc file's libdir is not $libdir"
+# shellcheck disable=SC2086 # the flags are word lists
+"$CXX" -std=c++17 $cflags "$consumer/main.cpp" -o "$work/consumer-env" $libs -pthread || fail "building with pkg-config (C++17)"
+LD_LIBRARY_PATH=$libdir uses_prefix "$work/consumer-env"
+LD_LIBRARY_PATH=$libdir "$work/consumer-env" || fail "the pkg-config consumer with LD_LIBRARY_PATH"
+# shellcheck disable=SC2086
+"$CXX" -std=c++20 $cflags "$consumer/main.cpp" -o "$work/consumer-rpath" $libs -pthread -Wl,-rpath,"$libdir" ||
+  fail "building with pkg-config (C++20, rpath)"
+uses_prefix "$work/consumer-rpath"
+"$work/consumer-rpath" || fail "the pkg-config consumer with an rpath"
+step "both routes work"
