@@ -10,12 +10,10 @@ namespace Tarn {
 
 using kivcore::utility::ImmutableString;
 
-// What a registration detaches: either a listener it owns, or an entry on a
-// broadcaster's core. The core is held weakly, so a broadcaster (or station)
+// An entry a registration removes from a broadcaster's core. The core is held weakly, so a broadcaster (or station)
 // destroyed first leaves an expired link instead of freed memory; a core
 // that is still locked but closed simply has no entry to remove.
 struct Registration::Record {
-  SubscriptionDetail::OwnedListener* mOwned = nullptr;
   std::weak_ptr<BroadcasterCore> mCore;
   ListenerEntry mEntry;
 };
@@ -26,20 +24,6 @@ struct RegistrationFactory {
     result.mRecord->mCore = Registration::CoreOf(inBroadcaster);
     result.mRecord->mEntry = inEntry;
     return result;
-  }
-
-  // The listener is disposed of when the record cannot be made, so that a
-  // failed subscription leaves nothing attached.
-  static Registration ForOwned(SubscriptionDetail::OwnedListener* inListener) {
-    Registration::Record* record;
-    try {
-      record = new Registration::Record;
-    } catch (...) {
-      inListener->Dispose();
-      throw;
-    }
-    record->mOwned = inListener;
-    return Registration(record);
   }
 };
 
@@ -111,16 +95,16 @@ Registration& Registration::operator=(Registration&& ioOther) noexcept {
   if (this != &ioOther) {
     Reset();
     mRecord = std::exchange(ioOther.mRecord, nullptr);
+    mOwned = std::exchange(ioOther.mOwned, nullptr);
   }
   return *this;
 }
 
 void Registration::Reset() noexcept {
+  if (SubscriptionDetail::OwnedListener* const owned = std::exchange(mOwned, nullptr)) owned->Dispose();
   Record* const record = std::exchange(mRecord, nullptr);
   if (record == nullptr) return;
-  if (record->mOwned != nullptr) {
-    record->mOwned->Dispose();
-  } else if (const std::shared_ptr<BroadcasterCore> core = record->mCore.lock()) {
+  if (const std::shared_ptr<BroadcasterCore> core = record->mCore.lock()) {
     // Held for the whole removal, which may wait: a broadcaster destroyed
     // meanwhile leaves a closed core, not freed memory. No misuse check: two
     // registrations of one listener may both remove it.
@@ -132,17 +116,18 @@ void Registration::Reset() noexcept {
 void Registration::Release() noexcept {
   // A released subscription's listener is deliberately left allocated: it is
   // still attached and may be delivered to for as long as its broadcaster lives.
+  mOwned = nullptr;
   delete std::exchange(mRecord, nullptr);
 }
 
 Registration Registration::Own(Broadcaster& ioBroadcaster, SubscriptionDetail::OwnedListener* inListener) {
-  Registration result = RegistrationFactory::ForOwned(inListener);
+  Registration result(inListener);  // disposes of the listener if the attach throws
   ioBroadcaster.AddListener(inListener);
   return result;
 }
 
 Registration Registration::Own(const ImmutableString& inStationID, SubscriptionDetail::OwnedListener* inListener) {
-  Registration result = RegistrationFactory::ForOwned(inListener);
+  Registration result(inListener);
   StationHold station(inStationID);
   if (station.get() == nullptr) return Registration();  // result disposes of the listener
   station.get()->AddListener(inListener);
@@ -191,7 +176,8 @@ Registration Attach(const ImmutableString& inStationID, const ISafeListenerRef& 
 
 namespace SubscriptionDetail {
 
-OwnedListener::~OwnedListener() { DetachFromBroadcasters(); }
+// Every derived class detaches in its own destructor, while whole.
+OwnedListener::~OwnedListener() = default;
 
 void OwnedListener::Dispose() noexcept {
   DetachFromBroadcasters();

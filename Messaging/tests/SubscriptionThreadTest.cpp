@@ -24,14 +24,13 @@ using kivcore::utility::ImmutableString;
 struct Listeners {
   static constexpr int kKinds = 5;
   Listeners() {
-    for (RecordingListener* listener : {&mPlain, mBoost.get(), mStd.get()}) listener->SetAction(Hook());
-    Safe()->SetAction(Hook());
+    auto hook = [this](const Tarn::Message&) { Hook(); };
+    for (RecordingListener* listener : {&mPlain, mBoost.get(), mStd.get()}) listener->SetAction(hook);
+    Safe()->SetAction(hook);
   }
   CountedSafeListener* Safe() const { return static_cast<CountedSafeListener*>(mSafe.get()); }
-  messaging_test::CallRecorder::Action Hook() {
-    return [this](const Tarn::Message&) {
-      if (mAction) mAction();
-    };
+  void Hook() const {
+    if (mAction) mAction();
   }
 
   template <class Target>
@@ -42,10 +41,7 @@ struct Listeners {
       case 2: return Tarn::Attach(ioTarget, std::weak_ptr<Tarn::Listener>(mStd));
       case 3: return Tarn::Attach(ioTarget, mSafe);
       default:
-        return Tarn::Subscribe<NumberMessage>(ioTarget, [this](const NumberMessage&) {
-          ++mTyped;
-          if (mAction) mAction();
-        });
+        return Tarn::Subscribe<NumberMessage>(ioTarget, [this](const NumberMessage&) { ++mTyped, Hook(); });
     }
   }
   int Calls(int inKind) const {
@@ -73,13 +69,11 @@ TEST_F(SubscriptionTest, EveryKindDetachesOnDestructionMovesAndIsKeptByRelease) 
   const ImmutableString station = MakeCounted();
   auto check = [](auto& ioTarget, int inKind) {
     Listeners listeners;
-    Registration moved;
-    {
-      Registration first = listeners.Attach(ioTarget, inKind);
-      ASSERT_TRUE(first);
-      Send(ioTarget, 1);
-      moved = std::move(first);
-    }
+    Registration first = listeners.Attach(ioTarget, inKind);
+    ASSERT_TRUE(first);
+    Send(ioTarget, 1);
+    Registration moved(std::move(first));
+    first.Reset();
     Send(ioTarget, 2);  // the moved-from registration detached nothing
     EXPECT_EQ(2, listeners.Calls(inKind));
     moved = Registration();  // the assignment detaches the one it replaces
@@ -97,7 +91,6 @@ TEST_F(SubscriptionTest, EveryKindDetachesOnDestructionMovesAndIsKeptByRelease) 
     check(broadcaster, kind);
     check(station, kind);
   }
-  EXPECT_FALSE(broadcaster.HasListeners());
 }
 
 TEST_F(SubscriptionTest, TypedHandlerSeesOnlyItsTypeAndMayEndItsOwnSubscription) {
@@ -141,7 +134,8 @@ TEST_F(SubscriptionTest, BroadcasterOrStationGoneFirstAndBadInputLeaveNothingToD
   Tarn::Broadcaster broadcaster;
   EXPECT_FALSE(Tarn::Attach(broadcaster, static_cast<Tarn::Listener*>(nullptr)));
   EXPECT_FALSE(Tarn::Attach(broadcaster, std::weak_ptr<Tarn::Listener>()));
-  EXPECT_EQ(2u, dialogs.Count());
+  EXPECT_FALSE(Tarn::Attach(broadcaster, Tarn::ISafeListenerRef()));
+  EXPECT_EQ(4u, dialogs.Count());
   Listeners listeners;
   const ImmutableString unknown = Tarn::StationRegistry::UniqueStationID();
   for (int kind = 0; kind < Listeners::kKinds; ++kind) EXPECT_FALSE(listeners.Attach(unknown, kind));

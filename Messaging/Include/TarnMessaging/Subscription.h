@@ -70,7 +70,8 @@ class OwnedListener;
 class TARN_MESSAGING_API Registration {
 public:
   Registration() noexcept = default;
-  Registration(Registration&& ioOther) noexcept : mRecord(std::exchange(ioOther.mRecord, nullptr)) {}
+  Registration(Registration&& ioOther) noexcept
+      : mRecord(std::exchange(ioOther.mRecord, nullptr)), mOwned(std::exchange(ioOther.mOwned, nullptr)) {}
   /// Detaches what this registration held, then takes over ioOther's.
   Registration& operator=(Registration&& ioOther) noexcept;
   Registration(const Registration&) = delete;
@@ -83,7 +84,7 @@ public:
   /// Gives the registration up: nothing is detached; then empty.
   void Release() noexcept;
   /// Whether this registration still holds something to detach.
-  explicit operator bool() const noexcept { return mRecord != nullptr; }
+  explicit operator bool() const noexcept { return mRecord != nullptr || mOwned != nullptr; }
 
   /// Attaches inListener (which the subscription templates made with new) to
   /// inBroadcaster, or to the station inStationID, and owns it from then on.
@@ -98,9 +99,13 @@ private:
   struct Record;
   friend struct RegistrationFactory;  // the attach helpers, in the library
   explicit Registration(Record* inRecord) noexcept : mRecord(inRecord) {}
+  explicit Registration(SubscriptionDetail::OwnedListener* inOwned) noexcept : mOwned(inOwned) {}
   TARN_MESSAGING_LOCAL static std::weak_ptr<BroadcasterCore> CoreOf(const Broadcaster& inBroadcaster);
 
-  Record* mRecord = nullptr;  // owned
+  // At most one is set, and owned: an entry to remove from a broadcaster,
+  // or a subscription's listener.
+  Record* mRecord = nullptr;
+  SubscriptionDetail::OwnedListener* mOwned = nullptr;
 };
 
 /// Registers inListener on ioBroadcaster as Broadcaster::AddListener does and
