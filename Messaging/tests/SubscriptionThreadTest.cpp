@@ -12,12 +12,11 @@
 
 namespace {
 
+using kivcore::utility::ImmutableString;
 using messaging_test::CountedSafeListener;
-using messaging_test::Latch;
 using messaging_test::NumberMessage;
 using messaging_test::RecordingListener;
 using Tarn::Registration;
-using kivcore::utility::ImmutableString;
 
 // One listener of each kind a registration can hold; every handler runs
 // mAction (set before attaching) and is counted.
@@ -35,14 +34,11 @@ struct Listeners {
 
   template <class Target>
   Registration Attach(Target& ioTarget, int inKind) {
-    switch (inKind) {
-      case 0: return Tarn::Attach(ioTarget, &mPlain);
-      case 1: return Tarn::Attach(ioTarget, boost::weak_ptr<Tarn::Listener>(mBoost));
-      case 2: return Tarn::Attach(ioTarget, std::weak_ptr<Tarn::Listener>(mStd));
-      case 3: return Tarn::Attach(ioTarget, mSafe);
-      default:
-        return Tarn::Subscribe<NumberMessage>(ioTarget, [this](const NumberMessage&) { ++mTyped, Hook(); });
-    }
+    if (inKind == 0) return Tarn::Attach(ioTarget, &mPlain);
+    if (inKind == 1) return Tarn::Attach(ioTarget, boost::weak_ptr<Tarn::Listener>(mBoost));
+    if (inKind == 2) return Tarn::Attach(ioTarget, std::weak_ptr<Tarn::Listener>(mStd));
+    if (inKind == 3) return Tarn::Attach(ioTarget, mSafe);
+    return Tarn::Subscribe<NumberMessage>(ioTarget, [this](const NumberMessage&) { ++mTyped, Hook(); });
   }
   int Calls(int inKind) const {
     const int counts[] = {mPlain.Calls(), mBoost->Calls(), mStd->Calls(), Safe()->Calls(), mTyped.load()};
@@ -74,9 +70,11 @@ TEST_F(SubscriptionTest, EveryKindDetachesOnDestructionMovesAndIsKeptByRelease) 
     Send(ioTarget, 1);
     Registration moved(std::move(first));
     first.Reset();
-    Send(ioTarget, 2);  // the moved-from registration detached nothing
+    first = std::move(moved);  // and back, by assignment
+    moved.Reset();
+    Send(ioTarget, 2);  // neither moved-from registration detached anything
     EXPECT_EQ(2, listeners.Calls(inKind));
-    moved = Registration();  // the assignment detaches the one it replaces
+    first = Registration();  // the assignment detaches the one it replaces
     Send(ioTarget, 3);
     EXPECT_EQ(2, listeners.Calls(inKind));
     if (inKind == 4) return;  // a released subscription would stay attached for good
@@ -106,12 +104,13 @@ TEST_F(SubscriptionTest, TypedHandlerSeesOnlyItsTypeAndMayEndItsOwnSubscription)
   // must still be alive then (ASan).
   self = Tarn::Subscribe<NumberMessage>(station, [&, tag = std::string(40, 'x')](const NumberMessage&) {
     self.Reset();
+    Send(station, 9);  // a nested broadcast no longer reaches it
     oneShot.push_back(tag);
   });
   Tarn::StationUtils::BroadcastMessage(station, messaging_test::PingMessage());
   Send(station, 7);
   Send(station, 8);
-  EXPECT_EQ((std::vector<int>{7, 8}), window.mSeen);
+  EXPECT_EQ((std::vector<int>{9, 7, 8}), window.mSeen);
   EXPECT_EQ(std::vector<std::string>{std::string(40, 'x')}, oneShot);
   EXPECT_FALSE(self);
 }
@@ -146,7 +145,7 @@ TEST_F(SubscriptionTest, DestroyedOnAWorkerDuringItsHandlerReturnsOnlyAfterTheHa
     SCOPED_TRACE(kind);
     Tarn::Broadcaster broadcaster;
     Listeners listeners;
-    Latch entered, workerStarted;
+    messaging_test::Latch entered, workerStarted;
     std::atomic<bool> handlerReturned{false}, destroyed{false};
     listeners.mAction = [&] {
       if (entered.IsReleased()) return;
