@@ -70,6 +70,7 @@ class OwnedListener;
 class TARN_MESSAGING_API Registration {
 public:
   Registration() noexcept = default;
+  /// Takes over ioOther's registration; ioOther is left empty.
   Registration(Registration&& ioOther) noexcept
       : mRecord(std::exchange(ioOther.mRecord, nullptr)), mOwned(std::exchange(ioOther.mOwned, nullptr)) {}
   /// Detaches what this registration held, then takes over ioOther's.
@@ -153,6 +154,7 @@ protected:
   /// Marks one handler call on the main thread for Dispose.
   class Delivery {
   public:
+    /// Counts one handler call on ioListener until the scope ends.
     explicit Delivery(OwnedListener& ioListener) noexcept : mListener(ioListener) { ++mListener.mDepth; }
     ~Delivery() {
       if (--mListener.mDepth == 0 && mListener.mDisposed) delete &mListener;
@@ -173,8 +175,11 @@ private:
 template <class T, class Handler>
 class TypedListener final : public OwnedListener {
 public:
+  /// Keeps inHandler (moved or copied) for the listener's lifetime.
+  /// @{
   explicit TypedListener(Handler&& inHandler) : mHandler(std::move(inHandler)) {}
   explicit TypedListener(const Handler& inHandler) : mHandler(inHandler) {}
+  /// @}
   // Detached while whole: the handler may be running on the main thread.
   ~TypedListener() override { DetachFromBroadcasters(); }
 
@@ -194,6 +199,8 @@ private:
   Handler mHandler;
 };
 
+/// A new listener that calls inHandler for messages of type T; owned by the
+/// caller until it is handed to a Registration.
 template <class T, class Handler>
 OwnedListener* NewTypedListener(Handler&& inHandler) {
   static_assert(std::is_base_of<Message, T>::value, "Subscribe<T>: T must be a message type (MessageImpl<T>)");
@@ -202,6 +209,7 @@ OwnedListener* NewTypedListener(Handler&& inHandler) {
   return new TypedListener<T, Stored>(std::forward<Handler>(inHandler));
 }
 
+/// A handler that calls inMethod on inObject (not owned) with the message.
 template <class T, class Object, class Method>
 auto BindMember(Object* inObject, Method inMethod) {
   return [inObject, inMethod](const T& inMessage) { std::invoke(inMethod, inObject, inMessage); };
