@@ -96,6 +96,11 @@ TEST_F(BroadcasterTest, ListenersDyingWhileTheWalkResolvesThemArePrunedAndNothin
   auto shared = std::make_shared<RecordingListener>("W", &mLog);
   broadcaster.AddListener(std::weak_ptr<Tarn::Listener>(shared));
   shared.reset();
+  RecordingListener probe("P");
+  Tarn::ListenerEntry plain, dead;
+  plain.mListener = &probe;
+  dead.mStdWeakListener = std::weak_ptr<Tarn::Listener>(std::make_shared<RecordingListener>("gone"));
+  EXPECT_TRUE(plain.IsLive() && !dead.IsLive()) << "a plain entry is always live, an expired one never";
   broadcaster.BroadcastMessage(NumberMessage(1));
   EXPECT_EQ(messaging_test::CountedSafeListener::LiveCount(), liveBefore - 1) << "the listener was not served once";
   EXPECT_FALSE(broadcaster.HasListeners()) << "a dead listener was not pruned";

@@ -2,6 +2,8 @@
 // broadcast on them runs, never twice, none lost.
 #include "StationTestSupport.h"
 
+#include <stdexcept>
+
 namespace {
 
 using namespace station_test;
@@ -48,6 +50,23 @@ TEST_F(StationTest, RelayDisposedOrReleasedFromInsideItsOwnBroadcastIsDeletedWhe
     EXPECT_FALSE(source.HasListeners());
     EXPECT_FALSE(first.HasBroadcaster(relay));
   }
+}
+
+// A retain whose factory throws or gives no station is not counted, so a
+// later disposal deletes the record at once instead of waiting for ever.
+TEST_F(StationTest, ARetainThatMakesNoStationLeavesNoCountBehind) {
+  static int sCalls = 0;
+  const ImmutableString id = Registry::UniqueStationID();
+  Registry::RegisterStation(id, [](const ImmutableString& inID) -> Tarn::Station* {
+    if (++sCalls == 1) throw std::runtime_error("factory");
+    return sCalls == 2 ? nullptr : new CountedStation(inID);
+  });
+  EXPECT_THROW(Registry::RetainStation(id), std::runtime_error);
+  EXPECT_EQ(Registry::RetainStation(id), nullptr);
+  ASSERT_NE(Registry::FindStation(id), nullptr);
+  Registry::DisposeStation(id);
+  EXPECT_EQ(StationLog::Destructions(), 1) << "a failed retain kept the station's count up";
+  EXPECT_EQ(Registry::FindStation(id), nullptr);
 }
 
 }  // namespace

@@ -9,6 +9,7 @@
 #include <TarnMessaging/Subscription.h>
 
 #include <optional>
+#include <thread>
 
 namespace {
 
@@ -113,6 +114,13 @@ TEST_F(SubscriptionTest, TypedHandlerSeesOnlyItsTypeAndMayEndItsOwnSubscription)
   EXPECT_EQ((std::vector<int>{9, 7, 8}), window.mSeen);
   EXPECT_EQ(std::vector<std::string>{std::string(40, 'x')}, oneShot);
   EXPECT_FALSE(self);
+  // Ended outside its handler, on the main thread or a worker, it is freed at once.
+  auto token = std::make_shared<int>(0);
+  Registration onMain = Tarn::Subscribe<NumberMessage>(station, [token](const NumberMessage&) {});
+  Registration onWorker = Tarn::Subscribe<NumberMessage>(station, [token](const NumberMessage&) {});
+  onMain.Reset();
+  std::thread([&] { onWorker.Reset(); }).join();
+  EXPECT_EQ(token.use_count(), 1) << "an ended subscription was never freed";
 }
 
 TEST_F(SubscriptionTest, BroadcasterOrStationGoneFirstAndBadInputLeaveNothingToDetach) {
