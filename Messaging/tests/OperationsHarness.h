@@ -205,10 +205,28 @@ public:
     const Node& node = mNodes[inNode];
     // Inside the library, after the last handler it called, the model has yet to walk the rest of the innermost
     // broadcast (and the utilities' release at its end): a station may go only if nobody else is to be called.
-    if (inStation == nullptr && mStale && mFailure.empty() && Next() >= 0)
-      Fatal("a station was deleted while a broadcast on it runs");
+    // A relay retired meanwhile goes as its own outermost broadcast ends, while the walk that reached it goes on:
+    // fine if the model, walking on to the next call, has left every frame of this station behind.
+    bool walkedPast = false;
+    if (inStation == nullptr && mStale && mFailure.empty()) {
+      const std::vector<Frame> frames = mFrames;
+      const std::vector<Level> levels = mLevels;
+      std::vector<Node> nodes(std::begin(mNodes), std::end(mNodes));
+      struct Held { bool mAlive; int mHolds; int mLinks[kNodes]; };
+      std::vector<Held> held;
+      for (const Object& object : mObjects) held.push_back(Held{object.mAlive, object.mHolds, {}}), std::copy(std::begin(object.mLinks), std::end(object.mLinks), held.back().mLinks);
+      const bool timer = mTimerListening;
+      if (Next() >= 0) {
+        if (node.mFrames > 0) Fatal("a station was deleted while a broadcast on it runs");
+        mFrames = frames, mLevels = levels, mTimerListening = timer, walkedPast = true;
+        std::copy(nodes.begin(), nodes.end(), std::begin(mNodes));
+        for (int slot = 0; slot < kSlots; ++slot)
+          mObjects[slot].mAlive = held[slot].mAlive, mObjects[slot].mHolds = held[slot].mHolds,
+          std::copy(std::begin(held[slot].mLinks), std::end(held[slot].mLinks), mObjects[slot].mLinks);
+      }
+    }
     if (inStation != nullptr && mStations[inNode] != nullptr) Fail("two stations of one ID alive");
-    if (inStation == nullptr && node.mFrames > 0) Fatal("a station was deleted while a broadcast on it runs");
+    if (inStation == nullptr && node.mFrames > 0 && !walkedPast) Fatal("a station was deleted while a broadcast on it runs");
     if (inStation == nullptr && node.mMade && !node.mDoomed) Fail("a station was deleted that the registry should keep");
     mStations[inNode] = inStation;
   }
