@@ -8,6 +8,7 @@
 #   make bench  the benchmarks against the peer libraries: the table, the
 #               ratio against each performance target, and the chart
 #   make fuzz   the fuzzer alone (FUZZ_SECONDS=600 make fuzz for longer)
+#   make compile-time  what the headers cost a host source to compile
 # WERROR=ON turns warnings into errors (CI does this).
 
 WERROR ?= OFF
@@ -17,7 +18,7 @@ BUILD = cmake --build --preset $(1) -j $(JOBS)
 DEMO_ARGS ?=
 FUZZ_SECONDS ?= 60
 
-.PHONY: setup build demo test test-default test-tsan test-asan fuzz bench docs lint clean
+.PHONY: setup build demo test test-default test-tsan test-asan fuzz bench compile-time docs lint clean
 
 setup:
 	./scripts/setup.sh
@@ -58,6 +59,11 @@ fuzz: setup
 
 # Builds only the benchmark program; the report and chart need python3 and
 # gnuplot (both optional in setup).
+# Seconds to compile a source declaring one message type, and the umbrella
+# header, at -O0.
+compile-time: setup
+	./scripts/compile-time.sh
+
 bench: setup
 	$(call CONFIGURE,default)
 	cmake --build --preset default -j $(JOBS) --target tarn-bench

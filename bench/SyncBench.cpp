@@ -126,6 +126,21 @@ struct TarnStation : TarnPlain {
   void Emit() { Tarn::StationUtils::BroadcastMessage(BenchStationID(), mMessage); }
 };
 
+// A typed subscription per handler on the same broadcaster: a lambda where
+// TarnPlain has a listener class that compares the message ID itself.
+struct TarnTyped : TarnPlain {
+  struct Handler {
+    Tally* mTally;
+    Tarn::Registration mRegistration;
+  };
+  Handler Make(Tally* inTally) { return {inTally, {}}; }
+  void Connect(Handler& ioHandler) {
+    ioHandler.mRegistration = Tarn::Subscribe<PairMessage>(
+        mBroadcaster, [tally = ioHandler.mTally](const PairMessage& inPair) { tally->Add(inPair.mA, inPair.mB); });
+  }
+  void Disconnect(Handler& ioHandler) { ioHandler.mRegistration.Reset(); }
+};
+
 // A peer with inCount handlers, connected unless told otherwise. Handlers die
 // before the sender; every peer detaches a handler that dies.
 template <class Peer>
@@ -241,6 +256,7 @@ const bool sRegistered = [] {
   Register<QtSlot, true, false>("QtSlot");
 #endif
   Register<TarnPlain>("TarnPlain");
+  Register<TarnTyped>("TarnTyped");
   Register<TarnWeak, false>("TarnWeak");
   Register<TarnStation, false>("TarnStation");
   return true;

@@ -22,31 +22,18 @@ struct Progress : Tarn::MessageImpl<Progress> {
 constexpr int kWorkers = 3;
 constexpr int kStepsPerWorker = 1000;
 
-class ProgressBar : public Tarn::Listener {
-public:
-  explicit ProgressBar(boost::asio::io_context& inContext) : mContext(inContext) {}
-  void ListenToMessage(const Tarn::Message& inMessage) override {
-    if (inMessage.GetMessageID() != Progress::StaticMessageID()) return;
-    const auto& progress = static_cast<const Progress&>(inMessage);
-    if (progress.mDone == kStepsPerWorker) std::printf("worker %d finished\n", progress.mWorker);
-    // The last message quits the loop; the listener runs on the main thread,
-    // so no lock guards the count.
-    if (++mReceived == kWorkers * kStepsPerWorker) mContext.stop();
-  }
-  int mReceived = 0;
-
-private:
-  boost::asio::io_context& mContext;
-};
-
 int main() {
   Tarn::Messaging::Initialize();  // this thread is the main thread from now on
   int received = 0;
   unsigned long long handlers = 0;
   {
     boost::asio::io_context context;
-    ProgressBar bar(context);
-    Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &bar);
+    // Runs on the main thread, so no lock guards the count; the last message
+    // quits the loop.
+    Tarn::Registration bar = Tarn::Subscribe<Progress>(Tarn::kStation_StatusBar, [&](const Progress& inProgress) {
+      if (inProgress.mDone == kStepsPerWorker) std::printf("worker %d finished\n", inProgress.mWorker);
+      if (++received == kWorkers * kStepsPerWorker) context.stop();
+    });
     Tarn::Integration::AsioEventLoop messaging(context);
 
     std::vector<std::thread> workers;
@@ -67,9 +54,8 @@ int main() {
     context.run();
     for (std::thread& worker : workers) worker.join();
 
-    received = bar.mReceived;
     handlers = messaging.ScheduledRuns();
-    Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &bar);
+    bar.Reset();
   }  // the integration goes before the library does
   Tarn::Messaging::Terminate();
   std::printf("%d messages received through %llu io_context handlers\n", received, handlers);

@@ -19,23 +19,6 @@ struct Progress : Tarn::MessageImpl<Progress> {
 constexpr int kWorkers = 3;
 constexpr int kStepsPerWorker = 1000;
 
-class ProgressBar : public Tarn::Listener {
-public:
-  explicit ProgressBar(GMainLoop* inLoop) : mLoop(inLoop) {}
-  void ListenToMessage(const Tarn::Message& inMessage) override {
-    if (inMessage.GetMessageID() != Progress::StaticMessageID()) return;
-    const auto& progress = static_cast<const Progress&>(inMessage);
-    if (progress.mDone == kStepsPerWorker) std::printf("worker %d finished\n", progress.mWorker);
-    // The last message quits the loop; the listener runs on the main thread,
-    // so no lock guards the count.
-    if (++mReceived == kWorkers * kStepsPerWorker) g_main_loop_quit(mLoop);
-  }
-  int mReceived = 0;
-
-private:
-  GMainLoop* mLoop;
-};
-
 int main() {
   Tarn::Messaging::Initialize();  // this thread is the main thread from now on
   int received = 0;
@@ -43,8 +26,12 @@ int main() {
   {
     GMainContext* context = g_main_context_new();
     GMainLoop* loop = g_main_loop_new(context, FALSE);
-    ProgressBar bar(loop);
-    Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &bar);
+    // Runs on the main thread, so no lock guards the count; the last message
+    // quits the loop.
+    Tarn::Registration bar = Tarn::Subscribe<Progress>(Tarn::kStation_StatusBar, [&](const Progress& inProgress) {
+      if (inProgress.mDone == kStepsPerWorker) std::printf("worker %d finished\n", inProgress.mWorker);
+      if (++received == kWorkers * kStepsPerWorker) g_main_loop_quit(loop);
+    });
     Tarn::Integration::GLibEventLoop messaging(context);  // holds its own reference on the context
 
     std::vector<std::thread> workers;
@@ -70,9 +57,8 @@ int main() {
     g_source_unref(giveUp);
     for (std::thread& worker : workers) worker.join();
 
-    received = bar.mReceived;
     sources = messaging.ScheduledRuns();
-    Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &bar);
+    bar.Reset();
     g_main_loop_unref(loop);
     g_main_context_unref(context);
   }  // the integration goes before the library does, and drops the last reference on the context

@@ -1,6 +1,6 @@
-// The smallest complete use of the library: a message type, a listener on a
-// well-known station, a post from a worker thread, and the main thread
-// running its pending calls.
+// The smallest complete use of the library: a message type, a typed
+// subscription to a well-known station, a post from a worker thread, and the
+// main thread running its pending calls.
 #include <TarnMessaging.h>
 
 #include <cstdio>
@@ -12,21 +12,14 @@ struct Progress : Tarn::MessageImpl<Progress> {
   int mTotal;
 };
 
-class StatusLine : public Tarn::Listener {
-public:
-  void ListenToMessage(const Tarn::Message& inMessage) override {
-    if (inMessage.GetMessageID() != Progress::StaticMessageID()) return;
-    const auto& progress = static_cast<const Progress&>(inMessage);
-    std::printf("received Progress %d/%d on the main thread\n", progress.mDone, progress.mTotal);
-    ++mReceived;
-  }
-  int mReceived = 0;
-};
-
 int main() {
   Tarn::Messaging::Initialize();  // this thread is the main thread from now on
-  StatusLine line;
-  Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &line);
+  int received = 0;
+  Tarn::Registration line =
+      Tarn::Subscribe<Progress>(Tarn::kStation_StatusBar, [&received](const Progress& inProgress) {
+        std::printf("received Progress %d/%d on the main thread\n", inProgress.mDone, inProgress.mTotal);
+        ++received;
+      });
 
   Tarn::StationUtils::BroadcastMessage(Tarn::kStation_StatusBar, Progress(0, 3));  // delivered at once
   std::thread worker([] {
@@ -36,8 +29,8 @@ int main() {
   worker.join();
   Tarn::StationUtils::FlushPostedMessagesOnUIThread();  // the three posts arrive here
 
-  Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &line);
+  line.Reset();  // detached before the library goes
   Tarn::Messaging::Terminate();
-  std::printf("%d messages received\n", line.mReceived);
-  return line.mReceived == 4 ? 0 : 1;
+  std::printf("%d messages received\n", received);
+  return received == 4 ? 0 : 1;
 }

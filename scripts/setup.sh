@@ -20,6 +20,7 @@ optional=(
   qtbase5-dev       # more peer rows in the benchmarks (Qt 5 signals and queued calls)
   python3           # the benchmark report (bench/report.py)
   gnuplot-nox       # the benchmark chart
+  time              # make compile-time (GNU time's CPU seconds)
 )
 
 installed() {

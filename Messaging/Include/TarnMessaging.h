@@ -14,6 +14,7 @@
 #include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationRegistry.h>
 #include <TarnMessaging/StationUtils.h>
+#include <TarnMessaging/Subscription.h>
 
 /// @namespace Tarn
 /// The messaging library's public classes and functions: messages,

@@ -104,7 +104,13 @@ constexpr std::size_t kMessageOffset =
     (sizeof(PostedCopy) + alignof(std::max_align_t) - 1) / alignof(std::max_align_t) * alignof(std::max_align_t);
 
 void ReleasePostedCopy(PostedCopy* inCopy) noexcept {
-  if (inCopy->mOwners.fetch_sub(1, std::memory_order_acq_rel) != 1) return;
+  // A queued post has one owner when it is released: nobody else can then
+  // take a new one, so the read-modify-write (a locked bus cycle per post)
+  // is needed only while a copy of the function object is alive. The
+  // acquire pairs with the release of the owners that went before.
+  if (inCopy->mOwners.load(std::memory_order_acquire) != 1 &&
+      inCopy->mOwners.fetch_sub(1, std::memory_order_acq_rel) != 1)
+    return;
   const std::size_t size = inCopy->mBlockSize;
   inCopy->mMessage->~Message();
   inCopy->~PostedCopy();
@@ -112,20 +118,28 @@ void ReleasePostedCopy(PostedCopy* inCopy) noexcept {
 }
 
 // The function object CreateCallback returns: one pointer, so that it lies
-// inside the boost::function and costs no allocation of its own.
+// inside the boost::function and costs no allocation of its own. Made empty
+// and given its copy once inside the function object: boost::function copies
+// the object it is built from several times on the way in, and each copy of
+// a full one would cost two atomic updates of the owner count.
 class PostedCall {
 public:
-  explicit PostedCall(PostedCopy* inCopy) noexcept : mCopy(inCopy) {}
+  PostedCall() noexcept : mCopy(nullptr) {}
   PostedCall(const PostedCall& inOther) noexcept : mCopy(inOther.mCopy) {
-    mCopy->mOwners.fetch_add(1, std::memory_order_relaxed);
+    if (mCopy != nullptr) mCopy->mOwners.fetch_add(1, std::memory_order_relaxed);
   }
   PostedCall& operator=(const PostedCall&) = delete;
-  ~PostedCall() { ReleasePostedCopy(mCopy); }
+  ~PostedCall() {
+    if (mCopy != nullptr) ReleasePostedCopy(mCopy);
+  }
+
+  // Takes over the one owner that CreateCallback made.
+  void Adopt(PostedCopy* inCopy) noexcept { mCopy = inCopy; }
 
   void operator()() const { StationUtils::BroadcastMessage(mCopy->mStationID, *mCopy->mMessage); }
 
 private:
-  PostedCopy* mCopy;  // one of its owners
+  PostedCopy* mCopy;  // one of its owners; null only before Adopt
 };
 static_assert(boost::detail::function::function_allows_small_object_optimization<PostedCall>::value,
               "a posted call must fit inside boost::function");
@@ -148,7 +162,9 @@ boost::function<void()> MessageImplBase::CreateCallback(const ImmutableString& i
     SmallBlockAllocator::Dispose(block, size);
     throw;
   }
-  return boost::function<void()>(PostedCall(copy));
+  boost::function<void()> call{PostedCall()};
+  call.target<PostedCall>()->Adopt(copy);
+  return call;
 }
 
 }  // namespace Detail

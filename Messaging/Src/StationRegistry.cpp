@@ -135,7 +135,7 @@ void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
     if (doomed == ioList.end()) break;
     Station* const station = doomed->mStation;
     ioList.erase(doomed);
-    delete station;
+    StationRetirement::Delete(station);
   }
   sHasRetired.store(std::any_of(ioList.begin(), ioList.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
   // An empty list keeps no storage, so that a drained registry holds no
@@ -271,10 +271,10 @@ void ReleaseStation(const ImmutableString& inStationID) {
   // Deleted after the lock is released: on a worker thread the station's
   // destructor waits for a delivery to it running on the main thread, whose
   // handlers must be able to reach the registry meanwhile. Nobody else can
-  // reach the station: its record is gone, and a worker never deletes a
-  // station whose destructor is not yet running while the main thread
-  // relays through it, because that destructor detaches it first.
-  delete doomed;
+  // reach the station: its record is gone, and it is detached before any part
+  // of it (a host's derived station's included) is destroyed, so the main
+  // thread never relays through a half-destroyed station.
+  StationRetirement::Delete(doomed);
 }
 
 void DisposeStation(const ImmutableString& inStationID) {
@@ -299,7 +299,7 @@ void DisposeStation(const ImmutableString& inStationID) {
   record.mStation = nullptr;
   map->erase(found);
   if (deleteNow) {
-    delete station;
+    StationRetirement::Delete(station);
   } else if (station != nullptr && onMainThread) {
     Retire(station);
   } else if (station != nullptr) {
@@ -333,7 +333,7 @@ void Terminate() {
       RegistryLock lock("StationRegistry::Terminate");
       Retire(station);
     } else {
-      delete station;
+      StationRetirement::Delete(station);
     }
   }
   RegistryLock lock("StationRegistry::Terminate");

@@ -21,6 +21,14 @@ public:
   // Deletes every retired or queued station that no broadcast holds any
   // more. Cheap when there is none. Defined with the registry.
   static void DrainRetired();
+  // How the registry deletes a station it owns: detached first, while the
+  // whole object (a host's derived station included) still stands, so that
+  // a delivery to it on another thread ends before any part is destroyed.
+  static void Delete(Station* inStation) noexcept {
+    if (inStation == nullptr) return;
+    inStation->DetachFromBroadcasters();
+    delete inStation;
+  }
 };
 
 }  // namespace Tarn

@@ -11,6 +11,7 @@
 #include <memory>
 #include <optional>
 #include <set>
+#include <stdexcept>
 #include <typeinfo>
 
 const Tarn::Message& OtherUnitProgress();  // MessageOtherUnit.cpp
@@ -28,6 +29,12 @@ struct Progress : Tarn::MessageImpl<Progress> {
 // Holds a share of mToken, so that its destruction shows.
 struct Tracked : Tarn::MessageImpl<Tracked> {
   std::shared_ptr<int> mToken = std::make_shared<int>(0);
+};
+
+// A message whose copy fails, as one holding a resource that runs out would.
+struct Uncopyable : Tarn::MessageImpl<Uncopyable> {
+  Uncopyable() = default;
+  Uncopyable(const Uncopyable& inOther) : Tarn::MessageImpl<Uncopyable>(inOther) { throw std::runtime_error("copy"); }
 };
 
 std::size_t BlocksInUse() { return SmallBlockAllocator::GetStatistics().blocksInUse; }
@@ -114,6 +121,8 @@ TEST(MessageCallback, ACallbackCarriesACopyTakenWhenMadeInOneBlockFreedWithItsLa
     EXPECT_EQ(BlocksInUse(), blocksBefore + 1);
     const boost::function<void()> neverRun = tracked.CreateCallback(Tarn::kStation_StatusBar);
     EXPECT_EQ(tracked.mToken.use_count(), 2);
+    // A copy that throws leaves no block behind.
+    EXPECT_THROW(Uncopyable().CreateCallback(Tarn::kStation_StatusBar), std::runtime_error);
   }
   EXPECT_EQ(tracked.mToken.use_count(), 1) << "the posted copy was never destroyed";
   EXPECT_EQ(BlocksInUse(), blocksBefore) << "the posted copies' block was not returned";

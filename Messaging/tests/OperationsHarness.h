@@ -597,7 +597,10 @@ inline std::string RunSequence(Choices& ioChoices, int inSteps) {
 }
 
 // For RunConcurrent: a call after the listener's removal returned is a fault.
+// Destroyed on the worker while the main thread may be delivering to it, so it detaches while still whole, as the
+// listener contract asks of such a class.
 struct Watcher : Tarn::Listener {
+  ~Watcher() override { DetachFromBroadcasters(); }
   void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0; }
   std::atomic<bool> mRemoved{false};
   static inline std::atomic<int> sLateCalls{0};

@@ -38,6 +38,7 @@
 namespace station_test {
 
 using kivcore::utility::ImmutableString;
+using messaging_test::NumberMessage;
 
 // ---------------------------------------------------------------------------
 // Stations that count their lives

@@ -40,6 +40,10 @@ public:
     std::unique_lock<std::mutex> lock(mMutex);
     return mReached.wait_for(lock, inTimeout, [this] { return mCount == 0; });
   }
+  bool IsReleased() {
+    std::lock_guard<std::mutex> lock(mMutex);
+    return mCount == 0;
+  }
 
 private:
   std::mutex mMutex;

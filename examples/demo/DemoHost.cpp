@@ -81,7 +81,8 @@ private:
 
   // The listeners, one of each kind.
   StatusBar mStatusBar;                                // plain pointer
-  const boost::shared_ptr<ProgressTally> mTally;       // boost::weak_ptr
+  ProgressTally mTally;                                // typed subscription
+  Tarn::Registration mTallyRegistration;
   const std::shared_ptr<AutosaveScheduler> mAutosave;  // std::weak_ptr
   LifecycleListener* const mLifecycleObject;           // counted safe listener,
   const Tarn::ISafeListenerRef mLifecycle;             //   owned by this reference
@@ -115,7 +116,6 @@ DemoApplication::DemoApplication(const DemoOptions& inOptions, const DropLedger&
       mMainThread(kivcore::threads::GetRegisteredMainThread()),
       mPerWorker(ShareOut(inOptions.mMessages, inOptions.mWorkers)),
       mStatusBar(ChooseDisplay(inOptions), mPerWorker, inLedger),
-      mTally(boost::make_shared<ProgressTally>()),
       mAutosave(std::make_shared<AutosaveScheduler>(inOptions.mIdleMilliSeconds)),
       mLifecycleObject(new LifecycleListener),
       mLifecycle(mLifecycleObject),
@@ -140,7 +140,7 @@ void DemoApplication::Run(DemoSummary& ioSummary) {
 
 void DemoApplication::AttachListeners() {
   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &mStatusBar);
-  Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, boost::weak_ptr<Tarn::Listener>(mTally));
+  mTallyRegistration = Tarn::Subscribe<ProgressMessage>(Tarn::kStation_StatusBar, &mTally, &ProgressTally::OnProgress);
   mAutosave->Attach(mAutosave);
   Tarn::StationUtils::AddListener(Tarn::kStation_AppSuspend, mLifecycle);
   Tarn::StationUtils::AddListener(Tarn::kStation_AppResume, mLifecycle);
@@ -248,7 +248,7 @@ void DemoApplication::ShutDown(DemoSummary& ioSummary) {
   mStatusBar.Finish();
 
   Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &mStatusBar);
-  Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, boost::weak_ptr<Tarn::Listener>(mTally));
+  mTallyRegistration.Reset();
   mAutosave->Detach(mAutosave);
   Tarn::StationUtils::RemoveListener(Tarn::kStation_AppSuspend, mLifecycle);
   Tarn::StationUtils::RemoveListener(Tarn::kStation_AppResume, mLifecycle);
@@ -262,7 +262,7 @@ void DemoApplication::CollectFigures(DemoSummary& ioSummary) {
   s.mArrivedWhileBroadcasting = mLedger.mArrivedWhileBroadcasting;
   s.mDuplicates = mStatusBar.Duplicates();
   s.mStrays = mStatusBar.Strays();
-  s.mBoostWeakHeard = mTally->Heard();
+  s.mTypedHeard = mTally.Heard();
   s.mStdWeakHeard = mAutosave->ProgressHeard();
   s.mDetachedListenerHeard = mProbe->mHeard.load();
   s.mDetachViolations = mProbe->mViolations.load();

@@ -6,10 +6,6 @@
 
 namespace tarn_demo {
 
-void ProgressTally::ListenToMessage(const Tarn::Message& inMessage) {
-  if (inMessage.GetMessageID() == ProgressMessage::StaticMessageID()) ++mHeard;
-}
-
 AutosaveScheduler::AutosaveScheduler(std::uint32_t inIdleMilliSeconds) {
   mTimer.SetDuration(inIdleMilliSeconds);
   mTimer.SetCookie(kAutosaveCookie);

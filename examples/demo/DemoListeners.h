@@ -1,7 +1,6 @@
-// The listeners of tarn-demo beside the status bar, one for each remaining
-// way a station can hold a listener:
+// The listeners of tarn-demo beside the status bar:
 //
-//   ProgressTally       held by boost::weak_ptr on kStation_StatusBar
+//   ProgressTally       a typed subscription to kStation_StatusBar's progress
 //   AutosaveScheduler   held by std::weak_ptr on kStation_StatusBar and on
 //                       its timer's station
 //   LifecycleListener   a counted safe listener on kStation_AppSuspend and
@@ -12,6 +11,8 @@
 // Threading: handlers run on the main thread. Only DetachingListener is
 // destroyed elsewhere; its probe is atomic for that reason.
 #pragma once
+
+#include "DemoMessages.h"
 
 #include <TarnMessaging.h>
 
@@ -24,10 +25,10 @@
 namespace tarn_demo {
 
 // Counts the progress messages it hears; its count must match the status
-// bar's.
-class ProgressTally : public Tarn::Listener {
+// bar's. Not a listener: Tarn::Subscribe calls OnProgress for progress only.
+class ProgressTally {
 public:
-  void ListenToMessage(const Tarn::Message& inMessage) override;
+  void OnProgress(const ProgressMessage&) { ++mHeard; }
   std::uint64_t Heard() const { return mHeard; }
 
 private:

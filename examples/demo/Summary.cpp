@@ -46,8 +46,8 @@ void CheckSummary(DemoSummary& ioSummary) {
   if (s.mArrivedWhileBroadcasting != s.mDelivered)
     AddFault(s, "the status-bar station broadcast " + Count(s.mArrivedWhileBroadcasting) +
                     " progress messages but the status bar heard " + Count(s.mDelivered));
-  if (s.mBoostWeakHeard != s.mDelivered)
-    AddFault(s, "the boost::weak_ptr listener heard " + Count(s.mBoostWeakHeard) + " messages, the status bar " +
+  if (s.mTypedHeard != s.mDelivered)
+    AddFault(s, "the typed subscription heard " + Count(s.mTypedHeard) + " messages, the status bar " +
                     Count(s.mDelivered));
   if (s.mStdWeakHeard != s.mDelivered)
     AddFault(s, "the std::weak_ptr listener heard " + Count(s.mStdWeakHeard) + " messages, the status bar " +

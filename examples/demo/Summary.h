@@ -30,7 +30,7 @@ struct DemoSummary {
 
   // Cross-checks: what the other listeners and the station itself counted.
   std::uint64_t mArrivedWhileBroadcasting = 0;  // the station's own count of what it delivered
-  std::uint64_t mBoostWeakHeard = 0;
+  std::uint64_t mTypedHeard = 0;
   std::uint64_t mStdWeakHeard = 0;
   std::uint64_t mDetachedListenerHeard = 0;
   std::uint64_t mDetachViolations = 0;

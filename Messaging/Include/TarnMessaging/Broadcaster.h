@@ -140,6 +140,7 @@ public:
 
 private:
   friend class BroadcasterCore;
+  friend class Registration;  // holds mCore weakly, to detach safely after this is gone
   struct BroadcastMessageRecord;
   TARN_MESSAGING_LOCAL static int DeliverToListener(const BroadcastMessageRecord& inRecord);
 

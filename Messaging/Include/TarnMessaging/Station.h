@@ -15,7 +15,11 @@
 /// Threading: as Broadcaster and Listener. The destructor first detaches the
 /// station's listener part while the station is still whole (off the main
 /// thread that waits for a relay through it running on the main thread), then
-/// takes the registry's lock for one lookup.
+/// takes the registry's lock for one lookup. The registry detaches a station
+/// it deletes before its destructor starts, so a derived station class the
+/// registry owns is never reached half-destroyed either; a derived station
+/// the host deletes itself on a worker calls DetachFromBroadcasters() first
+/// in its own destructor (Listener.h).
 ///
 /// When a station dies: the registry never deletes a station while a
 /// broadcast on it runs on the main thread (its own, or a relay of what it

@@ -1,0 +1,197 @@
+#include <TarnMessaging/Station.h>
+#include <TarnMessaging/StationRegistry.h>
+#include <TarnMessaging/Subscription.h>
+
+#include "BroadcasterCore.h"
+
+#include <kivcore/MainThread.h>
+
+namespace Tarn {
+
+using kivcore::utility::ImmutableString;
+
+// An entry a registration removes from a broadcaster's core. The core is held weakly, so a broadcaster (or station)
+// destroyed first leaves an expired link instead of freed memory; a core
+// that is still locked but closed simply has no entry to remove.
+struct Registration::Record {
+  std::weak_ptr<BroadcasterCore> mCore;
+  ListenerEntry mEntry;
+};
+
+struct RegistrationFactory {
+  static Registration ForEntry(const Broadcaster& inBroadcaster, const ListenerEntry& inEntry) {
+    Registration result(new Registration::Record);
+    result.mRecord->mCore = Registration::CoreOf(inBroadcaster);
+    result.mRecord->mEntry = inEntry;
+    return result;
+  }
+};
+
+namespace {
+
+// Retains the station registered under an ID for one call. The ID is copied:
+// the release may delete the station, and the caller's string with it.
+class StationHold {
+public:
+  explicit StationHold(const ImmutableString& inStationID)
+      : mStation(StationRegistry::RetainStation(inStationID)), mStationID(inStationID) {}
+  ~StationHold() {
+    if (mStation != nullptr) StationRegistry::ReleaseStation(mStationID);
+  }
+  StationHold(const StationHold&) = delete;
+  StationHold& operator=(const StationHold&) = delete;
+
+  Station* get() const noexcept { return mStation; }
+
+private:
+  Station* const mStation;
+  const ImmutableString mStationID;
+};
+
+// The broadcaster's AddListener reports misuse; an input it refused gives an
+// empty registration, never a record that would remove something else later.
+Registration AttachPlain(Broadcaster& ioBroadcaster, Listener* inListener) {
+  ioBroadcaster.AddListener(inListener);
+  if (inListener == nullptr) return Registration();
+  ListenerEntry entry;
+  entry.mListener = inListener;
+  return RegistrationFactory::ForEntry(ioBroadcaster, entry);
+}
+
+template <class WeakPtr>
+Registration AttachWeak(Broadcaster& ioBroadcaster, const WeakPtr& inListener, WeakPtr ListenerEntry::*inField) {
+  ioBroadcaster.AddListener(inListener);
+  if (inListener.expired()) return Registration();
+  ListenerEntry entry;
+  entry.*inField = inListener;
+  return RegistrationFactory::ForEntry(ioBroadcaster, entry);
+}
+
+Registration AttachSafe(Broadcaster& ioBroadcaster, const ISafeListenerRef& inListener) {
+  ioBroadcaster.AddListener(inListener);
+  ListenerEntry entry;
+  // The weak-reference block, not a counted reference: the registration
+  // must not keep the listener alive.
+  entry.mSafeListener = GetSafeListenerHandle(inListener);
+  if (!entry.mSafeListener) return Registration();
+  return RegistrationFactory::ForEntry(ioBroadcaster, entry);
+}
+
+template <class Attacher>
+Registration AttachToStation(const ImmutableString& inStationID, Attacher inAttach) {
+  StationHold station(inStationID);
+  if (station.get() == nullptr) return Registration();
+  return inAttach(*station.get());
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------
+// Registration
+
+std::weak_ptr<BroadcasterCore> Registration::CoreOf(const Broadcaster& inBroadcaster) { return inBroadcaster.mCore; }
+
+Registration& Registration::operator=(Registration&& ioOther) noexcept {
+  if (this != &ioOther) {
+    Reset();
+    mRecord = std::exchange(ioOther.mRecord, nullptr);
+    mOwned = std::exchange(ioOther.mOwned, nullptr);
+  }
+  return *this;
+}
+
+void Registration::Reset() noexcept {
+  if (SubscriptionDetail::OwnedListener* const owned = std::exchange(mOwned, nullptr)) owned->Dispose();
+  Record* const record = std::exchange(mRecord, nullptr);
+  if (record == nullptr) return;
+  if (const std::shared_ptr<BroadcasterCore> core = record->mCore.lock()) {
+    // Held for the whole removal, which may wait: a broadcaster destroyed
+    // meanwhile leaves a closed core, not freed memory. No misuse check: two
+    // registrations of one listener may both remove it.
+    core->Remove(record->mEntry, record->mEntry.mListener, BroadcasterCore::Wait::kForOtherThreads, false);
+  }
+  delete record;
+}
+
+void Registration::Release() noexcept {
+  // A released subscription's listener is deliberately left allocated: it is
+  // still attached and may be delivered to for as long as its broadcaster lives.
+  mOwned = nullptr;
+  delete std::exchange(mRecord, nullptr);
+}
+
+Registration Registration::Own(Broadcaster& ioBroadcaster, SubscriptionDetail::OwnedListener* inListener) {
+  Registration result(inListener);  // disposes of the listener if the attach throws
+  ioBroadcaster.AddListener(inListener);
+  return result;
+}
+
+Registration Registration::Own(const ImmutableString& inStationID, SubscriptionDetail::OwnedListener* inListener) {
+  Registration result(inListener);
+  StationHold station(inStationID);
+  if (station.get() == nullptr) return Registration();  // result disposes of the listener
+  station.get()->AddListener(inListener);
+  return result;
+}
+
+// ---------------------------------------------------------------------------
+// Attach
+
+Registration Attach(Broadcaster& ioBroadcaster, Listener* inListener) { return AttachPlain(ioBroadcaster, inListener); }
+
+Registration Attach(Broadcaster& ioBroadcaster, const boost::weak_ptr<Listener>& inListener) {
+  return AttachWeak(ioBroadcaster, inListener, &ListenerEntry::mBoostWeakListener);
+}
+
+Registration Attach(Broadcaster& ioBroadcaster, const std::weak_ptr<Listener>& inListener) {
+  return AttachWeak(ioBroadcaster, inListener, &ListenerEntry::mStdWeakListener);
+}
+
+Registration Attach(Broadcaster& ioBroadcaster, const ISafeListenerRef& inListener) {
+  return AttachSafe(ioBroadcaster, inListener);
+}
+
+Registration Attach(const ImmutableString& inStationID, Listener* inListener) {
+  return AttachToStation(inStationID, [&](Broadcaster& ioStation) { return AttachPlain(ioStation, inListener); });
+}
+
+Registration Attach(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener) {
+  return AttachToStation(inStationID, [&](Broadcaster& ioStation) {
+    return AttachWeak(ioStation, inListener, &ListenerEntry::mBoostWeakListener);
+  });
+}
+
+Registration Attach(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener) {
+  return AttachToStation(inStationID, [&](Broadcaster& ioStation) {
+    return AttachWeak(ioStation, inListener, &ListenerEntry::mStdWeakListener);
+  });
+}
+
+Registration Attach(const ImmutableString& inStationID, const ISafeListenerRef& inListener) {
+  return AttachToStation(inStationID, [&](Broadcaster& ioStation) { return AttachSafe(ioStation, inListener); });
+}
+
+// ---------------------------------------------------------------------------
+// Subscription listeners
+
+namespace SubscriptionDetail {
+
+// Every derived class detaches in its own destructor, while whole.
+OwnedListener::~OwnedListener() = default;
+
+void OwnedListener::Dispose() noexcept {
+  DetachFromBroadcasters();
+  // Deliveries run on the main thread only. Off it, the detach above has
+  // waited for any of them (and mDepth is not read there); on it, a running
+  // one is on this very stack, and its handler (with what it captured) must
+  // outlive its return.
+  if (kivcore::threads::CurrentThreadIsMainThread() && mDepth > 0) {
+    mDisposed = true;
+    return;
+  }
+  delete this;
+}
+
+}  // namespace SubscriptionDetail
+
+}  // namespace Tarn
