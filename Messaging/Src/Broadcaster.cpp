@@ -7,7 +7,6 @@
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
-#include <boost/bind/bind.hpp>
 #include <boost/function.hpp>
 #include <boost/make_shared.hpp>
 
@@ -81,20 +80,27 @@ const BroadcasterCore::Waiter* BroadcasterCore::WaiterList::find(const ListenerE
   return nullptr;
 }
 
+bool BroadcasterCore::IdentityOrder::operator()(const ListenerEntry& inA, const ListenerEntry& inB) const noexcept {
+  if (inA.mListener != inB.mListener) return std::less<Listener*>()(inA.mListener, inB.mListener);
+  if (inA.mSafeListener.get() != inB.mSafeListener.get())
+    return std::less<WeakReference*>()(inA.mSafeListener.get(), inB.mSafeListener.get());
+  // Owners compare by their control blocks, which the indexed weak pointer
+  // keeps alive: the order holds after the listener has died.
+  if (inA.mBoostWeakListener.owner_before(inB.mBoostWeakListener)) return true;
+  if (inB.mBoostWeakListener.owner_before(inA.mBoostWeakListener)) return false;
+  return inA.mStdWeakListener.owner_before(inB.mStdWeakListener);
+}
+
+std::size_t BroadcasterCore::PositionOf(std::uint64_t inSerial) const noexcept {
+  const auto at = std::lower_bound(mEntries.begin(), mEntries.end(), inSerial,
+                                   [](const StoredEntry& inStored, std::uint64_t inKey) { return inStored.mSerial < inKey; });
+  return static_cast<std::size_t>(at - mEntries.begin());
+}
+
 std::ptrdiff_t BroadcasterCore::Find(const ListenerEntry& inEntry) const noexcept {
-  const std::ptrdiff_t count = static_cast<std::ptrdiff_t>(mEntries.size());
-  if (inEntry.mListener != nullptr) {
-    // Every entry has one field set, so an entry holding this pointer is a
-    // plain one and equal to the probe: the pointer alone decides.
-    for (std::ptrdiff_t index = count - 1; index >= 0; --index) {
-      if (mEntries[static_cast<std::size_t>(index)].mEntry.mListener == inEntry.mListener) return index;
-    }
-    return -1;
-  }
-  for (std::ptrdiff_t index = count - 1; index >= 0; --index) {
-    if (mEntries[static_cast<std::size_t>(index)].mEntry == inEntry) return index;
-  }
-  return -1;
+  const auto found = mIndex.find(inEntry);
+  if (found == mIndex.end()) return -1;
+  return static_cast<std::ptrdiff_t>(PositionOf(found->second));
 }
 
 bool BroadcasterCore::OtherThreadDelivers(const ListenerEntry& inEntry, std::uintptr_t inSelf) const noexcept {
@@ -125,22 +131,21 @@ void BroadcasterCore::Unlink(Frame& ioFrame) noexcept {
 
 bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
   Locked lock(mMutex, "Broadcaster::AddListener");
-  {
-    Locked search(mMutex, "Broadcaster::HasListener");
-    if (Find(inEntry) >= 0) return false;
-  }
   // A registry larger than a 32-bit count counts as exhausted storage.
   if (mEntries.size() >= static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) throw std::bad_alloc();
-  mEntries.push_back(StoredEntry{inEntry, mNextSerial});
-  if (inEntry.mListener != nullptr) {
-    try {
-      inEntry.mListener->AddBroadcaster(mOwner, weak_from_this());
-    } catch (...) {
-      // Without its back-link the listener could not detach itself when it
-      // dies; take the registration back.
-      mEntries.pop_back();
-      throw;
-    }
+  const auto inserted = mIndex.emplace(inEntry, mNextSerial);
+  if (!inserted.second) return false;
+  bool stored = false;
+  try {
+    mEntries.push_back(StoredEntry{inEntry, mNextSerial});
+    stored = true;
+    if (inEntry.mListener != nullptr) inEntry.mListener->AddBroadcaster(mOwner, weak_from_this());
+  } catch (...) {
+    // Out of storage, or without its back-link the listener could not
+    // detach itself when it dies: take the whole registration back.
+    if (stored) mEntries.pop_back();
+    mIndex.erase(inserted.first);
+    throw;
   }
   // Running broadcasts serve only entries older than where they started, so
   // the newcomer waits for the next broadcast.
@@ -150,12 +155,13 @@ bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
 
 void BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck) {
   Locked lock(mMutex, "Broadcaster::RemoveListener1");
-  const std::ptrdiff_t index = Find(inListener);
-  if (index >= 0) {
+  const auto found = mIndex.find(inListener);
+  if (found != mIndex.end()) {
     if (inCheck) TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
     // Running broadcasts hold serials, not positions: erasing moves nothing
-    // they depend on.
-    mEntries.erase(mEntries.begin() + index);
+    // they depend on. Erasing frees storage and allocates none.
+    mEntries.erase(mEntries.begin() + static_cast<std::ptrdiff_t>(PositionOf(found->second)));
+    mIndex.erase(found);
   }
   if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(weak_from_this());
   if (inWait == Wait::kNever) return;
@@ -203,6 +209,7 @@ void BroadcasterCore::Close() noexcept {
     if (stored.mEntry.mListener != nullptr) stored.mEntry.mListener->RemoveBroadcaster(self);
   }
   mEntries.clear();
+  mIndex.clear();
   mOwner = nullptr;
 }
 
@@ -213,13 +220,18 @@ void BroadcasterCore::Broadcast(const Message& inMessage) {
   bool currentIsPlain = true;  // frame.mCurrent has no weak field set
   bool gone = false;
   // Built once: the record refers to frame.mCurrent, which each pass
-  // refills. The bound call fits inside the boost::function, so nothing is
-  // allocated.
+  // refills. The call names the delivery directly (no function pointer to
+  // follow) and fits inside the boost::function, so nothing is allocated.
   const Broadcaster::BroadcastMessageRecord record{frame.mCurrent, inMessage, &gone};
-  const boost::function<int()> delivery(boost::bind(&Broadcaster::DeliverToListener, boost::cref(record)));
+  struct Deliver {
+    const Broadcaster::BroadcastMessageRecord* mRecord;
+    int operator()() const { return Broadcaster::DeliverToListener(*mRecord); }
+  };
+  const boost::function<int()> delivery(Deliver{&record});
   {
     Locked lock(mMutex, "Broadcaster::BroadcastMessage1");
     frame.mNextBelow = mNextSerial;
+    frame.mPosition = mEntries.size();
     frame.mNext = mFrames;
     mFrames = &frame;
   }
@@ -240,15 +252,22 @@ void BroadcasterCore::Broadcast(const Message& inMessage) {
     {
       Locked lock(mMutex, "Broadcaster::BroadcastMessage1");
       EndDelivery(frame);
-      // The newest entry older than the last one served.
-      auto next = std::lower_bound(mEntries.begin(), mEntries.end(), frame.mNextBelow,
-                                   [](const StoredEntry& inStored, std::uint64_t inSerial) { return inStored.mSerial < inSerial; });
-      if (next == mEntries.begin()) {
+      // The newest entry older than the last one served. Unless entries
+      // were added or removed meanwhile, it sits just below where the last
+      // one was; the hint is checked, and searched for when it fails.
+      std::size_t position = frame.mPosition;
+      const std::size_t count = mEntries.size();
+      if (position > count || (position > 0 && mEntries[position - 1].mSerial >= frame.mNextBelow) ||
+          (position < count && mEntries[position].mSerial < frame.mNextBelow)) {
+        position = PositionOf(frame.mNextBelow);
+      }
+      if (position == 0) {
         Unlink(frame);
         scope.mLinked = false;
         return;
       }
-      --next;
+      const StoredEntry* const next = &mEntries[--position];
+      frame.mPosition = position;
       frame.mNextBelow = next->mSerial;
       if (next->mEntry.mListener != nullptr && currentIsPlain) {
         // Copying a plain pointer into a copy without weak fields is a

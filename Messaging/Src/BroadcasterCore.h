@@ -25,6 +25,7 @@
 
 #include <condition_variable>
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <vector>
@@ -36,6 +37,7 @@ public:
   // One running broadcast; lives on the broadcasting thread's stack.
   struct Frame {
     std::uint64_t mNextBelow = 0;     // serves entries older than this serial
+    std::size_t mPosition = 0;        // where that serial was last seen; a hint
     ListenerEntry mCurrent;           // the entry being delivered (a copy)
     bool mDelivering = false;         // mCurrent is being delivered right now
     std::uintptr_t mThread = 0;       // the broadcasting thread
@@ -86,9 +88,20 @@ private:
     std::uint64_t mSerial;
   };
   using EntryVector = std::vector<StoredEntry, Alloc<StoredEntry>>;
+  // Orders registrations by identity, agreeing with ListenerEntry's equality:
+  // the plain pointer, then the safe listener's block, then the weak
+  // pointers' owners.
+  struct IdentityOrder {
+    bool operator()(const ListenerEntry& inA, const ListenerEntry& inB) const noexcept;
+  };
+  // Each registration's serial, found by identity.
+  using EntryIndex = std::map<ListenerEntry, std::uint64_t, IdentityOrder,
+                              Alloc<std::pair<const ListenerEntry, std::uint64_t>>>;
 
-  // Linear search; the index, or -1. mMutex must be held.
+  // The position in mEntries of an equal entry, or -1. mMutex must be held.
   std::ptrdiff_t Find(const ListenerEntry& inEntry) const noexcept;
+  // The position of the entry with inSerial, or of the first newer one.
+  std::size_t PositionOf(std::uint64_t inSerial) const noexcept;
   bool OtherThreadDelivers(const ListenerEntry& inEntry, std::uintptr_t inSelf) const noexcept;
   // Ends a frame's delivery and wakes waiting removers. mMutex must be held.
   void EndDelivery(Frame& ioFrame) noexcept;
@@ -97,6 +110,7 @@ private:
   kivcore::threads::RecursiveMutex mMutex;
   Broadcaster* mOwner;                // guarded by mMutex; null once closed
   EntryVector mEntries;               // guarded by mMutex; oldest first, serials rising
+  EntryIndex mIndex;                  // guarded by mMutex; exactly the entries of mEntries
   std::uint64_t mNextSerial = 1;      // guarded by mMutex
   Frame* mFrames = nullptr;           // guarded by mMutex
   WaiterList mGateMap;                // guarded by mMutex; removals still waiting

@@ -10,6 +10,7 @@
 #include <gtest/gtest.h>
 
 #include <memory>
+#include <new>
 
 namespace {
 
@@ -124,6 +125,42 @@ TEST_F(BroadcasterTest, DeliveryTakesNoStorageAndTheRegistryGivesBackEverySmallB
   }
   EXPECT_EQ(SmallBlockAllocator::GetStatistics().blocksInUse, before.blocksInUse) << "small blocks leaked";
   EXPECT_EQ(plain.Calls() + stdOwner->Calls(), 2);
+}
+
+// Registrations are found through an index kept beside the walk's entries:
+// re-adds and removals inside a broadcast, owners reached through another
+// weak pointer, prunes and failed registrations must leave the two in step.
+TEST_F(BroadcasterTest, TheIndexStaysInStepWithTheEntriesThroughEveryChange) {
+  Tarn::Broadcaster broadcaster;
+  RecordingListener a("A", &mLog), b("B", &mLog), c("C", &mLog);
+  auto owner = std::make_shared<RecordingListener>("W", &mLog);
+  std::shared_ptr<Tarn::Listener> alias(owner, &a);  // same owner, another address
+  broadcaster.AddListener(std::weak_ptr<Tarn::Listener>(owner));
+  broadcaster.AddListener(std::weak_ptr<Tarn::Listener>(alias));  // already there
+  broadcaster.AddListener(&a);
+  broadcaster.AddListener(&b);
+  b.SetAction([&](const Tarn::Message&) {
+    if (b.Calls() != 1) return;
+    broadcaster.RemoveListener(&a, true);
+    broadcaster.AddListener(&a);  // newer than the walk: served from the next one
+    broadcaster.RemoveListener(std::weak_ptr<Tarn::Listener>(alias));
+    broadcaster.AddListener(std::weak_ptr<Tarn::Listener>(owner));
+  });
+  broadcaster.BroadcastMessage(NumberMessage(1));
+  for (int succeeding = 0; !broadcaster.HasListener(&c); ++succeeding) {
+    messaging_test::SmallBlockFailureGuard failing(succeeding);
+    try {
+      broadcaster.AddListener(&c);
+    } catch (const std::bad_alloc&) {
+      EXPECT_FALSE(broadcaster.HasListener(&c) || c.HasBroadcaster(&broadcaster)) << "a failed add left a half";
+    }
+  }
+  alias.reset();
+  owner.reset();  // pruned by the next walk
+  broadcaster.BroadcastMessage(NumberMessage(2));
+  EXPECT_EQ(mLog.Entries(), (Log{"B:1", "C:2", "A:2", "B:2"}));
+  for (RecordingListener* listener : {&a, &b, &c}) broadcaster.RemoveListener(listener, true);
+  EXPECT_FALSE(broadcaster.HasListeners()) << "an entry outlived its removal or prune";
 }
 
 }  // namespace
