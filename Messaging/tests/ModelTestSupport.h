@@ -16,7 +16,6 @@
 #include <chrono>
 #include <cstdint>
 #include <cstdlib>
-#include <numeric>
 #include <random>
 
 namespace messaging_test {
@@ -44,15 +43,6 @@ class Random {
 public:
   explicit Random(std::uint64_t inSeed) : mEngine(inSeed) {}
   std::uint32_t Below(std::uint32_t inBound) { return static_cast<std::uint32_t>(mEngine() % inBound); }  // inBound > 0
-  bool Percent(std::uint32_t inPercent) { return Below(100) < inPercent; }
-  // An index drawn with the given weights (not all 0).
-  template <std::size_t N>
-  std::size_t Weighted(const std::uint32_t (&inWeights)[N]) {
-    std::uint32_t pick = Below(std::accumulate(inWeights, inWeights + N, 0u));
-    std::size_t index = 0;
-    while (pick >= inWeights[index]) pick -= inWeights[index++];
-    return index;
-  }
 
 private:
   std::mt19937_64 mEngine;

@@ -422,10 +422,7 @@ public:
   AnyListener& operator=(const AnyListener&) = delete;
   ~AnyListener() { Destroy(); }
 
-  ListenerKind Kind() const { return mKind; }
   int Calls() const { return mProbe->mCalls.load(); }
-  bool IsDestroyed() const { return mProbe->mDestroyed.load(); }
-  const std::shared_ptr<CallRecorder::Probe>& GetProbe() const { return mProbe; }
   // Set before attaching; see CallRecorder::SetAction.
   void SetAction(CallRecorder::Action inAction) { mRecorder->SetAction(std::move(inAction)); }
 
