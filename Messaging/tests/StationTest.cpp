@@ -2,6 +2,7 @@
 // broadcast on them runs, never twice, none lost.
 #include "StationTestSupport.h"
 
+#include <regex>
 #include <stdexcept>
 
 namespace {
@@ -57,6 +58,7 @@ TEST_F(StationTest, RelayDisposedOrReleasedFromInsideItsOwnBroadcastIsDeletedWhe
 TEST_F(StationTest, ARetainThatMakesNoStationLeavesNoCountBehind) {
   static int sCalls = 0;
   const ImmutableString id = Registry::UniqueStationID();
+  EXPECT_TRUE(std::regex_match(id.c_str(), std::regex("\\{[0-9a-f]{8}(-[0-9a-f]{4}){3}-[0-9a-f]{12}\\}"))) << id.c_str();
   Registry::RegisterStation(id, [](const ImmutableString& inID) -> Tarn::Station* {
     if (++sCalls == 1) throw std::runtime_error("factory");
     return sCalls == 2 ? nullptr : new CountedStation(inID);
