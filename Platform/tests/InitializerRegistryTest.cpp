@@ -54,6 +54,7 @@ TEST(InitializerRegistry, EntriesRunInDependencyOrderAndInitFunctionsMayInitiali
   EXPECT_TRUE(InitializerRegistry::InitializeAll(properties));
   EXPECT_TRUE(nested);
   EXPECT_TRUE(InitializerRegistry::InitializeAll(properties)) << "initialized entries do not run again";
+  EXPECT_TRUE(InitializerRegistry::IsRegistered("Loaded") && !InitializerRegistry::IsRegistered("NotRegistered"));
   InitializerRegistry::TerminateAll();
   InitializerRegistry::TerminateAll();
   EXPECT_EQ((std::vector<std::string>{"init Other:x", "init Loader:x", "init Loaded", "init User:x", "term User",
