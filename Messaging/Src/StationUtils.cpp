@@ -5,6 +5,7 @@
 #include <TarnMessaging/StationUtils.h>
 
 #include "ContractCheck.h"
+#include "StationRetainer.h"
 
 #include <kivcore/MainThread.h>
 
@@ -15,29 +16,6 @@ namespace {
 
 constexpr const char* kRemoveListenerName = "Tarn::StationUtils::RemoveListener";
 constexpr const char* kSwitchStationName = "Tarn::StationUtils::SwitchStation";
-
-// Retains a station for one call and releases it on every way out.
-class StationRetainer {
-public:
-  // The ID is copied now: by the release the station may be gone (a handler
-  // of its broadcast terminated the library), and the release may delete the
-  // station and the caller's string with it, so neither is read after the
-  // broadcast.
-  explicit StationRetainer(const ImmutableString& inStationID)
-      : mStation(StationRegistry::RetainStation(inStationID)), mStationID(inStationID) {}
-  ~StationRetainer() {
-    if (mStation != nullptr) StationRegistry::ReleaseStation(mStationID);
-  }
-  StationRetainer(const StationRetainer&) = delete;
-  StationRetainer& operator=(const StationRetainer&) = delete;
-
-  Station* operator->() const noexcept { return mStation; }
-  explicit operator bool() const noexcept { return mStation != nullptr; }
-
-private:
-  Station* const mStation;
-  const ImmutableString mStationID;
-};
 
 // Whether a weak pointer can still be locked; the temporary is dropped at
 // once, before the station is looked up.

@@ -3,6 +3,7 @@
 #include <TarnMessaging/Subscription.h>
 
 #include "BroadcasterCore.h"
+#include "StationRetainer.h"
 
 #include <kivcore/MainThread.h>
 
@@ -28,25 +29,6 @@ struct RegistrationFactory {
 };
 
 namespace {
-
-// Retains the station registered under an ID for one call. The ID is copied:
-// the release may delete the station, and the caller's string with it.
-class StationHold {
-public:
-  explicit StationHold(const ImmutableString& inStationID)
-      : mStation(StationRegistry::RetainStation(inStationID)), mStationID(inStationID) {}
-  ~StationHold() {
-    if (mStation != nullptr) StationRegistry::ReleaseStation(mStationID);
-  }
-  StationHold(const StationHold&) = delete;
-  StationHold& operator=(const StationHold&) = delete;
-
-  Station* get() const noexcept { return mStation; }
-
-private:
-  Station* const mStation;
-  const ImmutableString mStationID;
-};
 
 // The broadcaster's AddListener reports misuse; an input it refused gives an
 // empty registration, never a record that would remove something else later.
@@ -79,7 +61,7 @@ Registration AttachSafe(Broadcaster& ioBroadcaster, const ISafeListenerRef& inLi
 
 template <class Attacher>
 Registration AttachToStation(const ImmutableString& inStationID, Attacher inAttach) {
-  StationHold station(inStationID);
+  StationRetainer station(inStationID);
   if (station.get() == nullptr) return Registration();
   return inAttach(*station.get());
 }
@@ -128,7 +110,7 @@ Registration Registration::Own(Broadcaster& ioBroadcaster, SubscriptionDetail::O
 
 Registration Registration::Own(const ImmutableString& inStationID, SubscriptionDetail::OwnedListener* inListener) {
   Registration result(inListener);
-  StationHold station(inStationID);
+  StationRetainer station(inStationID);
   if (station.get() == nullptr) return Registration();  // result disposes of the listener
   station.get()->AddListener(inListener);
   return result;
