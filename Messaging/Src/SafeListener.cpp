@@ -1,6 +1,14 @@
 #include <TarnMessaging/SafeListener.h>
 
+#include <boost/make_shared.hpp>
+
 namespace Tarn {
+
+boost::shared_ptr<WeakReference> MakeWeakReference(ISafeListener* inObject) {
+  const boost::shared_ptr<WeakReference> block = boost::make_shared<WeakReference>();
+  block->mObject = inObject;
+  return block;
+}
 
 const IID IID_ISafeListener = {0xC51D0DEC, 0xEFE2, 0x48EE, {0x85, 0x14, 0xFA, 0xEB, 0x6D, 0x01, 0xC8, 0xF8}};
 const IID IID_IWeakReferenceCapable = {0xF30494F3, 0xAFD0, 0x4490, {0x94, 0xB8, 0x0E, 0xD6, 0x67, 0x05, 0x26, 0xFF}};

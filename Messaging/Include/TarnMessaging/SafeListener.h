@@ -27,7 +27,6 @@
 #include <TarnMessaging/Export.h>
 #include <TarnMessaging/NullInterfaceException.h>
 
-#include <boost/make_shared.hpp>
 #include <boost/shared_ptr.hpp>
 
 #include <atomic>
@@ -227,15 +226,17 @@ TARN_MESSAGING_API boost::shared_ptr<WeakReference> GetSafeListenerHandle(const 
 /// empty, the object is gone, or it does not offer ISafeListener.
 TARN_MESSAGING_API ISafeListenerRef ResolveSafeListener(const boost::shared_ptr<WeakReference>& inHandle);
 
+/// A new weak-reference block naming inObject, with a count of 0. Out of
+/// line so that this header need not pull in the allocation templates.
+TARN_MESSAGING_API boost::shared_ptr<WeakReference> MakeWeakReference(ISafeListener* inObject);
+
 /// A correct counted safe listener for hosts, tests and examples: both
 /// interfaces, the count in the weak-reference block, the negative count and
 /// the delete at the last Release. Create with new and hold in an
 /// InterfaceRef at once; the count starts at 0.
 class SafeListenerBase : public ISafeListener, public IWeakReferenceCapable {
 public:
-  SafeListenerBase() : mWeakReference(boost::make_shared<WeakReference>()) {
-    mWeakReference->mObject = static_cast<ISafeListener*>(this);
-  }
+  SafeListenerBase() : mWeakReference(MakeWeakReference(static_cast<ISafeListener*>(this))) {}
   SafeListenerBase(const SafeListenerBase&) = delete;
   SafeListenerBase& operator=(const SafeListenerBase&) = delete;
 
