@@ -97,11 +97,21 @@ TEST_F(BroadcasterTest, ListenersDyingWhileTheWalkResolvesThemArePrunedAndNothin
   auto shared = std::make_shared<RecordingListener>("W", &mLog);
   broadcaster.AddListener(std::weak_ptr<Tarn::Listener>(shared));
   shared.reset();
+  // An entry of each kind is live exactly while its listener is.
   RecordingListener probe("P");
-  Tarn::ListenerEntry plain, dead;
+  boost::shared_ptr<Tarn::Listener> boostOwner(new RecordingListener("B"));
+  auto stdOwner = std::make_shared<RecordingListener>("S");
+  Tarn::ISafeListenerRef safeOwner(new messaging_test::CountedSafeListener("C"));
+  Tarn::ListenerEntry plain, boostWeak, stdWeak, safe;
   plain.mListener = &probe;
-  dead.mStdWeakListener = std::weak_ptr<Tarn::Listener>(std::make_shared<RecordingListener>("gone"));
-  EXPECT_TRUE(plain.IsLive() && !dead.IsLive()) << "a plain entry is always live, an expired one never";
+  boostWeak.mBoostWeakListener = boostOwner;
+  stdWeak.mStdWeakListener = stdOwner;
+  safe.mSafeListener = Tarn::GetSafeListenerHandle(safeOwner);
+  EXPECT_TRUE(plain.IsLive() && boostWeak.IsLive() && stdWeak.IsLive() && safe.IsLive());
+  boostOwner.reset();
+  stdOwner.reset();
+  safeOwner = Tarn::ISafeListenerRef();
+  EXPECT_FALSE(boostWeak.IsLive() || stdWeak.IsLive() || safe.IsLive()) << "an entry outlived its listener";
   broadcaster.BroadcastMessage(NumberMessage(1));
   EXPECT_EQ(messaging_test::CountedSafeListener::LiveCount(), liveBefore - 1) << "the listener was not served once";
   EXPECT_FALSE(broadcaster.HasListeners()) << "a dead listener was not pruned";

@@ -52,16 +52,26 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
 
 // A station queued by a disposal while no main thread is registered waits
 // in the registry's pending list until exit, and goes while the registry is
-// still alive, without a diagnostic.
-TEST(StaticDestructionTest, StationQueuedForDeletionAtExitIsDeletedWhileTheRegistryLives) {
-  FILE* const probe = ::popen((std::string("\"") + TARN_STATIC_DESTRUCTION_PROBE + "\" queued 2>&1").c_str(), "r");
-  ASSERT_NE(probe, nullptr);
-  std::string output;
-  char buffer[256];
-  while (std::fgets(buffer, sizeof buffer, probe) != nullptr) output += buffer;
-  const int status = ::pclose(probe);
+// still alive, without a diagnostic. A lookup made after the registry's own
+// static destruction finds nothing and says why, instead of reading the
+// destroyed map.
+TEST(StaticDestructionTest, StationsAtExitGoWhileTheRegistryLivesAndLateLookupsFindNothing) {
+  auto run = [](const char* inMode, std::string& outOutput) {
+    FILE* const probe = ::popen((std::string("\"") + TARN_STATIC_DESTRUCTION_PROBE + "\" " + inMode + " 2>&1").c_str(), "r");
+    if (probe == nullptr) return -1;
+    char buffer[256];
+    while (std::fgets(buffer, sizeof buffer, probe) != nullptr) outOutput += buffer;
+    return ::pclose(probe);
+  };
+  std::string queued, late;
+  int status = run("queued", queued);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-  EXPECT_EQ(output, "queued station deleted\n");
+  EXPECT_EQ(queued, "queued station deleted\n");
+  status = run("late", late);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status << late;
+  EXPECT_NE(late.find("SERIOUS ERROR!  StationRegistry has already been destructed.\nlate lookup found nothing\n"),
+            std::string::npos)
+      << late;
 }
 
 }  // namespace

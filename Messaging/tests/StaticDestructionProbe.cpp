@@ -3,7 +3,7 @@
 // outside. Mode "queued" disposes of a station while no main thread is
 // registered, so that it waits in the registry's pending list until exit; it
 // must be deleted while the registry is still alive, silently, and says so on
-// standard output.
+// standard output. Mode "late" is described below.
 //
 // Exit status 0 when the mode ran, 1 for an unknown mode, 2 when the
 // registry did not behave as the mode needs.
@@ -30,10 +30,21 @@ private:
   const char* mWhat;
 };
 
-// Constructed during this program's static initialization, before main and
-// so before the registry, which is made on its first use inside main.
-// Static objects are destroyed in the reverse order of their construction,
-// so this one goes after the registry.
+// Mode "late" reaches the registry from a static object's destructor. It was
+// constructed during this program's static initialization, before main and
+// so before the registry, which is made on its first use inside main. Static
+// objects are destroyed in the reverse order of their construction, so this
+// one goes after the registry: the lookup gets an empty map of its own and a
+// diagnostic, not a destroyed map.
+struct LateUser {
+  bool mArmed = false;
+  ImmutableString mStationID;
+  ~LateUser() {
+    if (!mArmed) return;
+    const bool found = Tarn::StationRegistry::FindStation(mStationID) != nullptr;
+    std::printf("late lookup %s\n", found ? "found a station" : "found nothing");
+  }
+} sLateUser;
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -45,6 +56,11 @@ int main(int argc, char** argv) {
     // No main thread is registered, so the disposal only queues the station.
     Tarn::StationRegistry::DisposeStation(id);
     if (Tarn::StationRegistry::FindStation(id) != nullptr) return 2;
+    return 0;
+  }
+  if (std::strcmp(argv[1], "late") == 0) {
+    sLateUser.mStationID = Tarn::StationRegistry::RegisterUniqueStation();
+    sLateUser.mArmed = true;
     return 0;
   }
   return 1;

@@ -62,11 +62,20 @@ TEST(InitializerRegistry, EntriesRunInDependencyOrderAndInitFunctionsMayInitiali
             sLog);
 }
 
-// A cycle fails; a failing or throwing init stops the run and is tried again
+// A cycle fails; a failing or throwing init stops the run (one that withdrew
+// its own entry while it ran included) and is tried again
 // next time; a withdrawn entry is not terminated; a throwing terminator does
 // not keep the others from running.
 TEST(InitializerRegistry, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminated) {
   sLog.clear();
+  {
+    std::unique_ptr<InitializerRegistrar> quitter;
+    quitter = Entry("Quitter", nullptr, [&quitter] {
+      quitter.reset();
+      return false;
+    });
+    EXPECT_FALSE(InitializerRegistry::InitializeAll(PropList())) << "an init that withdrew its entry and failed";
+  }
   {
     const auto egg = Entry("Egg", "Hen");
     const auto hen = Entry("Hen", "Egg");
@@ -84,7 +93,7 @@ TEST(InitializerRegistry, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminate
   EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
   d.reset();
   EXPECT_THROW(InitializerRegistry::TerminateAll(), std::runtime_error);
-  EXPECT_EQ((std::vector<std::string>{"init !A", "init B", "init B", "init C", "init D", "term B", "term !A"}), sLog);
+  EXPECT_EQ((std::vector<std::string>{"init Quitter", "init !A", "init B", "init B", "init C", "init D", "term B", "term !A"}), sLog);
 }
 
 }  // namespace
