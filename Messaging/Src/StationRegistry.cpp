@@ -1,6 +1,7 @@
 #include <TarnMessaging/Station.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "StationRetainer.h"
 #include "StationRetirement.h"
 
 #include <kivcore/Guid.h>
@@ -59,6 +60,8 @@ using PendingStationList = std::vector<PendingStation, Alloc<PendingStation>>;
 // destroyed after the registry at process exit.
 RecursiveMutex sStationRegistryMutex;
 std::atomic<std::int32_t> sStationMapAlive{0};
+// The registry's life: Terminate starts a new one. Guarded by the lock.
+std::uint64_t sLife = 0;
 
 Station* DefaultStationFactory(const ImmutableString& inStationID) { return new Station(inStationID); }
 
@@ -320,6 +323,7 @@ void Terminate() {
     PendingStationList& pending = GetPendingStationList();
     pending.reserve(pending.size() + map->size());
     doomed.swap(*map);
+    ++sLife;
   }
   // Station destructors run without the registry's lock; each looks itself
   // up and finds nothing. A station with a broadcast in progress (Terminate
@@ -343,6 +347,21 @@ void Terminate() {
 }
 
 }  // namespace StationRegistry
+
+Station* StationRetainer::Retain(const ImmutableString& inStationID, std::uint64_t& outLife) {
+  RegistryLock lock("StationRegistry::RetainStation");
+  outLife = sLife;
+  return StationRegistry::RetainStation(inStationID);
+}
+
+void StationRetainer::Release(const ImmutableString& inStationID, std::uint64_t inLife) {
+  {
+    RegistryLock lock("StationRegistry::ReleaseStation");
+    if (inLife != sLife) return;
+  }
+  // Deletes the station, if it does, after the lock is released.
+  StationRegistry::ReleaseStation(inStationID);
+}
 
 void StationRetirement::DrainRetired() {
   if (!sHasRetired.load()) return;

@@ -7,6 +7,8 @@
 
 #include <kivcore/ImmutableString.h>
 
+#include <cstdint>
+
 namespace Tarn {
 
 // Retains a station for one call and releases it on every way out.
@@ -17,9 +19,9 @@ public:
   // station and the caller's string with it, so neither is read after the
   // broadcast.
   explicit StationRetainer(const kivcore::utility::ImmutableString& inStationID)
-      : mStation(StationRegistry::RetainStation(inStationID)), mStationID(inStationID) {}
+      : mStation(Retain(inStationID, mLife)), mStationID(inStationID) {}
   ~StationRetainer() {
-    if (mStation != nullptr) StationRegistry::ReleaseStation(mStationID);
+    if (mStation != nullptr) Release(mStationID, mLife);
   }
   StationRetainer(const StationRetainer&) = delete;
   StationRetainer& operator=(const StationRetainer&) = delete;
@@ -29,6 +31,14 @@ public:
   explicit operator bool() const noexcept { return mStation != nullptr; }
 
 private:
+  // Each Terminate ends one life of the registry. A retain remembers the life
+  // it was made in, and its release does nothing in a later one: a handler
+  // may terminate the library and bring it back, and the ID may then name a
+  // new station that this retain never counted. Defined with the registry.
+  static Station* Retain(const kivcore::utility::ImmutableString& inStationID, std::uint64_t& outLife);
+  static void Release(const kivcore::utility::ImmutableString& inStationID, std::uint64_t inLife);
+
+  std::uint64_t mLife = 0;  // initialised before mStation, which Retain sets it for
   Station* const mStation;
   const kivcore::utility::ImmutableString mStationID;
 };

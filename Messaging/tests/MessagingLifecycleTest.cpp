@@ -44,6 +44,20 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
 
   Tarn::Messaging::Initialize();
   EXPECT_TRUE(kivcore::threads::CurrentThreadIsMainThread()) << "the library did not come back";
+
+  // A handler may also bring the library back at once and make the new
+  // well-known station: the broadcast's hold on the old one must not be
+  // released on the new one (its count would wrap and it could never go).
+  RecordingListener restart("restart", &log), newcomer("newcomer", &log);
+  restart.SetAction([&](const Tarn::Message&) {
+    Tarn::Messaging::Terminate();
+    Tarn::Messaging::Initialize();
+    Utils::AddListener(Tarn::kStation_Idle, &newcomer);
+  });
+  Utils::AddListener(Tarn::kStation_Idle, &restart);
+  Utils::BroadcastMessage(Tarn::kStation_Idle, NumberMessage(2));
+  Registry::DisposeStation(Tarn::kStation_Idle);
+  EXPECT_EQ(Registry::FindStation(Tarn::kStation_Idle), nullptr) << "the new station is held by a retain it never had";
   Tarn::Messaging::Terminate();
 }
 
