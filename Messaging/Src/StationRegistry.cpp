@@ -221,64 +221,11 @@ Station* FindStation(const ImmutableString& inStationID) {
 }
 
 Station* RetainStation(const ImmutableString& inStationID) {
-  RegistryLock lock("StationRegistry::RetainStation");
-  StationMapAccess map;
-  const auto found = map->find(inStationID);
-  if (found == map->end()) return nullptr;
-  // Counted before the station is made, and taken back when no station
-  // comes of it (the factory returned null or threw): callers release only
-  // the retains that gave them a station, so a count left standing would keep
-  // a later disposal from ever deleting the station.
-  StationRecord& record = found->second;
-  ++record.mRetainCount;
-  Station* station = nullptr;
-  try {
-    station = MakeStation(record);
-  } catch (...) {
-    --record.mRetainCount;
-    throw;
-  }
-  if (station == nullptr) --record.mRetainCount;
-  return station;
+  std::uint64_t life = 0;
+  return StationRetainer::Retain(inStationID, life);
 }
 
-void ReleaseStation(const ImmutableString& inStationID) {
-  Station* doomed = nullptr;
-  {
-    RegistryLock lock("StationRegistry::ReleaseStation");
-    StationMapAccess map;
-    const auto found = map->find(inStationID);
-    if (found == map->end()) return;
-    StationRecord& record = found->second;
-    if (record.mStation == nullptr) return;
-    if (record.mRetainCount == 1 && record.mDisposeRequested) {
-      const bool onMainThread = kivcore::threads::CurrentThreadIsMainThread();
-      PendingStationList& pending = GetPendingStationList();
-      // Room is made before anything changes, so an exhausted allocator
-      // leaves the registry as it was.
-      if (onMainThread) pending.reserve(pending.size() + 1);
-      doomed = record.mStation;
-      map->erase(found);
-      // On the main thread, a release from inside a broadcast on the station
-      // (its own relay, say) must not pull the station from under it.
-      if (onMainThread && StationRetirement::IsBroadcasting(*doomed)) {
-        Retire(doomed);
-        return;
-      }
-      if (pending.empty()) PendingStationList().swap(pending);
-    } else {
-      --record.mRetainCount;
-      return;
-    }
-  }
-  // Deleted after the lock is released: on a worker thread the station's
-  // destructor waits for a delivery to it running on the main thread, whose
-  // handlers must be able to reach the registry meanwhile. Nobody else can
-  // reach the station: its record is gone, and it is detached before any part
-  // of it (a host's derived station's included) is destroyed, so the main
-  // thread never relays through a half-destroyed station.
-  StationRetirement::Delete(doomed);
-}
+void ReleaseStation(const ImmutableString& inStationID) { StationRetainer::Release(inStationID, nullptr); }
 
 void DisposeStation(const ImmutableString& inStationID) {
   RegistryLock lock(nullptr);
@@ -351,16 +298,63 @@ void Terminate() {
 Station* StationRetainer::Retain(const ImmutableString& inStationID, std::uint64_t& outLife) {
   RegistryLock lock("StationRegistry::RetainStation");
   outLife = sLife;
-  return StationRegistry::RetainStation(inStationID);
+  StationMapAccess map;
+  const auto found = map->find(inStationID);
+  if (found == map->end()) return nullptr;
+  // Counted before the station is made, and taken back when no station
+  // comes of it (the factory returned null or threw): callers release only
+  // the retains that gave them a station, so a count left standing would keep
+  // a later disposal from ever deleting the station.
+  StationRecord& record = found->second;
+  ++record.mRetainCount;
+  Station* station = nullptr;
+  try {
+    station = MakeStation(record);
+  } catch (...) {
+    --record.mRetainCount;
+    throw;
+  }
+  if (station == nullptr) --record.mRetainCount;
+  return station;
 }
 
-void StationRetainer::Release(const ImmutableString& inStationID, std::uint64_t inLife) {
+void StationRetainer::Release(const ImmutableString& inStationID, const std::uint64_t* inLife) {
+  Station* doomed = nullptr;
   {
     RegistryLock lock("StationRegistry::ReleaseStation");
-    if (inLife != sLife) return;
+    if (inLife != nullptr && *inLife != sLife) return;
+    StationMapAccess map;
+    const auto found = map->find(inStationID);
+    if (found == map->end()) return;
+    StationRecord& record = found->second;
+    if (record.mStation == nullptr) return;
+    if (record.mRetainCount == 1 && record.mDisposeRequested) {
+      const bool onMainThread = kivcore::threads::CurrentThreadIsMainThread();
+      PendingStationList& pending = GetPendingStationList();
+      // Room is made before anything changes, so an exhausted allocator
+      // leaves the registry as it was.
+      if (onMainThread) pending.reserve(pending.size() + 1);
+      doomed = record.mStation;
+      map->erase(found);
+      // On the main thread, a release from inside a broadcast on the station
+      // (its own relay, say) must not pull the station from under it.
+      if (onMainThread && StationRetirement::IsBroadcasting(*doomed)) {
+        Retire(doomed);
+        return;
+      }
+      if (pending.empty()) PendingStationList().swap(pending);
+    } else {
+      --record.mRetainCount;
+      return;
+    }
   }
-  // Deletes the station, if it does, after the lock is released.
-  StationRegistry::ReleaseStation(inStationID);
+  // Deleted after the lock is released: on a worker thread the station's
+  // destructor waits for a delivery to it running on the main thread, whose
+  // handlers must be able to reach the registry meanwhile. Nobody else can
+  // reach the station: its record is gone, and it is detached before any part
+  // of it (a host's derived station's included) is destroyed, so the main
+  // thread never relays through a half-destroyed station.
+  StationRetirement::Delete(doomed);
 }
 
 void StationRetirement::DrainRetired() {

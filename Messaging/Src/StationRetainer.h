@@ -21,7 +21,7 @@ public:
   explicit StationRetainer(const kivcore::utility::ImmutableString& inStationID)
       : mStation(Retain(inStationID, mLife)), mStationID(inStationID) {}
   ~StationRetainer() {
-    if (mStation != nullptr) Release(mStationID, mLife);
+    if (mStation != nullptr) Release(mStationID, &mLife);
   }
   StationRetainer(const StationRetainer&) = delete;
   StationRetainer& operator=(const StationRetainer&) = delete;
@@ -31,12 +31,17 @@ public:
   explicit operator bool() const noexcept { return mStation != nullptr; }
 
 private:
-  // Each Terminate ends one life of the registry. A retain remembers the life
-  // it was made in, and its release does nothing in a later one: a handler
-  // may terminate the library and bring it back, and the ID may then name a
-  // new station that this retain never counted. Defined with the registry.
+  friend Station* StationRegistry::RetainStation(const kivcore::utility::ImmutableString&);
+  friend void StationRegistry::ReleaseStation(const kivcore::utility::ImmutableString&);
+
+  // The registry's retain and release, defined with it. Each Terminate ends
+  // one life of the registry. A retain notes the life it was made in, and a
+  // release given that life does nothing in a later one: a handler may
+  // terminate the library and bring it back, and the ID may then name a new
+  // station that this retain never counted. A host's release (no life) is
+  // counted on whatever station the ID names.
   static Station* Retain(const kivcore::utility::ImmutableString& inStationID, std::uint64_t& outLife);
-  static void Release(const kivcore::utility::ImmutableString& inStationID, std::uint64_t inLife);
+  static void Release(const kivcore::utility::ImmutableString& inStationID, const std::uint64_t* inLife);
 
   std::uint64_t mLife = 0;  // initialised before mStation, which Retain sets it for
   Station* const mStation;
