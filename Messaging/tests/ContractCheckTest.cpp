@@ -196,4 +196,19 @@ TEST_F(ContractCheckSites, EachReportsItselfAndLeavesNothingBrokenWhetherTheRepo
   EXPECT_EQ(station_test::StationLog::Destructions(), 1);
 }
 
+// Dereferencing a null reference raises an exception that names the
+// interface; a copy keeps the text.
+TEST(NullInterface, DereferencingANullReferenceThrowsAnExceptionNamingTheInterface) {
+  Tarn::ISafeListenerRef none;
+  try {
+    none->AddRef();
+    ADD_FAILURE() << "nothing was thrown";
+  } catch (const Tarn::NullInterfaceException& inError) {
+    const Tarn::NullInterfaceException copy(inError);
+    const std::string text = copy.what();
+    EXPECT_EQ(text.rfind("A NULL interface pointer has been dereferenced: ", 0), 0u) << text;
+    EXPECT_NE(text.find("ISafeListener"), std::string::npos) << text;
+  }
+}
+
 }  // namespace
