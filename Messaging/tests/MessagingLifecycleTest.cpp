@@ -2,6 +2,8 @@
 // registry at process exit.
 #include "StationTestSupport.h"
 
+#include <kivcore/SmallBlockAllocator.h>
+
 #include <sys/wait.h>
 
 #include <cstdio>
@@ -59,6 +61,23 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   Registry::DisposeStation(Tarn::kStation_Idle);
   EXPECT_EQ(Registry::FindStation(Tarn::kStation_Idle), nullptr) << "the new station is held by a retain it never had";
   Tarn::Messaging::Terminate();
+}
+
+// The library brought up, used (a station made, retired under its own
+// broadcast, disposed of) and terminated gives back every small block it took.
+TEST(MessagingLifecycleTest, TerminateGivesBackEverySmallBlock) {
+  const auto before = kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse;
+  Tarn::Messaging::Initialize();
+  {
+    const ImmutableString id = Registry::RegisterUniqueStation();
+    RecordingListener disposer("disposer");
+    disposer.SetAction([&](const Tarn::Message&) { Registry::DisposeStation(id); });
+    Utils::AddListener(id, &disposer);
+    Utils::BroadcastMessage(id, NumberMessage(1));
+    EXPECT_EQ(Registry::FindStation(id), nullptr);
+  }
+  Tarn::Messaging::Terminate();
+  EXPECT_EQ(kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse, before);
 }
 
 // ---------------------------------------------------------------------------

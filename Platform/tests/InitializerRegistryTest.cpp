@@ -2,9 +2,13 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <chrono>
+#include <future>
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <vector>
 
 using namespace kivcore::config;
@@ -94,6 +98,33 @@ TEST(InitializerRegistry, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminate
   d.reset();
   EXPECT_THROW(InitializerRegistry::TerminateAll(), std::runtime_error);
   EXPECT_EQ((std::vector<std::string>{"init Quitter", "init !A", "init B", "init B", "init C", "init D", "term B", "term !A"}), sLog);
+}
+
+// A second InitializeAll made while another thread runs an init waits for it
+// to finish, rather than answering before the library is up.
+TEST(InitializerRegistry, ACallerWaitsForTheInitRunningOnAnotherThread) {
+  sLog.clear();
+  std::promise<void> entered, release;
+  const std::shared_future<void> go = release.get_future().share();
+  std::atomic<bool> finished{false};
+  const auto slow = Entry("Slow", nullptr, [&] {
+    entered.set_value();
+    go.wait();
+    finished = true;
+    return true;
+  });
+  std::thread first([] { EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList())); });
+  entered.get_future().wait();
+  std::thread second([&] {
+    EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList()));
+    EXPECT_TRUE(finished) << "answered while the init was still running";
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(20));  // most likely, the second caller is in by now
+  release.set_value();
+  first.join();
+  second.join();
+  InitializerRegistry::TerminateAll();
+  EXPECT_EQ((std::vector<std::string>{"init Slow", "term Slow"}), sLog);
 }
 
 }  // namespace
