@@ -9,6 +9,18 @@
 // that has begun, and no copy can be delivered twice. The plain post path
 // neither sees these stores nor takes their locks.
 //
+// Who frees what, and where:
+// - a coalesced copy that a newer one replaces: the replacing poster, after
+//   it has released the store's lock; the map entry: its queued call, on the
+//   main thread, as the delivery begins;
+// - a cancellable copy: the main thread after its delivery, before the
+//   delivery counts as ended; or the thread that calls Cancel, before Cancel
+//   returns; a token's shared state: whichever of its token copies and
+//   queued calls goes last;
+// - an idle-time copy: the main thread after its delivery inside an idle
+//   broadcast, or the thread of the last Terminate;
+// - every kind, when queuing fails: the poster, before the exception leaves.
+//
 // The stores are never destroyed: the calls that refer to them may run
 // during static destruction (a last Terminate made by a static object).
 #include <TarnMessaging/Message.h>
