@@ -23,7 +23,8 @@ int ValueOf(const Tarn::Message& inMessage) { return inMessage.Is<NumberMessage>
 enum Kind { kPlain, kCoalesced, kCancellable, kIdleTime };
 struct Post { int mValue, mStation, mKind, mKey; };  // mKey: the coalescing key (-1: the type's) or the token
 
-// Initialize on the constructing thread, which becomes the main thread.
+// Initialize on the constructing thread, which becomes the main thread. The
+// listeners of a test, made after it, detach themselves as they go.
 struct Library { Library() { Tarn::Messaging::Initialize(); } ~Library() { Tarn::Messaging::Terminate(); } };
 
 // Seeded random sequences of posts of every kind (plain, coalesced under a
@@ -128,7 +129,6 @@ TEST(PostKindsThreadTest, HandlersPostingOrCancellingDuringTheirOwnDeliveryAffec
   EXPECT_EQ((std::vector<std::string>{"a:1", "a:3"}), log.Entries());
   for (int run = 0; run < 2; ++run) FlushPostedMessagesOnUIThread(), BroadcastMessage(kStation_Idle, PingMessage());
   EXPECT_EQ((std::vector<std::string>{"a:1", "a:3", "a:2", "a:5", "a:6"}), log.Entries());
-  RemoveListener(kStation_StatusBar, &a);
 }
 
 TEST(PostKindsThreadTest, CancelOnAWorkerWaitsForTheRunningDeliveryAndNoneFollows) {
@@ -163,7 +163,6 @@ TEST(PostKindsThreadTest, CancelOnAWorkerWaitsForTheRunningDeliveryAndNoneFollow
     FlushPostedMessagesOnUIThread();
     EXPECT_EQ(0, late.load()) << "round " << round;
     EXPECT_EQ(blocks, BlocksInUse()) << "round " << round;
-    RemoveListener(kStation_StatusBar, &a);
   }
 }
 
@@ -212,9 +211,7 @@ TEST(PostKindsThreadTest, CoalescedAndIdlePostsRacingDrainsAndIdleBroadcastsArri
     EXPECT_EQ(all, idle[w]);
     EXPECT_EQ(kPosts, coalesced[w].empty() ? 0 : coalesced[w].back()) << "the newest coalesced post was lost";
     EXPECT_TRUE(std::is_sorted(coalesced[w].begin(), coalesced[w].end(), std::less_equal<int>())) << "a copy went twice, or an older after a newer";
-    RemoveListener(*stations[w], &listeners[w]);
   }
-  RemoveListener(kStation_Idle, &idleListener);
 }
 
 }  // namespace
