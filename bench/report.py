@@ -146,6 +146,15 @@ def report(res, posting_runs):
                        fmt(ratio(lat(k, "p99_us"), lat("Asio", "p99_us")))]
                       for k, label in POSTING if res.has(f"Latency/{k}")]))
 
+    coalescing = [("Plain", "PostMessageToUIThread"), ("Coalesced", "PostCoalescedMessageToUIThread, keyed by worker")]
+    if any(res.has(f"Coalescing/{k}") for k, _ in coalescing):
+        out.append("### Progress reporting: 1M updates from 2 workers, plain against coalesced posts\n")
+        get = lambda k, f: res.get(f"Coalescing/{k}", f)
+        out.append(table(["1M progress updates", "posts per second (millions)", "main-thread CPU (ms)", "deliveries"],
+                         [[label, fmt(get(k, "posts_per_second") and get(k, "posts_per_second") / 1e6),
+                           fmt(get(k, "main_thread_ms"), 1), fmt(get(k, "deliveries"), 0)]
+                          for k, label in coalescing if res.has(f"Coalescing/{k}")]))
+
     out.append("### Allocations\n")
     out.append(table(["per delivery (N=100)", "general-heap allocations", "small blocks"],
                      [[label, fmt(res.get(f"Alloc/Delivery/{k}", "heap_allocs_per_op"), 4),

@@ -9,6 +9,7 @@
 #include <TarnMessaging/MessageImpl.h>
 #include <TarnMessaging/Messaging.h>
 #include <TarnMessaging/NullInterfaceException.h>
+#include <TarnMessaging/PostCancelToken.h>
 #include <TarnMessaging/SafeListener.h>
 #include <TarnMessaging/Station.h>
 #include <TarnMessaging/StationIDs.h>

@@ -6,6 +6,8 @@
 #include <kivcore/MainThread.h>
 #include <kivcore/RecursiveMutex.h>
 
+#include "PostKinds.h"
+
 #include <boost/shared_ptr.hpp>
 
 #include <cstdint>
@@ -62,7 +64,10 @@ void Terminate() {
   if (sMainThreadAdaptor) sMainThreadAdaptor->RunPendingCalls();
   // A pending call may have initialized the library again; it keeps the
   // main thread it registered then.
-  if (sInitializeCount == 0) sMainThreadAdaptor.reset();
+  if (sInitializeCount != 0) return;
+  sMainThreadAdaptor.reset();
+  // Idle-time posts wait for an idle broadcast that no station can make now.
+  Detail::DropIdlePosts();
 }
 
 }  // namespace Messaging

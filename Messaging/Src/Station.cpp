@@ -1,6 +1,8 @@
 #include <TarnMessaging/Station.h>
+#include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "PostKinds.h"
 #include "StationRetirement.h"
 
 #include <kivcore/MainThread.h>
@@ -32,6 +34,10 @@ void Station::BroadcastCounted(const Message& inMessage) {
       if (mStation->mBroadcastDepth.fetch_sub(1, std::memory_order_seq_cst) == 1) StationRetirement::DrainRetired();
     }
   } leave{this};
+  // Idle-time posts go out with an idle broadcast that its listeners hear,
+  // just before them; inside the count, so that the station outlives them.
+  if (Detail::sIdlePostsWaiting.load(std::memory_order_relaxed) && mStationID == kStation_Idle && IsBroadcasting())
+    Detail::RunIdlePosts();
   Broadcaster::BroadcastMessage(inMessage);
 }
 

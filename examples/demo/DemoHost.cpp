@@ -89,6 +89,7 @@ private:
   const std::shared_ptr<DetachProbe> mProbe;
   std::unique_ptr<DetachingListener> mDoomed;  // plain pointer, handed to worker 0
 
+  ProgressMeter mMeter;  // plain pointer, on a private station of coalesced updates
   WorkBoard mBoard;
   std::vector<std::thread> mWorkers;
   std::vector<std::string> mWorkerErrors;  // each written by its worker, read after the join
@@ -121,7 +122,8 @@ DemoApplication::DemoApplication(const DemoOptions& inOptions, const DropLedger&
       mLifecycle(mLifecycleObject),
       mProbe(std::make_shared<DetachProbe>()),
       mDoomed(std::make_unique<DetachingListener>(mProbe)),
-      mBoard(inOptions.mWorkers),
+      mMeter(mPerWorker),
+      mBoard(inOptions.mWorkers, mMeter.StationID()),
       mWorkerErrors(inOptions.mWorkers),
       // Nothing may take longer than the autosave's quiet time plus a
       // generous margin; a stall is reported rather than waited out.
@@ -257,6 +259,10 @@ void DemoApplication::ShutDown(DemoSummary& ioSummary) {
 void DemoApplication::CollectFigures(DemoSummary& ioSummary) {
   DemoSummary& s = ioSummary;
   s.mPosted = mBoard.Posted();
+  s.mMeterPosted = mBoard.MeterPosted();
+  s.mMeterDelivered = mMeter.Delivered();
+  s.mMeterRegressions = mMeter.Regressions();
+  s.mMeterUnfinished = mMeter.Unfinished();
   s.mDelivered = mStatusBar.Delivered();
   s.mDroppedByDesign = mLedger.mDroppedWhileStopped;
   s.mArrivedWhileBroadcasting = mLedger.mArrivedWhileBroadcasting;

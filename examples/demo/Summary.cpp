@@ -41,6 +41,13 @@ void CheckSummary(DemoSummary& ioSummary) {
     AddFault(s, Count(static_cast<std::uint64_t>(-s.mLost)) + " more messages were delivered or dropped than posted");
   if (s.mPosted != s.mMessages)
     AddFault(s, "the workers posted " + Count(s.mPosted) + " messages instead of " + Count(s.mMessages));
+  if (s.mMeterPosted != s.mMessages)
+    AddFault(s, "the workers made " + Count(s.mMeterPosted) + " meter updates instead of " + Count(s.mMessages));
+  if (s.mMeterDelivered > s.mMeterPosted || s.mMeterRegressions != 0)
+    AddFault(s, "the coalesced meter heard " + Count(s.mMeterRegressions) + " stale or repeated updates (" +
+                    Count(s.mMeterDelivered) + " heard of " + Count(s.mMeterPosted) + " posted)");
+  if (s.mMeterUnfinished != 0)
+    AddFault(s, "the meter never heard the last update of " + Count(s.mMeterUnfinished) + " workers");
   if (s.mDuplicates != 0) AddFault(s, Count(s.mDuplicates) + " messages were delivered more than once");
   if (s.mStrays != 0) AddFault(s, Count(s.mStrays) + " deliveries carried a worker or sequence number never posted");
   if (s.mArrivedWhileBroadcasting != s.mDelivered)
@@ -79,6 +86,7 @@ void PrintSummaryTable(const DemoSummary& inSummary, std::FILE* inStream) {
   std::snprintf(buffer, sizeof buffer, "%" PRId64, s.mLost);
   row("lost", buffer);
   row("delivered twice", Count(s.mDuplicates));
+  row("meter updates posted / delivered", Count(s.mMeterPosted) + " / " + Count(s.mMeterDelivered) + " (coalesced)");
   row("latency p50 / p99 / max (us)",
       Count(s.mLatencyP50) + " / " + Count(s.mLatencyP99) + " / " + Count(s.mLatencyMax));
   row("messages per second (while busy)", Count(static_cast<std::uint64_t>(s.mMessagesPerSecond)));
@@ -109,6 +117,7 @@ void PrintSummaryJson(const DemoSummary& inSummary, std::FILE* inStream) {
                ",\"idle_ms\":%u,"
                "\"posted\":%" PRIu64 ",\"delivered\":%" PRIu64 ",\"dropped_by_design\":%" PRIu64 ",\"lost\":%" PRId64
                ",\"duplicates\":%" PRIu64
+               ",\"meter_posted\":%" PRIu64 ",\"meter_delivered\":%" PRIu64
                ","
                "\"latency_us\":{\"p50\":%u,\"p99\":%u,\"max\":%u},"
                "\"messages_per_second\":%.0f,\"busy_seconds\":%.3f,\"wall_seconds\":%.3f,"
@@ -122,7 +131,7 @@ void PrintSummaryJson(const DemoSummary& inSummary, std::FILE* inStream) {
                ","
                "\"ok\":%s,\"faults\":%s}\n",
                s.mWorkers, s.mMessages, s.mIdleMilliSeconds, s.mPosted, s.mDelivered, s.mDroppedByDesign, s.mLost,
-               s.mDuplicates, s.mLatencyP50, s.mLatencyP99, s.mLatencyMax, s.mMessagesPerSecond, s.mBusySeconds,
+               s.mDuplicates, s.mMeterPosted, s.mMeterDelivered, s.mLatencyP50, s.mLatencyP99, s.mLatencyMax, s.mMessagesPerSecond, s.mBusySeconds,
                s.mWallSeconds, s.mLeakedBlocks, s.mAutosaves, s.mBursts, s.mSuspends, s.mResumes,
                s.mDetachedListenerHeard, s.mDetachedMidDelivery ? "true" : "false", s.mDetachViolations,
                s.mFaults.empty() ? "true" : "false", faults.c_str());

@@ -28,6 +28,12 @@ struct DemoSummary {
   std::uint64_t mDuplicates = 0;       // a (worker, sequence) pair delivered again
   std::uint64_t mStrays = 0;           // a (worker, sequence) pair never posted
 
+  // The coalesced progress meter: updates posted against updates delivered.
+  std::uint64_t mMeterPosted = 0;
+  std::uint64_t mMeterDelivered = 0;
+  std::uint64_t mMeterRegressions = 0;  // an update no newer than the one before it
+  std::uint32_t mMeterUnfinished = 0;   // workers whose last update was never heard
+
   // Cross-checks: what the other listeners and the station itself counted.
   std::uint64_t mArrivedWhileBroadcasting = 0;  // the station's own count of what it delivered
   std::uint64_t mTypedHeard = 0;

@@ -46,6 +46,11 @@ void PostBursts(std::uint32_t inIndex, std::uint32_t inCount, WorkBoard& ioBoard
       Tarn::StationUtils::PostMessageToUIThread(Tarn::kStation_StatusBar,
                                                 ProgressMessage(inIndex, sequence, SteadyNanoSeconds()), false);
       ioBoard.NotePosted();
+      // The meter wants the newest count only: a coalesced post replaces the
+      // update still queued instead of adding one.
+      Tarn::StationUtils::PostCoalescedMessageToUIThread(ioBoard.MeterStation(), MeterMessage(inIndex, sequence + 1),
+                                                         inIndex);
+      ioBoard.NoteMeterPosted();
       if (removeNow) {
         ioDoomed->WaitUntilHeld(std::chrono::seconds(1));
         ioDoomed.reset();
@@ -57,6 +62,33 @@ void PostBursts(std::uint32_t inIndex, std::uint32_t inCount, WorkBoard& ioBoard
 }
 
 }  // namespace
+
+ProgressMeter::ProgressMeter(const std::vector<std::uint32_t>& inPerWorker)
+    : mPerWorker(inPerWorker),
+      mStationID(Tarn::StationRegistry::RegisterUniqueStation()),
+      mLastHeard(inPerWorker.size(), 0) {
+  Tarn::StationUtils::AddListener(mStationID, this);
+}
+
+ProgressMeter::~ProgressMeter() {
+  Tarn::StationUtils::RemoveListener(mStationID, this);
+  Tarn::StationRegistry::DisposeStation(mStationID);
+}
+
+void ProgressMeter::ListenToMessage(const Tarn::Message& inMessage) {
+  const MeterMessage* update = inMessage.As<MeterMessage>();
+  if (update == nullptr || update->mWorker >= mLastHeard.size()) return;
+  ++mDelivered;
+  std::uint32_t& last = mLastHeard[update->mWorker];
+  if (update->mDone <= last) ++mRegressions;
+  else last = update->mDone;
+}
+
+std::uint32_t ProgressMeter::Unfinished() const {
+  std::uint32_t unfinished = 0;
+  for (std::size_t w = 0; w < mPerWorker.size(); ++w) unfinished += mLastHeard[w] != mPerWorker[w] ? 1 : 0;
+  return unfinished;
+}
 
 void RunWorker(std::uint32_t inIndex, std::uint32_t inCount, WorkBoard& ioBoard,
                std::unique_ptr<DetachingListener> inDoomed, std::chrono::milliseconds inWaitLimit,

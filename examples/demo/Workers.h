@@ -8,13 +8,18 @@
 //
 // Each worker does kBursts bursts of simulated work and posts a
 // ProgressMessage to kStation_StatusBar after each unit of it. Between two
-// bursts it waits until the main thread opens the next one.
+// bursts it waits until the main thread opens the next one. Beside that
+// exact stream, each unit also updates the worker's progress meter with a
+// coalesced post: the main thread hears only the newest update a worker made
+// before each of its runs, however many were posted.
 //
 // Threading: WorkBoard may be used from any thread; the functions marked
 // "main thread" or "worker" say who calls them.
 #pragma once
 
 #include "DemoListeners.h"
+
+#include <TarnMessaging.h>
 
 #include <atomic>
 #include <chrono>
@@ -23,6 +28,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 namespace tarn_demo {
 
@@ -40,7 +46,11 @@ class WorkBoard {
 public:
   static constexpr std::uint64_t kMaxInFlight = 1000;
 
-  explicit WorkBoard(std::uint32_t inWorkers) : mWorkers(inWorkers) {}
+  // inMeterStation: where the workers' coalesced meter updates go.
+  WorkBoard(std::uint32_t inWorkers, const Tarn::StationUtils::ImmutableString& inMeterStation)
+      : mWorkers(inWorkers), mMeterStation(inMeterStation) {}
+
+  const Tarn::StationUtils::ImmutableString& MeterStation() const { return mMeterStation; }
 
   // Worker: blocks while the main thread is kMaxInFlight posts behind. False
   // when the run was abandoned or inLimit passed first.
@@ -90,6 +100,9 @@ public:
   // Worker: counted after the post has returned.
   void NotePosted() { mPosted.fetch_add(1); }
   std::uint64_t Posted() const { return mPosted.load(); }
+  // Worker: counted after a coalesced meter update has returned.
+  void NoteMeterPosted() { mMeterPosted.fetch_add(1, std::memory_order_relaxed); }
+  std::uint64_t MeterPosted() const { return mMeterPosted.load(); }
 
   void NoteBurstFinished() { mBurstsFinished.fetch_add(1, std::memory_order_acq_rel); }
   bool BurstFinishedByAll(std::uint32_t inBurst) const {
@@ -107,14 +120,52 @@ private:
   }
 
   const std::uint32_t mWorkers;
+  const Tarn::StationUtils::ImmutableString mMeterStation;
   std::mutex mMutex;
   std::condition_variable mChanged;
   std::uint32_t mOpenBurst = 0;  // guarded by mMutex
   bool mAbandoned = false;       // guarded by mMutex
   std::atomic<std::uint64_t> mPosted{0};
+  std::atomic<std::uint64_t> mMeterPosted{0};
   std::atomic<std::uint64_t> mHandled{0};         // written by the main thread
   std::atomic<int> mWaitingForRoom{0};            // workers in WaitForRoom
   std::atomic<std::uint64_t> mBurstsFinished{0};  // one count per worker and burst
+};
+
+// A worker's newest count of units done, posted coalesced (keyed by worker).
+struct MeterMessage : Tarn::MessageImpl<MeterMessage> {
+  MeterMessage(std::uint32_t inWorker, std::uint32_t inDone) : mWorker(inWorker), mDone(inDone) {}
+  std::uint32_t mWorker;
+  std::uint32_t mDone;  // 1, 2, ... up to the worker's count
+};
+
+// The progress meter: listens on a private station to the workers' coalesced
+// updates and checks what coalescing promises: each worker's updates arrive
+// newest-so-far only (never an older or the same one again), and the last
+// one arrives. Main thread only, like its deliveries.
+class ProgressMeter : public Tarn::Listener {
+public:
+  // inPerWorker[w]: the units worker w does.
+  explicit ProgressMeter(const std::vector<std::uint32_t>& inPerWorker);
+  ~ProgressMeter() override;
+  ProgressMeter(const ProgressMeter&) = delete;
+  ProgressMeter& operator=(const ProgressMeter&) = delete;
+
+  void ListenToMessage(const Tarn::Message& inMessage) override;
+
+  const Tarn::StationUtils::ImmutableString& StationID() const { return mStationID; }
+  std::uint64_t Delivered() const { return mDelivered; }
+  // Updates that were not newer than the one before from the same worker.
+  std::uint64_t Regressions() const { return mRegressions; }
+  // Workers whose last update heard is not their last unit.
+  std::uint32_t Unfinished() const;
+
+private:
+  const std::vector<std::uint32_t> mPerWorker;
+  const Tarn::StationUtils::ImmutableString mStationID;
+  std::vector<std::uint32_t> mLastHeard;  // by worker; 0 before the first update
+  std::uint64_t mDelivered = 0;
+  std::uint64_t mRegressions = 0;
 };
 
 // The body of worker inIndex, which posts inCount messages. The worker that

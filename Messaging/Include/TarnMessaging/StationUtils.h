@@ -6,6 +6,9 @@
 ///   StationUtils::BroadcastMessage(kStation_StatusBar, Progress(1, 2)); // main thread
 ///   StationUtils::PostMessageToUIThread(kStation_StatusBar, Progress(2, 2), false); // any thread
 ///   StationUtils::FlushPostedMessagesOnUIThread();                     // main thread
+///   StationUtils::PostCoalescedMessageToUIThread(kStation_StatusBar, Progress(3, 4)); // latest wins
+///   StationUtils::PostMessageToUIThread(kStation_StatusBar, Progress(4, 4), token);   // token.Cancel() drops it
+///   StationUtils::PostMessageAtIdleTime(kStation_StatusBar, Tidy());                  // with the next idle broadcast
 /// @endcode
 ///
 /// Each function that touches a station retains it from the registry for the
@@ -21,6 +24,10 @@
 /// and one thread's posts in the order it made them, also across a flush
 /// made from inside a handler; besides a gone or stopped station, only the
 /// last Tarn::Messaging::Terminate drops a post (those still queued then).
+/// The other kinds of post follow the same rules, except what their own
+/// declarations say: a coalesced post may be replaced by a later one, a
+/// cancellable post is dropped by its token, and an idle-time post waits for
+/// the idle station's next broadcast instead of the next run.
 ///
 /// Misuse (a null or expired listener, an empty station ID in SwitchStation)
 /// is reported through the contract-check procedure before the station is
@@ -29,12 +36,14 @@
 
 #include <TarnMessaging/Export.h>
 #include <TarnMessaging/Message.h>
+#include <TarnMessaging/PostCancelToken.h>
 #include <TarnMessaging/SafeListener.h>
 
 #include <kivcore/ImmutableString.h>
 
 #include <boost/weak_ptr.hpp>
 
+#include <cstdint>
 #include <memory>
 
 namespace Tarn {
@@ -99,6 +108,37 @@ TARN_MESSAGING_API void SwitchStation(const ImmutableString& inFromStationID, co
 /// the poster. inMessage may be destroyed as soon as this returns.
 TARN_MESSAGING_API void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
                                               bool inForceAsync);
+/// Coalesced post: queues a copy as PostMessageToUIThread does (also on the
+/// main thread), unless a post with the same key is still queued; then that
+/// post's copy is replaced by this one, which keeps the earlier place in the
+/// queue. The key is the station and the message's type, or the station and
+/// inCallerKey (a space of its own: caller keys never meet type keys). A post
+/// is queued again once its delivery has begun, so the copy delivered is the
+/// newest when it is delivered, and none is delivered twice. Throws
+/// std::bad_alloc when storage is out; the queued post, if any, stays as it
+/// was then.
+/// @{
+TARN_MESSAGING_API void PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage);
+TARN_MESSAGING_API void PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
+                                                       std::uint64_t inCallerKey);
+/// @}
+
+/// Cancellable post: queues a copy (also on the main thread) that
+/// inToken.Cancel() drops, and frees, for as long as it is undelivered. With
+/// a token already cancelled, copies nothing and queues nothing. Throws
+/// std::bad_alloc when storage is out; nothing is queued then.
+TARN_MESSAGING_API void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
+                                              const PostCancelToken& inToken);
+
+/// Idle-time post: keeps a copy until the next broadcast on kStation_Idle
+/// that its listeners hear (on the main thread, the station broadcasting),
+/// and broadcasts the copy on inStationID just before them; never earlier,
+/// and not by FlushPostedMessagesOnUIThread. Posts made meanwhile, from its
+/// handlers too, wait for the next idle broadcast. The last
+/// Tarn::Messaging::Terminate drops and frees those still waiting. Throws
+/// std::bad_alloc when storage is out; nothing is kept then.
+TARN_MESSAGING_API void PostMessageAtIdleTime(const ImmutableString& inStationID, const Message& inMessage);
+
 /// Runs every pending call of the main thread now; meant for the main thread.
 /// From inside a handler of a posted message, first runs the posts the outer
 /// run has not reached. Does nothing while no main thread is registered.

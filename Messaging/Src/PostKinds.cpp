@@ -1,0 +1,327 @@
+// Coalesced, cancellable and idle-time posts, beside the plain post of
+// StationUtils.cpp.
+//
+// Each kind keeps the copies it may still replace, drop or hold back in a
+// store of its own, under a mutex of its own, and (except idle-time posts,
+// which never enter the main thread's queue) queues a one-pointer-sized call
+// that takes its copy out of the store when it runs. A copy taken out is
+// gone from the store, so no later replacement or cancel reaches a delivery
+// that has begun, and no copy can be delivered twice. The plain post path
+// neither sees these stores nor takes their locks.
+//
+// Who frees what, and where:
+// - a coalesced copy that a newer one replaces: the replacing poster, after
+//   it has released the store's lock; the map entry: its queued call, on the
+//   main thread, as the delivery begins;
+// - a cancellable copy: the main thread after its delivery, before the
+//   delivery counts as ended; or the thread that calls Cancel, before Cancel
+//   returns; a token's shared state: whichever of its token copies and
+//   queued calls goes last;
+// - an idle-time copy: the main thread after its delivery inside an idle
+//   broadcast, or the thread of the last Terminate;
+// - every kind, when queuing fails: the poster, before the exception leaves.
+//
+// The stores are never destroyed: the calls that refer to them may run
+// during static destruction (a last Terminate made by a static object).
+#include <TarnMessaging/Message.h>
+#include <TarnMessaging/PostCancelToken.h>
+#include <TarnMessaging/StationUtils.h>
+
+#include "PostKinds.h"
+
+#include <kivcore/MainThread.h>
+
+#include <boost/function.hpp>
+
+#include <algorithm>
+#include <condition_variable>
+#include <cstdint>
+#include <deque>
+#include <iterator>
+#include <map>
+#include <mutex>
+#include <tuple>
+#include <utility>
+#include <vector>
+
+namespace Tarn {
+
+using kivcore::utility::ImmutableString;
+using PostedCall = boost::function<void()>;
+
+// ---------------------------------------------------------------------------
+// Cancellable posts
+
+namespace Detail {
+
+// The state a token's copies and its queued posts share.
+struct PostCancelState {
+  static const std::shared_ptr<PostCancelState>& Of(const PostCancelToken& inToken) noexcept { return inToken.mState; }
+
+  std::mutex mMutex;
+  std::condition_variable mDeliveryEnded;  // notified when mRunning drops to 0
+  std::atomic<bool> mCancelled{false};     // set under mMutex, read without it
+  int mRunning = 0;                        // deliveries under way; guarded by mMutex
+  std::uint64_t mNextSerial = 0;           // guarded by mMutex
+  // The undelivered copies, by ascending serial; guarded by mMutex.
+  std::deque<std::pair<std::uint64_t, PostedCall>> mPending;
+};
+
+}  // namespace Detail
+
+namespace {
+
+using CancelState = Detail::PostCancelState;
+
+// What the queue holds for a cancellable post. The copy stays with the token,
+// so that Cancel can free it at once rather than when the queue gets here.
+class CancellableCall {
+public:
+  CancellableCall(const std::shared_ptr<CancelState>& inState, std::uint64_t inSerial) noexcept
+      : mState(inState), mSerial(inSerial) {}
+
+  void operator()() const {
+    CancelState& state = *mState;
+    PostedCall call;
+    {
+      std::lock_guard<std::mutex> lock(state.mMutex);
+      // Posts made on one thread run in serial order, so this is nearly
+      // always the front; posts of several threads may be queued out of it.
+      const auto entry = std::lower_bound(
+          state.mPending.begin(), state.mPending.end(), mSerial,
+          [](const std::pair<std::uint64_t, PostedCall>& inEntry, std::uint64_t inSerial) { return inEntry.first < inSerial; });
+      // Gone: Cancel took and freed it.
+      if (entry == state.mPending.end() || entry->first != mSerial) return;
+      call.swap(entry->second);
+      state.mPending.erase(entry);
+      ++state.mRunning;
+    }
+    // The copy is freed before the delivery counts as ended, so that a Cancel
+    // that waited for it leaves no copy of the token's posts behind.
+    struct EndDelivery {
+      CancelState& mState;
+      PostedCall& mCall;
+      ~EndDelivery() {
+        mCall.clear();
+        std::lock_guard<std::mutex> lock(mState.mMutex);
+        if (--mState.mRunning == 0) mState.mDeliveryEnded.notify_all();
+      }
+    } end{state, call};
+    call();
+  }
+
+private:
+  std::shared_ptr<CancelState> mState;
+  std::uint64_t mSerial;
+};
+static_assert(boost::detail::function::function_allows_small_object_optimization<CancellableCall>::value,
+              "a cancellable call must fit inside boost::function");
+
+}  // namespace
+
+PostCancelToken::PostCancelToken() : mState(std::make_shared<CancelState>()) {}
+PostCancelToken::~PostCancelToken() = default;
+PostCancelToken::PostCancelToken(const PostCancelToken& inOther) noexcept = default;
+PostCancelToken& PostCancelToken::operator=(const PostCancelToken& inOther) noexcept = default;
+
+void PostCancelToken::Cancel() {
+  CancelState& state = *mState;
+  std::deque<std::pair<std::uint64_t, PostedCall>> dropped;
+  {
+    std::lock_guard<std::mutex> lock(state.mMutex);
+    state.mCancelled.store(true, std::memory_order_release);
+    dropped.swap(state.mPending);
+  }
+  // Message destructors are the host's code: never under our lock.
+  dropped.clear();
+  // A delivery running on the main thread while Cancel is called there is
+  // one of Cancel's own callers; waiting for it would never end.
+  if (kivcore::threads::CurrentThreadIsMainThread()) return;
+  std::unique_lock<std::mutex> lock(state.mMutex);
+  state.mDeliveryEnded.wait(lock, [&state] { return state.mRunning == 0; });
+}
+
+bool PostCancelToken::IsCancelled() const noexcept { return mState->mCancelled.load(std::memory_order_acquire); }
+
+void StationUtils::PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
+                                         const PostCancelToken& inToken) {
+  const std::shared_ptr<CancelState>& state = CancelState::Of(inToken);
+  if (state->mCancelled.load(std::memory_order_acquire)) return;
+  // Declared before the lock, so that a copy dropped under it is freed after.
+  PostedCall call = inMessage.CreateCallback(inStationID);
+  std::uint64_t serial = 0;
+  {
+    std::lock_guard<std::mutex> lock(state->mMutex);
+    if (state->mCancelled.load(std::memory_order_relaxed)) return;
+    serial = state->mNextSerial++;
+    state->mPending.emplace_back(serial, std::move(call));
+  }
+  try {
+    kivcore::threads::AsyncCallFromMainThread(PostedCall(CancellableCall(state, serial)), 0);
+  } catch (...) {
+    // Not queued: nothing would ever take the copy out again.
+    PostedCall lost;
+    {
+      std::lock_guard<std::mutex> lock(state->mMutex);
+      for (auto entry = state->mPending.begin(); entry != state->mPending.end(); ++entry) {
+        if (entry->first != serial) continue;
+        lost.swap(entry->second);
+        state->mPending.erase(entry);
+        break;
+      }
+    }
+    throw;
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Coalesced posts
+
+namespace {
+
+enum class CoalesceBy : std::uint8_t { kMessageType, kCallerKey };
+
+struct CoalescingKey {
+  ImmutableString mStationID;
+  std::uint64_t mKey;
+  CoalesceBy mBy;
+
+  bool operator<(const CoalescingKey& inOther) const noexcept {
+    return std::tie(mStationID, mKey, mBy) < std::tie(inOther.mStationID, inOther.mKey, inOther.mBy);
+  }
+};
+
+// A key is in the map exactly while one call for it is queued; that call
+// alone erases it, so the iterator it holds stays valid until it runs.
+using CoalescedMap = std::map<CoalescingKey, PostedCall>;
+
+struct CoalescedPosts {
+  std::mutex mMutex;
+  CoalescedMap mQueued;  // guarded by mMutex
+};
+
+CoalescedPosts& Coalesced() {
+  static CoalescedPosts* posts = new CoalescedPosts;
+  return *posts;
+}
+
+// What the queue holds for a coalesced post: its entry in the map, whose
+// copy is whichever post came last before the call runs.
+class CoalescedCall {
+public:
+  explicit CoalescedCall(CoalescedMap::iterator inEntry) noexcept : mEntry(inEntry) {}
+
+  void operator()() const {
+    CoalescedPosts& posts = Coalesced();
+    PostedCall call;
+    {
+      std::lock_guard<std::mutex> lock(posts.mMutex);
+      call.swap(mEntry->second);
+      // From here on a post with this key is queued anew, behind this one.
+      posts.mQueued.erase(mEntry);
+    }
+    call();
+  }
+
+private:
+  CoalescedMap::iterator mEntry;
+};
+
+void PostCoalesced(const CoalescingKey& inKey, const Message& inMessage) {
+  // Holds the new copy, then the one it replaces, freed after the lock.
+  PostedCall call = inMessage.CreateCallback(inKey.mStationID);
+  CoalescedPosts& posts = Coalesced();
+  CoalescedMap::iterator entry;
+  {
+    std::lock_guard<std::mutex> lock(posts.mMutex);
+    const auto inserted = posts.mQueued.try_emplace(inKey);
+    inserted.first->second.swap(call);
+    if (!inserted.second) return;
+    entry = inserted.first;
+  }
+  try {
+    kivcore::threads::AsyncCallFromMainThread(PostedCall(CoalescedCall(entry)), 0);
+  } catch (...) {
+    // Not queued: no call would ever erase the entry.
+    PostedCall lost;
+    {
+      std::lock_guard<std::mutex> lock(posts.mMutex);
+      lost.swap(entry->second);
+      posts.mQueued.erase(entry);
+    }
+    throw;
+  }
+}
+
+}  // namespace
+
+void StationUtils::PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage) {
+  PostCoalesced(CoalescingKey{inStationID, inMessage.GetMessageID(), CoalesceBy::kMessageType}, inMessage);
+}
+
+void StationUtils::PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
+                                                  std::uint64_t inCallerKey) {
+  PostCoalesced(CoalescingKey{inStationID, inCallerKey, CoalesceBy::kCallerKey}, inMessage);
+}
+
+// ---------------------------------------------------------------------------
+// Idle-time posts
+
+std::atomic<bool> Detail::sIdlePostsWaiting{false};
+
+namespace {
+
+struct IdlePosts {
+  std::mutex mMutex;
+  std::vector<PostedCall> mWaiting;  // in the order posted; guarded by mMutex
+};
+
+IdlePosts& Idle() {
+  static IdlePosts* posts = new IdlePosts;
+  return *posts;
+}
+
+}  // namespace
+
+void StationUtils::PostMessageAtIdleTime(const ImmutableString& inStationID, const Message& inMessage) {
+  PostedCall call = inMessage.CreateCallback(inStationID);
+  IdlePosts& posts = Idle();
+  std::lock_guard<std::mutex> lock(posts.mMutex);
+  posts.mWaiting.push_back(std::move(call));
+  Detail::sIdlePostsWaiting.store(true, std::memory_order_relaxed);
+}
+
+void Detail::RunIdlePosts() {
+  IdlePosts& posts = Idle();
+  std::vector<PostedCall> batch;
+  {
+    std::lock_guard<std::mutex> lock(posts.mMutex);
+    batch.swap(posts.mWaiting);
+    sIdlePostsWaiting.store(false, std::memory_order_relaxed);
+  }
+  std::size_t next = 0;
+  try {
+    while (next < batch.size()) {
+      PostedCall& call = batch[next++];
+      call();
+      call.clear();
+    }
+  } catch (...) {
+    // They were posted before anything that waits now.
+    std::lock_guard<std::mutex> lock(posts.mMutex);
+    posts.mWaiting.insert(posts.mWaiting.begin(), std::make_move_iterator(batch.begin() + static_cast<std::ptrdiff_t>(next)),
+                          std::make_move_iterator(batch.end()));
+    if (!posts.mWaiting.empty()) sIdlePostsWaiting.store(true, std::memory_order_relaxed);
+    throw;
+  }
+}
+
+void Detail::DropIdlePosts() noexcept {
+  IdlePosts& posts = Idle();
+  std::vector<PostedCall> dropped;
+  std::lock_guard<std::mutex> lock(posts.mMutex);
+  dropped.swap(posts.mWaiting);
+  sIdlePostsWaiting.store(false, std::memory_order_relaxed);
+}
+
+}  // namespace Tarn

@@ -1,0 +1,217 @@
+// Coalesced, cancellable and idle-time posts: each kind against a model on
+// seeded sequences, what handlers do to their own post, and the races of
+// workers posting while the main thread drains and tokens are cancelled.
+#include "TestSupport.h"
+
+#include <TarnMessaging.h>
+
+#include <algorithm>
+#include <numeric>
+#include <random>
+
+namespace {
+
+using namespace messaging_test;
+using namespace Tarn::StationUtils;
+using Tarn::kStation_Idle;
+using Tarn::kStation_Repeat;
+using Tarn::kStation_StatusBar;
+
+std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse; }
+int ValueOf(const Tarn::Message& inMessage) { return inMessage.Is<NumberMessage>() ? inMessage.As<NumberMessage>()->mValue : -1; }
+
+enum Kind { kPlain, kCoalesced, kCancellable, kIdleTime };
+struct Post { int mValue, mStation, mKind, mKey; };  // mKey: the coalescing key (-1: the type's) or the token
+
+// Initialize on the constructing thread, which becomes the main thread. The
+// listeners of a test, made after it, detach themselves as they go.
+struct Library { Library() { Tarn::Messaging::Initialize(); } ~Library() { Tarn::Messaging::Terminate(); } };
+
+// Seeded random sequences of posts of every kind (plain, coalesced under a
+// type or a caller key, cancellable under one of two tokens, idle-time), made
+// on the main thread or a worker, mixed with cancels on either thread,
+// flushes, idle broadcasts on a stopped or running idle station, and restarts
+// of the library; checked after every step against a model of what each
+// listener has heard and of how many copies are still alive.
+TEST(PostKindsThreadTest, EveryKindOfPostDeliversAndFreesWhatAModelSaysOnSeededSequences) {
+  const ImmutableString* stations[] = {&Tarn::kStation_StatusBar, &Tarn::kStation_Repeat, &Tarn::kStation_Idle};
+  const std::size_t before = BlocksInUse();
+  for (unsigned seed = 1; seed <= 40; ++seed) {
+    std::mt19937 random(seed);
+    const auto pick = [&random](int inBound) { return std::uniform_int_distribution<int>(0, inBound - 1)(random); };
+    CallLog log;
+    RecordingListener listeners[] = {RecordingListener("s0", &log), RecordingListener("s1", &log), RecordingListener("idle", &log)};
+    std::size_t base = 0;
+    const auto start = [&] {
+      Tarn::Messaging::Initialize();
+      for (int s = 0; s < 3; ++s) AddListener(*stations[s], &listeners[s]);
+      base = BlocksInUse();
+    };
+    start();
+    std::vector<Post> queued, idle;
+    std::vector<std::string> heard;
+    Tarn::PostCancelToken tokens[2];
+    bool cancelled[2] = {false, false}, idleStopped = false;
+    const auto hear = [&](const Post& inPost) { heard.push_back("s" + std::to_string(inPost.mStation) + ":" + std::to_string(inPost.mValue)); };
+    const auto onSomeThread = [&](const std::function<void()>& inCall) { pick(2) == 0 ? inCall() : std::thread(inCall).join(); };
+    for (int step = 0; step < 120; ++step) {
+      const int kind = pick(4), key = pick(3) - 1, token = pick(2);
+      const Post post{step, pick(2), kind, kind == kCancellable ? token : key};
+      const NumberMessage message(step);  // posted to *stations[post.mStation]
+      const ImmutableString& station = *stations[post.mStation];
+      const std::function<void()> posts[] = {
+          [&] { PostMessageToUIThread(station, message, true); },
+          [&] { key < 0 ? PostCoalescedMessageToUIThread(station, message) : PostCoalescedMessageToUIThread(station, message, static_cast<std::uint64_t>(key)); },
+          [&] { PostMessageToUIThread(station, message, tokens[token]); },
+          [&] { PostMessageAtIdleTime(station, message); }};
+      const auto same = std::find_if(queued.begin(), queued.end(), [&](const Post& inQueued) { return kind == kCoalesced && inQueued.mKind == kind && inQueued.mStation == post.mStation && inQueued.mKey == key; });
+      switch (pick(9)) {
+        case 0: case 1: case 2: case 3:
+          onSomeThread(posts[kind]);
+          if (same != queued.end()) same->mValue = step;
+          else if (kind == kIdleTime) idle.push_back(post);
+          else if (kind != kCancellable || !cancelled[token]) queued.push_back(post);
+          break;
+        case 4:
+          onSomeThread([&] { tokens[token].Cancel(); });
+          cancelled[token] = true;
+          queued.erase(std::remove_if(queued.begin(), queued.end(), [token](const Post& inQueued) { return inQueued.mKind == kCancellable && inQueued.mKey == token; }), queued.end());
+          if (pick(2) == 0) tokens[token] = Tarn::PostCancelToken(), cancelled[token] = false;
+          break;
+        case 5:
+          FlushPostedMessagesOnUIThread(), std::for_each(queued.begin(), queued.end(), hear), queued.clear();
+          break;
+        case 6:
+          BroadcastMessage(Tarn::kStation_Idle, PingMessage());
+          if (!idleStopped) std::for_each(idle.begin(), idle.end(), hear), idle.clear(), heard.push_back("idle:ping");
+          break;
+        case 7:
+          (idleStopped = !idleStopped) ? StopBroadcasting(Tarn::kStation_Idle) : StartBroadcasting(Tarn::kStation_Idle);
+          break;
+        case 8:
+          if (pick(4) != 0) break;
+          Tarn::Messaging::Terminate();  // the queued posts find no station; the idle-time ones are dropped
+          ASSERT_EQ(before, BlocksInUse()) << "seed " << seed << " step " << step << ": a copy outlived Terminate";
+          queued.clear(), idle.clear(), idleStopped = false, start();
+          break;
+      }
+      ASSERT_EQ(heard, log.Entries()) << "seed " << seed << " step " << step;
+      ASSERT_EQ(base + queued.size() + idle.size(), BlocksInUse()) << "seed " << seed << " step " << step << ": copies alive";
+    }
+    Tarn::Messaging::Terminate();
+    ASSERT_EQ(before, BlocksInUse()) << "seed " << seed;
+  }
+}
+
+// What handlers do to the post being delivered: a coalesced post of the same
+// key is queued anew (not merged into the delivery under way, and not lost);
+// cancelling its token on the main thread returns at once and drops the
+// rest; an idle-time post waits for the next idle broadcast.
+TEST(PostKindsThreadTest, HandlersPostingOrCancellingDuringTheirOwnDeliveryAffectOnlyLaterPosts) {
+  Library library;
+  CallLog log;
+  Tarn::PostCancelToken token;
+  RecordingListener a("a", &log);
+  a.SetAction([token](const Tarn::Message& inMessage) mutable {
+    const int value = ValueOf(inMessage);
+    if (value == 1) PostCoalescedMessageToUIThread(kStation_StatusBar, NumberMessage(2));
+    if (value == 3) token.Cancel();
+    if (value == 5) PostMessageAtIdleTime(kStation_StatusBar, NumberMessage(6));
+  });
+  AddListener(kStation_StatusBar, &a);
+  std::thread([&token] {
+    PostCoalescedMessageToUIThread(kStation_StatusBar, NumberMessage(1));
+    for (int value : {3, 4}) PostMessageToUIThread(kStation_StatusBar, NumberMessage(value), Tarn::PostCancelToken(token));
+    PostMessageAtIdleTime(kStation_StatusBar, NumberMessage(5));
+    BroadcastMessage(kStation_Idle, PingMessage());  // off the main thread: delivers nothing
+  }).join();
+  FlushPostedMessagesOnUIThread();
+  EXPECT_EQ((std::vector<std::string>{"a:1", "a:3"}), log.Entries());
+  for (int run = 0; run < 2; ++run) FlushPostedMessagesOnUIThread(), BroadcastMessage(kStation_Idle, PingMessage());
+  EXPECT_EQ((std::vector<std::string>{"a:1", "a:3", "a:2", "a:5", "a:6"}), log.Entries());
+}
+
+TEST(PostKindsThreadTest, CancelOnAWorkerWaitsForTheRunningDeliveryAndNoneFollows) {
+  Library library;
+  Watchdog watchdog;
+  for (int round = 0; round < 20; ++round) {
+    Tarn::PostCancelToken token;
+    std::atomic<int> cancelled{0}, delivered{0}, late{0};
+    Latch entered;
+    RecordingListener a("a");
+    a.SetAction([&](const Tarn::Message&) {
+      if (cancelled.load()) late.fetch_add(1);
+      if (delivered.fetch_add(1) == 0 && round == 0) {
+        // The one handshake: the worker cancels while this delivery runs.
+        entered.CountDown();
+        std::this_thread::sleep_for(std::chrono::milliseconds(30));
+        EXPECT_FALSE(cancelled.load()) << "Cancel returned while a delivery of its token ran";
+      }
+    });
+    AddListener(kStation_StatusBar, &a);
+    const std::size_t blocks = BlocksInUse();
+    ThreadGroup threads;
+    for (int worker = 0; worker < 2; ++worker)
+      threads.Start([&] { for (int i = 0; i < 500 && !cancelled.load(); ++i) PostMessageToUIThread(kStation_StatusBar, NumberMessage(i), token); });
+    threads.Start([&] {
+      round == 0 ? entered.WaitFor() : WaitUntil([&] { return delivered.load() > 10 * round; }, std::chrono::milliseconds(200));
+      token.Cancel();
+      cancelled.store(1);  // nothing may be heard from here on
+    });
+    while (!cancelled.load()) FlushPostedMessagesOnUIThread();
+    threads.JoinAll();
+    FlushPostedMessagesOnUIThread();
+    EXPECT_EQ(0, late.load()) << "round " << round;
+    EXPECT_EQ(blocks, BlocksInUse()) << "round " << round;
+  }
+}
+
+// Each worker makes coalesced posts (one under its station's type key, the
+// other under a caller key) and idle-time posts, while the main thread
+// flushes and broadcasts idle messages.
+TEST(PostKindsThreadTest, CoalescedAndIdlePostsRacingDrainsAndIdleBroadcastsArriveNewestOnlyOrAllInOrder) {
+  Library library;
+  constexpr int kPosts = 20000;
+  const ImmutableString* stations[] = {&kStation_StatusBar, &kStation_Repeat};
+  int begun = 0, heardIdle = 0, misplaced = 0;
+  std::vector<int> coalesced[2], idle[2];
+  RecordingListener idleListener("idle"), listeners[] = {RecordingListener("a"), RecordingListener("b")};
+  idleListener.SetAction([&](const Tarn::Message&) { ++heardIdle; });
+  AddListener(kStation_Idle, &idleListener);
+  for (int w = 0; w < 2; ++w) {
+    listeners[w].SetAction([&, w](const Tarn::Message& inMessage) {
+      const int value = ValueOf(inMessage);
+      if (value > 0) return coalesced[w].push_back(value);
+      // Idle-time: inside an idle broadcast, before its listeners.
+      if (heardIdle != begun - 1) ++misplaced;
+      idle[w].push_back(-value);
+    });
+    AddListener(*stations[w], &listeners[w]);
+  }
+  const std::size_t blocks = BlocksInUse();
+  std::atomic<int> done{0};
+  ThreadGroup threads;
+  for (int w = 0; w < 2; ++w)
+    threads.Start([&, w] {
+      for (int i = 1; i <= kPosts; ++i) {
+        w == 0 ? PostCoalescedMessageToUIThread(*stations[w], NumberMessage(i)) : PostCoalescedMessageToUIThread(*stations[w], NumberMessage(i), 42);
+        PostMessageAtIdleTime(*stations[w], NumberMessage(-i));
+      }
+      done.fetch_add(1);
+    });
+  const auto drain = [&] { FlushPostedMessagesOnUIThread(), ++begun, BroadcastMessage(kStation_Idle, PingMessage()); };
+  while (done.load() < 2) drain();
+  threads.JoinAll();
+  drain();
+  EXPECT_EQ(blocks, BlocksInUse());
+  EXPECT_EQ(0, misplaced) << "an idle-time post went outside an idle broadcast, or after its listeners";
+  std::vector<int> all(kPosts);
+  std::iota(all.begin(), all.end(), 1);
+  for (int w = 0; w < 2; ++w) {
+    EXPECT_EQ(all, idle[w]);
+    EXPECT_EQ(kPosts, coalesced[w].empty() ? 0 : coalesced[w].back()) << "the newest coalesced post was lost";
+    EXPECT_TRUE(std::is_sorted(coalesced[w].begin(), coalesced[w].end(), std::less_equal<int>())) << "a copy went twice, or an older after a newer";
+  }
+}
+
+}  // namespace
