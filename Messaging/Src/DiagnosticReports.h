@@ -6,6 +6,7 @@
 #pragma once
 
 #include <TarnMessaging/Diagnostics.h>
+#include <TarnMessaging/Message.h>
 
 #include <kivcore/ImmutableString.h>
 
@@ -34,7 +35,7 @@ inline bool ReportsOn() noexcept { return sReportsOn.load(std::memory_order_rela
 // Reports inFailure of inOperation (a qualified function name) on
 // inStationID once per call site, when reports are on. inCount is the number
 // of stations concerned (the Terminate reports), inDetail what is known of
-// the first one. kBroadcastOffMainThread and kUnregisteredStation made by
+// the first one. A null call site is the library's own call: not reported. kBroadcastOffMainThread and kUnregisteredStation made by
 // the library's own code are not reported. Never throws.
 void ReportSilentFailure(Failure inFailure, const void* inCallSite, const char* inOperation,
                          const kivcore::utility::ImmutableString& inStationID, std::size_t inCount = 0,
@@ -54,3 +55,9 @@ namespace Tarn::StationRegistry {
 // Terminate, with the host's call site for its reports.
 void TerminateFrom(const void* inCallSite);
 }  // namespace Tarn::StationRegistry
+
+namespace Tarn::StationUtils {
+// BroadcastMessage for a posted copy: a station disposed of since the post is
+// an ordinary miss, not reported.
+void BroadcastPostedCopy(const kivcore::utility::ImmutableString& inStationID, const Message& inMessage);
+}  // namespace Tarn::StationUtils

@@ -124,7 +124,7 @@ std::string ReportKey(Failure inFailure, const char* inOperation, const kivcore:
 void ReportSilentFailure(Failure inFailure, const void* inCallSite, const char* inOperation,
                          const kivcore::utility::ImmutableString& inStationID, std::size_t inCount,
                          std::size_t inDetail) noexcept {
-  if (!ReportsOn() || !FirstReport(inCallSite, inFailure)) return;
+  if (!ReportsOn() || inCallSite == nullptr || !FirstReport(inCallSite, inFailure)) return;
   const bool ordinaryMiss =
       inFailure == Failure::kBroadcastOffMainThread || inFailure == Failure::kUnregisteredStation;
   if (ordinaryMiss && IsInsideLibrary(inCallSite)) return;

@@ -213,7 +213,7 @@ public:
   // Takes over the one owner that CreateCallback made.
   void Adopt(PostedCopy* inCopy) noexcept { mCopy = inCopy; }
 
-  void operator()() const { StationUtils::BroadcastMessage(mCopy->mStationID, *mCopy->mMessage); }
+  void operator()() const { StationUtils::BroadcastPostedCopy(mCopy->mStationID, *mCopy->mMessage); }
 
 private:
   PostedCopy* mCopy;  // one of its owners; null only before Adopt

@@ -53,6 +53,18 @@ void AddAt(const ImmutableString& inStationID, const ListenerRef& inListener, co
   else ReportNoStation(inStationID, inCallSite, "Tarn::StationUtils::AddListener");
 }
 
+void BroadcastAt(const ImmutableString& inStationID, const Message& inMessage, const void* inCallSite) {
+  // Nothing would be delivered, so the station is not even looked up.
+  if (!kivcore::threads::CurrentThreadIsMainThread()) {
+    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kBroadcastOffMainThread, inCallSite,
+                                             "Tarn::StationUtils::BroadcastMessage", inStationID);
+    return;
+  }
+  StationRetainer station(inStationID);
+  if (station) station->BroadcastMessage(inMessage);
+  else ReportNoStation(inStationID, inCallSite, "Tarn::StationUtils::BroadcastMessage");
+}
+
 }  // namespace
 
 void AddListener(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener) {
@@ -100,15 +112,11 @@ void RemoveListener(const ImmutableString& inStationID, InterfaceRef<ISafeListen
 }
 
 void BroadcastMessage(const ImmutableString& inStationID, const Message& inMessage) {
-  // Nothing would be delivered, so the station is not even looked up.
-  if (!kivcore::threads::CurrentThreadIsMainThread()) {
-    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kBroadcastOffMainThread, TARN_CALL_SITE(),
-                                             "Tarn::StationUtils::BroadcastMessage", inStationID);
-    return;
-  }
-  StationRetainer station(inStationID);
-  if (station) station->BroadcastMessage(inMessage);
-  else ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::BroadcastMessage");
+  BroadcastAt(inStationID, inMessage, TARN_CALL_SITE());
+}
+
+void BroadcastPostedCopy(const ImmutableString& inStationID, const Message& inMessage) {
+  BroadcastAt(inStationID, inMessage, nullptr);
 }
 
 bool HasListeners(const ImmutableString& inStationID) {
