@@ -9,6 +9,25 @@
 
 namespace Tarn {
 
+namespace {
+
+// One station broadcast running on this thread: a record on the
+// broadcasting thread's own stack, linked from the innermost outwards.
+struct RelayFrame {
+  const Station* mStation;
+  const Message* mMessage;
+  const RelayFrame* mOuter;
+};
+
+// The innermost frame of this thread. Per thread, not per station: the main
+// thread may change while a broadcast runs (its thread then finishes it), so
+// two threads may each have broadcasts on one station running, and each walks
+// and unwinds only its own frames. Initial-exec, as kivcore's allocator
+// cache: one load or store relative to the thread pointer.
+thread_local const RelayFrame* tRelaying __attribute__((tls_model("initial-exec"))) = nullptr;
+
+}  // namespace
+
 Station::Station(const kivcore::utility::ImmutableString& inStationID) : mStationID(inStationID) {}
 
 Station::~Station() {
@@ -24,15 +43,15 @@ Station::~Station() {
 
 void Station::BroadcastCounted(const Message& inMessage) {
   mBroadcastDepth.fetch_add(1, std::memory_order_seq_cst);
-  // Two stack stores: the record of what this station relays lives in the
+  // A few stack stores: the record of what this station relays lives in the
   // broadcast's own frame, so a relay allocates nothing.
-  const RelayFrame frame{&inMessage, mRelaying};
-  mRelaying = &frame;
+  const RelayFrame frame{this, &inMessage, tRelaying};
+  tRelaying = &frame;
   struct Leave {
     Station* mStation;
     const RelayFrame* mOuter;
     ~Leave() {
-      mStation->mRelaying = mOuter;
+      tRelaying = mOuter;
       // The outermost broadcast has ended: stations retired meanwhile (this
       // one perhaps) may go now. Nothing of this station is touched after.
       if (mStation->mBroadcastDepth.fetch_sub(1, std::memory_order_seq_cst) == 1) StationRetirement::DrainRetired();
@@ -42,8 +61,10 @@ void Station::BroadcastCounted(const Message& inMessage) {
 }
 
 bool Station::IsRelaying(const Message& inMessage) const noexcept {
-  for (const RelayFrame* frame = mRelaying; frame != nullptr; frame = frame->mOuter) {
-    if (frame->mMessage == &inMessage) return true;
+  // As deep as station broadcasts are nested on this thread: one or two
+  // frames in practice.
+  for (const RelayFrame* frame = tRelaying; frame != nullptr; frame = frame->mOuter) {
+    if (frame->mStation == this && frame->mMessage == &inMessage) return true;
   }
   return false;
 }
@@ -59,13 +80,12 @@ void Station::BroadcastMessage(const Message& inMessage) {
 }
 
 void Station::ListenToMessage(const Message& inMessage) {
-  // Relays run inside a broadcast, on the main thread; mRelaying belongs to
-  // that thread.
+  // Off the main thread a relay delivers nothing and needs no count.
   if (!kivcore::threads::CurrentThreadIsMainThread()) return;
   // The same object coming back is a cycle of relays (or a station attached
   // to itself): relaying it again would recurse without end. Everyone below
   // has heard it or will, so dropping the repeat loses nothing.
-  if (mRelaying != nullptr && IsRelaying(inMessage)) {
+  if (IsRelaying(inMessage)) {
     TARN_CONTRACT_CHECK(!IsRelaying(inMessage), "Tarn::Station::ListenToMessage");
     return;
   }

@@ -404,7 +404,7 @@ void TerminateFrom(const void* inCallSite) {
 }  // namespace StationRegistry
 
 bool Diagnostics::Detail::IsStationRegistered(const ImmutableString& inStationID) {
-  RegistryLock lock("StationRegistry::FindStation");
+  RegistryLock lock("StationRegistry::IsStationRegistered");
   StationMapAccess map;
   return map->find(inStationID) != map->end();
 }

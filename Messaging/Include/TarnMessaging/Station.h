@@ -71,23 +71,16 @@ public:
 
 private:
   friend class StationRetirement;
-  // One broadcast on this station running on the main thread; on that
-  // thread's stack, innermost first.
-  struct RelayFrame {
-    const Message* mMessage;
-    const RelayFrame* mOuter;
-  };
   // Broadcaster::BroadcastMessage, counted in mBroadcastDepth while it runs.
   TARN_MESSAGING_LOCAL void BroadcastCounted(const Message& inMessage);
-  // Whether a broadcast of this very object on this station runs below.
+  // Whether a broadcast of this very object on this station runs below, on
+  // the calling thread.
   TARN_MESSAGING_LOCAL bool IsRelaying(const Message& inMessage) const noexcept;
 
   const kivcore::utility::ImmutableString mStationID;
   // Broadcasts on this station running on the main thread, relays included.
   // Changed only by the thread that broadcasts; read by the registry.
   std::atomic<std::int32_t> mBroadcastDepth{0};
-  // The broadcasts of mBroadcastDepth, innermost first; main thread only.
-  const RelayFrame* mRelaying = nullptr;
 };
 
 }  // namespace Tarn
