@@ -15,8 +15,6 @@ public:
       : mPrevious(Tarn::Diagnostics::SetSilentFailureReports(inSetting)) {
     Tarn::Diagnostics::ForgetReportedCallSites();
   }
-  SilentFailureReportsSetting(const SilentFailureReportsSetting&) = delete;
-  SilentFailureReportsSetting& operator=(const SilentFailureReportsSetting&) = delete;
   ~SilentFailureReportsSetting() { Tarn::Diagnostics::SetSilentFailureReports(mPrevious); }
 
 private:
