@@ -4,6 +4,7 @@
 // aborts with the operations that led there. The sanitizers catch the rest.
 //
 // Build and run: fuzz/run.sh [SECONDS].
+#include "DiagnosticsTestSupport.h"
 #include "OperationsHarness.h"
 
 #include <fuzzer/FuzzedDataProvider.h>
@@ -28,6 +29,8 @@ private:
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* inData, std::size_t inSize) {
+  // Sequences end with stations retained on purpose; the harness fails on any report.
+  const messaging_test::SilentFailureReportsSetting quiet(Tarn::Diagnostics::SilentFailureReports::kOff);
   FuzzChoices choices(inData, inSize);
   const std::string failure = operations_harness::RunSequence(choices, 400);
   if (!failure.empty()) std::fprintf(stderr, "tarn_fuzz_operations: %s\n", failure.c_str()), std::abort();

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <TarnMessaging/Broadcaster.h>
+#include <TarnMessaging/Diagnostics.h>
 #include <TarnMessaging/IdleCountdownTimer.h>
 #include <TarnMessaging/Listener.h>
 #include <TarnMessaging/Message.h>

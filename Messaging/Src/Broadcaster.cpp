@@ -3,6 +3,7 @@
 
 #include "BroadcasterCore.h"
 #include "ContractCheck.h"
+#include "DiagnosticReports.h"
 
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
@@ -213,6 +214,12 @@ void BroadcasterCore::Close() noexcept {
   mOwner = nullptr;
 }
 
+std::size_t BroadcasterCore::CountListeners(Broadcaster& inBroadcaster) {
+  BroadcasterCore& core = *inBroadcaster.mCore;
+  Locked lock(core.mMutex, "Broadcaster::CountListeners");
+  return core.mEntries.size();
+}
+
 void BroadcasterCore::Broadcast(const Message& inMessage) {
   kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
   Frame frame;
@@ -407,7 +414,12 @@ int Broadcaster::DeliverToListener(const BroadcastMessageRecord& inRecord) {
 }
 
 void Broadcaster::BroadcastMessage(const Message& inMessage) {
-  if (!IsBroadcasting() || !kivcore::threads::CurrentThreadIsMainThread()) return;
+  if (!IsBroadcasting()) return;
+  if (!kivcore::threads::CurrentThreadIsMainThread()) {
+    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kBroadcastOffMainThread, TARN_CALL_SITE(),
+                                             "Tarn::Broadcaster::BroadcastMessage", kivcore::utility::ImmutableString());
+    return;
+  }
   // Held for the whole broadcast: a handler that destroys this broadcaster
   // leaves the broadcast a closed, empty core to finish on.
   const std::shared_ptr<BroadcasterCore> core = mCore;

@@ -79,6 +79,9 @@ public:
   // The owner is being destroyed: plain listeners lose their back-links and
   // every registration goes. Waits for nothing.
   void Close() noexcept;
+  // The registrations of inBroadcaster, dead weak ones not yet pruned
+  // included, for the registry's snapshot. Takes the core's lock.
+  static std::size_t CountListeners(Broadcaster& inBroadcaster);
 
 private:
   template <class T>

@@ -1,14 +1,23 @@
 #include <TarnMessaging/MessageImpl.h>
 #include <TarnMessaging/NullInterfaceException.h>
 
+#include "DiagnosticReports.h"
+
 #include <kivcore/SmallBlockAllocator.h>
 
 #include <boost/function.hpp>
 
+#include <cxxabi.h>
+
 #include <atomic>
 #include <cstdint>
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <exception>
+#include <map>
 #include <new>
+#include <string>
 #include <thread>
 
 namespace Tarn {
@@ -88,6 +97,74 @@ LocalMessageType::~LocalMessageType() {
 }
 
 // ---------------------------------------------------------------------------
+// IDs of types with external linkage
+
+namespace {
+
+// Every type name with external linkage whose ID a module has computed, by
+// ID, and the few names that had to leave their hash to an earlier one.
+// Guarded by the spin lock of the local types. Never destroyed, and its
+// storage is the standard allocator's: it lives as long as the process, and a
+// module may compute an ID during static destruction.
+struct MessageTypeTable {
+  std::map<MessageID, std::string> mNames;
+  std::map<std::string, MessageID> mMoved;
+};
+
+MessageTypeTable& Types() {
+  static MessageTypeTable* const sTypes = new MessageTypeTable;
+  return *sTypes;
+}
+
+// "Demangled (decorated)", or the decorated name alone.
+std::string Readable(const std::string& inTypeName) {
+  int status = -1;
+  char* const demangled = abi::__cxa_demangle(inTypeName.c_str(), nullptr, nullptr, &status);
+  std::string text = status == 0 && demangled != nullptr ? std::string(demangled) + " (" + inTypeName + ")" : inTypeName;
+  std::free(demangled);
+  return text;
+}
+
+}  // namespace
+
+MessageID GlobalMessageID(const char* inTypeName) noexcept {
+  const MessageID hash = HashMessageTypeNameToMessageID(inTypeName);
+  MessageID id = hash;
+  std::string earlier;
+  try {
+    const std::string name = inTypeName;
+    {
+      const LocalTypesLock lock;
+      MessageTypeTable& types = Types();
+      const auto moved = types.mMoved.find(name);
+      if (moved != types.mMoved.end()) return moved->second;
+      const auto holder = types.mNames.try_emplace(hash, name).first;
+      if (holder->second == name) return hash;
+      // Two types with one ID would make a listener cast a message to the
+      // wrong type. The later name steps off the hash as a second local type
+      // does, and every module finds it here under its name.
+      earlier = holder->second;
+      while (id == 0 || types.mNames.count(id) != 0) id = id * 2654435761u + 1u;
+      types.mNames.emplace(id, name);
+      types.mMoved.emplace(name, id);
+    }
+    char hashText[16];
+    std::snprintf(hashText, sizeof hashText, "0x%08X", static_cast<unsigned>(hash));
+    Diagnostics::Detail::ReportContractViolation(
+        "message types " + Readable(earlier) + " and " + Readable(name) + " have one message ID " + hashText +
+            ", so one was given another ID: rename one of them",
+        __FILE__, "Tarn::MessageImpl::StaticMessageID", __LINE__);
+  } catch (const std::exception& inError) {
+    // Called from a noexcept function: a throwing error handler (the
+    // default one) cannot take the report up the stack, so it goes here.
+    std::fprintf(stderr, "TarnMessaging: %s\n", inError.what());
+  } catch (...) {
+    // Out of storage: the type keeps its hash, unrecorded, as before.
+  }
+  return id;
+}
+
+// ---------------------------------------------------------------------------
 // Posted copies
 
 namespace {
@@ -136,7 +213,7 @@ public:
   // Takes over the one owner that CreateCallback made.
   void Adopt(PostedCopy* inCopy) noexcept { mCopy = inCopy; }
 
-  void operator()() const { StationUtils::BroadcastMessage(mCopy->mStationID, *mCopy->mMessage); }
+  void operator()() const { StationUtils::BroadcastPostedCopy(mCopy->mStationID, *mCopy->mMessage); }
 
 private:
   PostedCopy* mCopy;  // one of its owners; null only before Adopt

@@ -2,6 +2,8 @@
 #include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "DiagnosticReports.h"
+
 #include <kivcore/InitializerRegistry.h>
 #include <kivcore/MainThread.h>
 #include <kivcore/RecursiveMutex.h>
@@ -58,7 +60,8 @@ void Initialize() {
 void Terminate() {
   MessagingLock lock;
   if (--sInitializeCount != 0) return;
-  StationRegistry::Terminate();
+  // The host's call site, for the reports of what Terminate finds left over.
+  StationRegistry::TerminateFrom(TARN_CALL_SITE());
   // Posts still queued find no station now and deliver nothing; running them
   // frees their copies.
   if (sMainThreadAdaptor) sMainThreadAdaptor->RunPendingCalls();

@@ -2,12 +2,33 @@
 #include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "ContractCheck.h"
+#include "DiagnosticReports.h"
 #include "PostKinds.h"
 #include "StationRetirement.h"
 
 #include <kivcore/MainThread.h>
 
 namespace Tarn {
+
+namespace {
+
+// One station broadcast running on this thread: a record on the
+// broadcasting thread's own stack, linked from the innermost outwards.
+struct RelayFrame {
+  const Station* mStation;
+  const Message* mMessage;
+  const RelayFrame* mOuter;
+};
+
+// The innermost frame of this thread. Per thread, not per station: the main
+// thread may change while a broadcast runs (its thread then finishes it), so
+// two threads may each have broadcasts on one station running, and each walks
+// and unwinds only its own frames. Initial-exec, as kivcore's allocator
+// cache: one load or store relative to the thread pointer.
+thread_local const RelayFrame* tRelaying __attribute__((tls_model("initial-exec"))) = nullptr;
+
+}  // namespace
 
 Station::Station(const kivcore::utility::ImmutableString& inStationID) : mStationID(inStationID) {}
 
@@ -23,17 +44,21 @@ Station::~Station() {
 }
 
 void Station::BroadcastCounted(const Message& inMessage) {
-  // Off the main thread a broadcast delivers nothing and needs no count.
-  if (!kivcore::threads::CurrentThreadIsMainThread()) return;
   mBroadcastDepth.fetch_add(1, std::memory_order_seq_cst);
+  // A few stack stores: the record of what this station relays lives in the
+  // broadcast's own frame, so a relay allocates nothing.
+  const RelayFrame frame{this, &inMessage, tRelaying};
+  tRelaying = &frame;
   struct Leave {
     Station* mStation;
+    const RelayFrame* mOuter;
     ~Leave() {
+      tRelaying = mOuter;
       // The outermost broadcast has ended: stations retired meanwhile (this
       // one perhaps) may go now. Nothing of this station is touched after.
       if (mStation->mBroadcastDepth.fetch_sub(1, std::memory_order_seq_cst) == 1) StationRetirement::DrainRetired();
     }
-  } leave{this};
+  } leave{this, frame.mOuter};
   // Idle-time posts go out with an idle broadcast that its listeners hear,
   // just before them; inside the count, so that the station outlives them.
   if (Detail::sIdlePostsWaiting.load(std::memory_order_relaxed) && mStationID == kStation_Idle && IsBroadcasting())
@@ -41,8 +66,36 @@ void Station::BroadcastCounted(const Message& inMessage) {
   Broadcaster::BroadcastMessage(inMessage);
 }
 
-void Station::BroadcastMessage(const Message& inMessage) { BroadcastCounted(inMessage); }
+bool Station::IsRelaying(const Message& inMessage) const noexcept {
+  // As deep as station broadcasts are nested on this thread: one or two
+  // frames in practice.
+  for (const RelayFrame* frame = tRelaying; frame != nullptr; frame = frame->mOuter) {
+    if (frame->mStation == this && frame->mMessage == &inMessage) return true;
+  }
+  return false;
+}
 
-void Station::ListenToMessage(const Message& inMessage) { BroadcastCounted(inMessage); }
+void Station::BroadcastMessage(const Message& inMessage) {
+  // Off the main thread a broadcast delivers nothing and needs no count.
+  if (!kivcore::threads::CurrentThreadIsMainThread()) {
+    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kBroadcastOffMainThread, TARN_CALL_SITE(),
+                                             "Tarn::Station::BroadcastMessage", mStationID);
+    return;
+  }
+  BroadcastCounted(inMessage);
+}
+
+void Station::ListenToMessage(const Message& inMessage) {
+  // Off the main thread a relay delivers nothing and needs no count.
+  if (!kivcore::threads::CurrentThreadIsMainThread()) return;
+  // The same object coming back is a cycle of relays (or a station attached
+  // to itself): relaying it again would recurse without end. Everyone below
+  // has heard it or will, so dropping the repeat loses nothing.
+  if (IsRelaying(inMessage)) {
+    TARN_CONTRACT_CHECK(!IsRelaying(inMessage), "Tarn::Station::ListenToMessage");
+    return;
+  }
+  BroadcastCounted(inMessage);
+}
 
 }  // namespace Tarn

@@ -1,6 +1,8 @@
 #include <TarnMessaging/Station.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "BroadcasterCore.h"
+#include "DiagnosticReports.h"
 #include "StationRetainer.h"
 #include "StationRetirement.h"
 
@@ -182,6 +184,36 @@ Station* MakeStation(StationRecord& ioRecord) {
   return ioRecord.mStation;
 }
 
+// Reports the stations that Terminate is about to delete while they are
+// still retained or still have listeners: their users will find them gone
+// without a word. The map is the caller's own by now, so no lock is needed.
+void ReportLeftovers(const StationMap& inDoomed, const void* inCallSite) {
+  using Diagnostics::Detail::Failure;
+  std::size_t retained = 0;
+  std::size_t listened = 0;
+  const StationRecord* firstRetained = nullptr;
+  const StationRecord* firstListened = nullptr;
+  std::size_t listeners = 0;
+  for (const auto& element : inDoomed) {
+    const StationRecord& record = element.second;
+    if (record.mStation == nullptr) continue;
+    if (record.mRetainCount != 0 && retained++ == 0) firstRetained = &record;
+    const std::size_t count = BroadcasterCore::CountListeners(*record.mStation);
+    if (count != 0 && listened++ == 0) {
+      firstListened = &record;
+      listeners = count;
+    }
+  }
+  if (firstRetained != nullptr) {
+    Diagnostics::Detail::ReportSilentFailure(Failure::kRetainedAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
+                                             firstRetained->mStationID, retained, firstRetained->mRetainCount);
+  }
+  if (firstListened != nullptr) {
+    Diagnostics::Detail::ReportSilentFailure(Failure::kListenersAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
+                                             firstListened->mStationID, listened, listeners);
+  }
+}
+
 }  // namespace
 
 namespace StationRegistry {
@@ -259,7 +291,33 @@ void DisposeStation(const ImmutableString& inStationID) {
   if (onMainThread) DeleteAll(pending, Sweep::kAll);
 }
 
-void Terminate() {
+StationSnapshotList Snapshot() {
+  StationSnapshotList snapshot;
+  RegistryLock lock("StationRegistry::Snapshot");
+  StationMapAccess map;
+  PendingStationList& pending = GetPendingStationList();
+  snapshot.reserve(map->size() + pending.size());
+  // Stations are read, never called: a derived station's code does not run
+  // under the registry's lock here. Their listener counts take each
+  // broadcaster's lock inside the registry's, the order in which a station
+  // deleted under the registry's lock takes them too.
+  for (const auto& element : *map) {
+    const StationRecord& record = element.second;
+    StationState state = StationState::kNotMade;
+    if (record.mStation != nullptr) state = record.mDisposeRequested ? StationState::kPendingDisposal : StationState::kMade;
+    snapshot.push_back(StationSnapshot{record.mStationID, record.mRetainCount, state,
+                                       record.mStation != nullptr ? BroadcasterCore::CountListeners(*record.mStation) : 0});
+  }
+  for (const PendingStation& station : pending) {
+    snapshot.push_back(StationSnapshot{station.mStation->GetStationID(), 0, StationState::kPendingDeletion,
+                                       BroadcasterCore::CountListeners(*station.mStation)});
+  }
+  return snapshot;
+}
+
+void Terminate() { TerminateFrom(TARN_CALL_SITE()); }
+
+void TerminateFrom(const void* inCallSite) {
   StationMap doomed;
   {
     RegistryLock lock("StationRegistry::Terminate");
@@ -272,6 +330,7 @@ void Terminate() {
     doomed.swap(*map);
     ++sLife;
   }
+  if (Diagnostics::Detail::ReportsOn()) ReportLeftovers(doomed, inCallSite);
   // Station destructors run without the registry's lock; each looks itself
   // up and finds nothing. A station with a broadcast in progress (Terminate
   // called from one of its handlers) is retired and goes when that broadcast
@@ -355,6 +414,12 @@ void StationRetainer::Release(const ImmutableString& inStationID, const std::uin
   // of it (a host's derived station's included) is destroyed, so the main
   // thread never relays through a half-destroyed station.
   StationRetirement::Delete(doomed);
+}
+
+bool Diagnostics::Detail::IsStationRegistered(const ImmutableString& inStationID) {
+  RegistryLock lock("StationRegistry::IsStationRegistered");
+  StationMapAccess map;
+  return map->find(inStationID) != map->end();
 }
 
 void StationRetirement::DrainRetired() {

@@ -5,6 +5,7 @@
 #include <TarnMessaging/StationUtils.h>
 
 #include "ContractCheck.h"
+#include "DiagnosticReports.h"
 #include "StationRetainer.h"
 
 #include <kivcore/MainThread.h>
@@ -24,26 +25,62 @@ bool IsAlive(const WeakPtr& inListener) {
   return inListener.lock() != nullptr;
 }
 
+// Reports a call that found no station, when the ID is not registered (a
+// factory that gave no station is the factory's business). The empty ID names
+// no station on purpose. Only failure paths come here.
+void ReportNoStation(const ImmutableString& inStationID, const void* inCallSite, const char* inOperation) noexcept {
+  if (!Diagnostics::Detail::ReportsOn() || inStationID.empty()) return;
+  try {
+    if (Diagnostics::Detail::IsStationRegistered(inStationID)) return;
+  } catch (...) {
+    return;
+  }
+  Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kUnregisteredStation, inCallSite, inOperation,
+                                           inStationID);
+}
+
+void RemoveAt(const ImmutableString& inStationID, Listener* inListener, const void* inCallSite) {
+  StationRetainer station(inStationID);
+  // The broadcaster checks and ignores a null listener itself.
+  if (station) station->RemoveListener(inListener, true);
+  else ReportNoStation(inStationID, inCallSite, kRemoveListenerName);
+}
+
+template <class ListenerRef>
+void AddAt(const ImmutableString& inStationID, const ListenerRef& inListener, const void* inCallSite) {
+  StationRetainer station(inStationID);
+  if (station) station->AddListener(inListener);
+  else ReportNoStation(inStationID, inCallSite, "Tarn::StationUtils::AddListener");
+}
+
+void BroadcastAt(const ImmutableString& inStationID, const Message& inMessage, const void* inCallSite) {
+  // Nothing would be delivered, so the station is not even looked up.
+  if (!kivcore::threads::CurrentThreadIsMainThread()) {
+    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kBroadcastOffMainThread, inCallSite,
+                                             "Tarn::StationUtils::BroadcastMessage", inStationID);
+    return;
+  }
+  StationRetainer station(inStationID);
+  if (station) station->BroadcastMessage(inMessage);
+  else ReportNoStation(inStationID, inCallSite, "Tarn::StationUtils::BroadcastMessage");
+}
+
 }  // namespace
 
 void AddListener(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener) {
-  StationRetainer station(inStationID);
-  if (station) station->AddListener(inListener);
+  AddAt(inStationID, inListener, TARN_CALL_SITE());
 }
 
 void AddListener(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener) {
-  StationRetainer station(inStationID);
-  if (station) station->AddListener(inListener);
+  AddAt(inStationID, inListener, TARN_CALL_SITE());
 }
 
 void AddListener(const ImmutableString& inStationID, Listener* inListener) {
-  StationRetainer station(inStationID);
-  if (station) station->AddListener(inListener);
+  AddAt(inStationID, inListener, TARN_CALL_SITE());
 }
 
 void AddListener(const ImmutableString& inStationID, InterfaceRef<ISafeListener> inListener) {
-  StationRetainer station(inStationID);
-  if (station) station->AddListener(inListener);
+  AddAt(inStationID, inListener, TARN_CALL_SITE());
 }
 
 void RemoveListener(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener) {
@@ -51,6 +88,7 @@ void RemoveListener(const ImmutableString& inStationID, const boost::weak_ptr<Li
   if (!IsAlive(inListener)) TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   StationRetainer station(inStationID);
   if (station) station->RemoveListener(inListener);
+  else ReportNoStation(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
 }
 
 void RemoveListener(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener) {
@@ -58,24 +96,27 @@ void RemoveListener(const ImmutableString& inStationID, const std::weak_ptr<List
   if (!IsAlive(inListener)) TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   StationRetainer station(inStationID);
   if (station) station->RemoveListener(inListener);
+  else ReportNoStation(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
 }
 
 void RemoveListener(const ImmutableString& inStationID, Listener* inListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
-  StationRetainer station(inStationID);
-  // The broadcaster checks and ignores a null listener itself.
-  if (station) station->RemoveListener(inListener, true);
+  RemoveAt(inStationID, inListener, TARN_CALL_SITE());
 }
 
 void RemoveListener(const ImmutableString& inStationID, InterfaceRef<ISafeListener> inListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
   StationRetainer station(inStationID);
   if (station) station->RemoveListener(inListener);
+  else ReportNoStation(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
 }
 
 void BroadcastMessage(const ImmutableString& inStationID, const Message& inMessage) {
-  StationRetainer station(inStationID);
-  if (station) station->BroadcastMessage(inMessage);
+  BroadcastAt(inStationID, inMessage, TARN_CALL_SITE());
+}
+
+void BroadcastPostedCopy(const ImmutableString& inStationID, const Message& inMessage) {
+  BroadcastAt(inStationID, inMessage, nullptr);
 }
 
 bool HasListeners(const ImmutableString& inStationID) {
@@ -83,18 +124,23 @@ bool HasListeners(const ImmutableString& inStationID) {
   return station && station->HasListeners();
 }
 
-void RetainStation(const ImmutableString& inStationID) { StationRegistry::RetainStation(inStationID); }
+void RetainStation(const ImmutableString& inStationID) {
+  if (StationRegistry::RetainStation(inStationID) == nullptr)
+    ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::RetainStation");
+}
 
 void ReleaseStation(const ImmutableString& inStationID) { StationRegistry::ReleaseStation(inStationID); }
 
 void StartBroadcasting(const ImmutableString& inStationID) {
   StationRetainer station(inStationID);
   if (station) station->StartBroadcasting();
+  else ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::StartBroadcasting");
 }
 
 void StopBroadcasting(const ImmutableString& inStationID) {
   StationRetainer station(inStationID);
   if (station) station->StopBroadcasting();
+  else ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::StopBroadcasting");
 }
 
 void SwitchStation(const ImmutableString& inFromStationID, const ImmutableString& inToStationID,
@@ -107,8 +153,8 @@ void SwitchStation(const ImmutableString& inFromStationID, const ImmutableString
   }
   // Removal first, so that switching a station to itself re-adds the
   // listener as a newcomer.
-  RemoveListener(inFromStationID, inListener);
-  AddListener(inToStationID, inListener);
+  RemoveAt(inFromStationID, inListener, TARN_CALL_SITE());
+  AddAt(inToStationID, inListener, TARN_CALL_SITE());
 }
 
 void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage, bool inForceAsync) {

@@ -20,6 +20,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstdio>
 #include <functional>
 #include <memory>
 #include <string>
@@ -288,6 +289,31 @@ void DemoApplication::CollectFigures(DemoSummary& ioSummary) {
 
 }  // namespace
 
+namespace {
+
+const char* StateName(Tarn::StationRegistry::StationState inState) {
+  switch (inState) {
+    case Tarn::StationRegistry::StationState::kNotMade: return "not made";
+    case Tarn::StationRegistry::StationState::kMade: return "made";
+    case Tarn::StationRegistry::StationState::kPendingDisposal: return "pending disposal";
+    case Tarn::StationRegistry::StationState::kPendingDeletion: return "pending deletion";
+  }
+  return "?";
+}
+
+// The registry as it stands, one station a line.
+void DumpStations(std::FILE* inStream) {
+  const Tarn::StationRegistry::StationSnapshotList stations = Tarn::StationRegistry::Snapshot();
+  std::fprintf(inStream, "Stations at the end of the run: %zu\n", stations.size());
+  std::fprintf(inStream, "  %-40s %-17s %8s %10s\n", "station", "state", "retains", "listeners");
+  for (const Tarn::StationRegistry::StationSnapshot& station : stations) {
+    std::fprintf(inStream, "  %-40s %-17s %8u %10zu\n", station.mStationID.c_str(), StateName(station.mState),
+                 static_cast<unsigned>(station.mRetainCount), station.mListenerCount);
+  }
+}
+
+}  // namespace
+
 DemoSummary RunDemo(const DemoOptions& inOptions) {
   DemoSummary summary;
   summary.mWorkers = inOptions.mWorkers;
@@ -307,6 +333,7 @@ DemoSummary RunDemo(const DemoOptions& inOptions) {
   {
     DemoApplication application(inOptions, ledger);
     application.Run(summary);
+    if (inOptions.mDumpStations) DumpStations(inOptions.mJson ? stderr : stdout);
   }
   Tarn::Messaging::Terminate();
 

@@ -44,13 +44,14 @@ ParseResult ParseDemoOptions(int inArgc, const char* const* inArgv, DemoOptions&
       name.resize(equals);
     }
 
-    if (name == "--help" || name == "-h" || name == "--quiet" || name == "--json") {
+    if (name == "--help" || name == "-h" || name == "--quiet" || name == "--json" || name == "--dump-stations") {
       if (value != nullptr) {
         outError = "option '" + name + "' takes no value";
         return ParseResult::kError;
       }
       if (name == "--help" || name == "-h") return ParseResult::kHelp;
-      (name == "--quiet" ? outOptions.mQuiet : outOptions.mJson) = true;
+      if (name == "--dump-stations") outOptions.mDumpStations = true;
+      else (name == "--quiet" ? outOptions.mQuiet : outOptions.mJson) = true;
       continue;
     }
 
@@ -116,6 +117,8 @@ void PrintDemoHelp(std::FILE* inStream) {
                "                 milliseconds, 0 to %u (default 200)\n"
                "  --quiet        no progress output; only the summary\n"
                "  --json         the summary as one JSON object on stdout, and nothing else\n"
+               "  --dump-stations  at the end of the run, every station of the registry with\n"
+               "                 its state, retains and listeners (on stderr with --json)\n"
                "  --help         this text\n"
                "\n"
                "Exit status: 0 when every message is accounted for and nothing leaked;\n"

@@ -9,7 +9,10 @@
 /// namespace) is the one exception: two sources may each declare one of the
 /// same name, and their decorated names are then equal, so the library hands
 /// each such type an ID of its own, the name's hash for the first one seen
-/// and a distinct value for every further one. Listeners recognise a message
+/// and a distinct value for every further one. The hash is not collision-free:
+/// when two different names with external linkage hash to one ID, the second
+/// one met is reported as a contract violation naming both types, and is
+/// given an ID of its own. Listeners recognise a message
 /// by its ID, most simply through Is<T>() and As<T>():
 ///
 /// @code{.cpp}
@@ -25,8 +28,8 @@
 /// header only declares: include <boost/function.hpp> where you call it.
 ///
 /// Threading: HashMessageTypeNameToMessageID is pure and may be called from
-/// any thread, and so may the ID lookup of a type with internal linkage (it
-/// takes a short spin lock, once per type and module). A message object is not
+/// any thread, and so may the ID lookup of any message type (it takes a
+/// short spin lock, once per type and module). A message object is not
 /// synchronised: the listeners of one broadcast read it on the broadcasting
 /// thread.
 #pragma once
@@ -119,6 +122,16 @@ private:
 
 /// True when a decorated type name names a type with internal linkage.
 TARN_MESSAGING_API bool HasInternalLinkage(const char* inTypeName) noexcept;
+
+/// The ID of a type with external linkage, computed once per type and module:
+/// the hash of inTypeName, recorded with the name in one process-wide table.
+/// A different name met with the same hash is a collision: it is reported
+/// through the contract-check procedure, naming both types, and the later
+/// name is given an ID of its own (the same in every module), so that no
+/// listener takes one type for the other. The report cannot leave this
+/// function: an exception of the error handler is caught and its text
+/// written to standard error.
+TARN_MESSAGING_API MessageID GlobalMessageID(const char* inTypeName) noexcept;
 
 }  // namespace Detail
 

@@ -84,14 +84,16 @@ template <class T>
 class MessageImpl : public Detail::MessageImplBase {
 public:
   /// The ID of T: the hash of T's decorated name, computed on first use (a
-  /// type with internal linkage gets an ID no other such type holds).
+  /// type with internal linkage gets an ID no other such type holds; a type
+  /// whose hash an earlier type of another name holds is reported and gets
+  /// an ID of its own, Message.h).
   static MessageID StaticMessageID() noexcept {
     // Relaxed atomics: threads that meet the empty slot at once compute and
     // store the same value, so no ordering is needed, only freedom from a race.
     MessageID id = sMessageID.load(std::memory_order_relaxed);
     if (id == 0) {
       const char* const name = typeid(T).name();
-      id = Detail::HasInternalLinkage(name) ? LocalType().GetMessageID() : HashMessageTypeNameToMessageID(name);
+      id = Detail::HasInternalLinkage(name) ? LocalType().GetMessageID() : Detail::GlobalMessageID(name);
       sMessageID.store(id, std::memory_order_relaxed);
     }
     return id;

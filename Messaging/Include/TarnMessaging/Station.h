@@ -21,6 +21,14 @@
 /// the host deletes itself on a worker calls DetachFromBroadcasters() first
 /// in its own destructor (Listener.h).
 ///
+/// Relay cycles: a station that hears, as a listener, a message object that
+/// it is broadcasting already (stations attached to each other in a ring, or
+/// a station attached to itself) does not relay it again, which would recurse
+/// until the stack overflows. It reports the cycle through the contract-check
+/// procedure ("!IsRelaying(inMessage)") and, if the report returns, drops the
+/// repeat, so that each listener hears the message once. A handler that
+/// broadcasts a new message on the same station is no cycle.
+///
 /// When a station dies: the registry never deletes a station while a
 /// broadcast on it runs on the main thread (its own, or a relay of what it
 /// hears). A disposal, last release or Terminate reached from inside such a
@@ -53,7 +61,9 @@ public:
   /// Broadcasts to the station's listeners (Broadcaster::BroadcastMessage).
   void BroadcastMessage(const Message& inMessage) override;
   /// Relays a message heard as a listener to the station's own listeners,
-  /// straight through Broadcaster::BroadcastMessage.
+  /// straight through Broadcaster::BroadcastMessage, unless this station is
+  /// broadcasting that very message object already (a relay cycle).
+  /// Precondition: !IsRelaying(inMessage).
   void ListenToMessage(const Message& inMessage) override;
 
   /// The station's ID, fixed at construction.
@@ -63,6 +73,9 @@ private:
   friend class StationRetirement;
   // Broadcaster::BroadcastMessage, counted in mBroadcastDepth while it runs.
   TARN_MESSAGING_LOCAL void BroadcastCounted(const Message& inMessage);
+  // Whether a broadcast of this very object on this station runs below, on
+  // the calling thread.
+  TARN_MESSAGING_LOCAL bool IsRelaying(const Message& inMessage) const noexcept;
 
   const kivcore::utility::ImmutableString mStationID;
   // Broadcasts on this station running on the main thread, relays included.

@@ -15,6 +15,9 @@
 /// against DisposeStation, not against Terminate; a mere FindStation
 /// protects it against nothing.
 ///
+/// Snapshot() lists every station with its retain count, state and number of
+/// listeners, for a debugger, a log or a leak check at exit.
+///
 /// Threading: every function may be called from any thread; one recursive
 /// lock serialises them. Factories, and the station destructors run by
 /// DisposeStation, run with that lock held and may call the registry again on
@@ -36,6 +39,11 @@
 #include <TarnMessaging/Export.h>
 
 #include <kivcore/ImmutableString.h>
+#include <kivcore/SmallBlockAllocator.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <vector>
 
 namespace Tarn {
 
@@ -68,7 +76,37 @@ TARN_MESSAGING_API void ReleaseStation(const kivcore::utility::ImmutableString& 
 /// retained, marks it for deletion by the last release.
 TARN_MESSAGING_API void DisposeStation(const kivcore::utility::ImmutableString& inStationID);
 /// Empties the registry and deletes every station it held, retained or not.
+/// With silent-failure reports on (Diagnostics.h), first reports stations
+/// still retained or with listeners still attached.
 TARN_MESSAGING_API void Terminate();
+
+/// Where a station stands, as Snapshot sees it.
+enum class StationState {
+  kNotMade,          ///< registered; its factory has not run yet (or gave null)
+  kMade,             ///< registered and made
+  kPendingDisposal,  ///< disposed of while retained: the last release deletes it
+  kPendingDeletion   ///< no longer registered; deleted when a broadcast on it ends
+                     ///< or, if queued off the main thread, by the next main-thread disposal
+};
+
+/// One station as Snapshot saw it.
+struct StationSnapshot {
+  kivcore::utility::ImmutableString mStationID;  ///< its ID
+  std::uint32_t mRetainCount;                    ///< retains standing (0 once pending deletion)
+  StationState mState;                           ///< see StationState
+  std::size_t mListenerCount;                    ///< registrations, dead weak ones not yet pruned included
+};
+
+/// What Snapshot returns; its storage is small blocks.
+using StationSnapshotList =
+    std::vector<StationSnapshot, kivcore::utility::SmallBlockAllocator::STLAllocator<StationSnapshot>>;
+
+/// Every station the registry holds: the registered IDs in the registry's
+/// order, then the stations waiting for deletion. Taken as one consistent
+/// picture under the registry's lock, reading each station's registrations
+/// under its broadcaster's lock; no station's or factory's code is called
+/// and nothing changes. Throws std::bad_alloc when storage is out.
+TARN_MESSAGING_API StationSnapshotList Snapshot();
 
 }  // namespace StationRegistry
 }  // namespace Tarn

@@ -13,11 +13,15 @@
 ///
 /// Each function that touches a station retains it from the registry for the
 /// length of the call and releases it afterwards. An ID that is not
-/// registered makes every function a silent no-op (HasListeners: false).
+/// registered makes every function a no-op (HasListeners: false); with
+/// silent-failure reports on (Diagnostics.h), AddListener, RemoveListener,
+/// BroadcastMessage, RetainStation, StartBroadcasting, StopBroadcasting and
+/// SwitchStation report it once per call site.
 ///
 /// Threading: every function may be called from any thread. BroadcastMessage
-/// delivers only on the main thread; elsewhere it does nothing, which is what
-/// PostMessageToUIThread is for. RemoveListener may block as
+/// delivers only on the main thread; elsewhere it does nothing (it does not
+/// even look the station up, and reports the drop when silent-failure reports
+/// are on), which is what PostMessageToUIThread is for. RemoveListener may block as
 /// Broadcaster::RemoveListener does. A post is delivered when the main thread
 /// runs its pending calls, to the listeners attached at that moment, unless
 /// its station is gone or stopped then. Each post is delivered at most once,
