@@ -21,6 +21,7 @@ struct DemoOptions {
   std::uint32_t mIdleMilliSeconds = 200;  // quiet time after a burst before the autosave
   bool mQuiet = false;                    // no progress output, only the summary
   bool mJson = false;                     // the summary as one JSON object, nothing else on stdout
+  std::int64_t mTraceSlowMilliSeconds = -1;  // --trace-slow: list handlers at least this slow; -1: no tracing
 };
 
 enum class ParseResult { kRun, kHelp, kError };
