@@ -12,6 +12,7 @@
 
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <mutex>
 #include <optional>
 #include <stdexcept>
@@ -123,9 +124,12 @@ TEST(Tracing, ARemovalWaitingPastTheThresholdReportsOnceAndGoesOnWaiting) {
   const milliseconds previous = Tarn::Tracing::SetRemovalWaitReport(milliseconds(30));
   Tarn::Station station(Tarn::StationRegistry::UniqueStationID());
   Tarn::Broadcaster nested;
-  RecordingListener outer("outer"), stuck("stuck");
+  RecordingListener outer("outer"), stuck("stuck"), tick("tick");
   outer.DetachInDestructor(station);
-  outer.SetAction([&](const Tarn::Message&) { nested.BroadcastMessage(PingMessage()); });
+  outer.SetAction([&](const Tarn::Message& inMessage) {
+    if (inMessage.Is<NumberMessage>()) nested.BroadcastMessage(PingMessage());
+  });
+  station.AddListener(&tick);
   station.AddListener(&outer);
   nested.AddListener(&stuck);
   for (const bool throwingHandler : {false, true}) {
@@ -138,6 +142,12 @@ TEST(Tracing, ARemovalWaitingPastTheThresholdReportsOnceAndGoesOnWaiting) {
     std::atomic<bool> removed{false};
     stuck.SetAction([&](const Tarn::Message&) {
       entered.CountDown();
+      // Deliveries on the station that end before the threshold wake the
+      // remover early: it must not report then.
+      for (int ticks = 0; ticks < 5; ++ticks) {
+        std::this_thread::sleep_for(milliseconds(3));
+        station.BroadcastMessage(PingMessage());
+      }
       EXPECT_TRUE(release.WaitFor());
     });
     std::thread remover([&] {
@@ -158,6 +168,8 @@ TEST(Tracing, ARemovalWaitingPastTheThresholdReportsOnceAndGoesOnWaiting) {
     remover.join();
     EXPECT_TRUE(removed.load());
     const std::string text = throwingHandler ? exceptions.Messages().at(0) : recorder->Reports().at(0).key;
+    const std::size_t waited = text.find("has waited ");
+    EXPECT_GE(std::atoi(text.c_str() + (waited == std::string::npos ? text.size() : waited + 11)), 30) << text;
     if (!throwingHandler) {
       EXPECT_EQ(text.rfind(Tarn::Tracing::kRemovalWaitKey, 0), 0u) << text;
     }

@@ -48,7 +48,9 @@
 /// GuardedCall, so an error handler that throws (the default one does) only
 /// hands its exception to the exception handler; the removal still returns
 /// only once the delivery has returned. Debug builds report after
-/// kDefaultRemovalWaitReport; release builds do not report unless set.
+/// kDefaultRemovalWaitReport; release builds do not report unless set. The
+/// main thread's current delivery is known only for broadcasts that started
+/// while a tracer or the report was on; otherwise the report says so.
 #pragma once
 
 #include <TarnMessaging/Export.h>
