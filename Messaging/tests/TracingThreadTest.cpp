@@ -104,6 +104,8 @@ TEST(Tracing, EachDeliveryIsTracedOnceWithStationTypeAndListenerAndNoneAfterTheT
   EXPECT_GE(tracer.mLongest, milliseconds(3)) << "the slow handler's time was not measured";
   EXPECT_EQ(exceptions.Count(), 1u) << "the handler's exception must still reach the error manager";
   EXPECT_GE(echo.Calls(), 5) << "the tracer's own broadcasts must still deliver";
+  EXPECT_EQ(Tarn::Tracing::ReadableTypeName("no type"), "no type");
+  EXPECT_THROW(Tarn::Tracing::ReadableTypeName(nullptr), kivcore::config::Error);
 
   // Replaced by a handler: the running broadcast keeps its tracer to the end.
   tracer.mEnded.clear();
