@@ -17,6 +17,7 @@
 #include <TarnMessaging/StationRegistry.h>
 #include <TarnMessaging/StationUtils.h>
 #include <TarnMessaging/Subscription.h>
+#include <TarnMessaging/Tracing.h>
 
 /// @namespace Tarn
 /// The messaging library's public classes and functions: messages,

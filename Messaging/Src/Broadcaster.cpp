@@ -1,21 +1,29 @@
 #include <TarnMessaging/Broadcaster.h>
 #include <TarnMessaging/Message.h>
 
+#include <TarnMessaging/Station.h>
+
 #include "BroadcasterCore.h"
 #include "ContractCheck.h"
 #include "DiagnosticReports.h"
+#include "TracingState.h"
 
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
 #include <boost/function.hpp>
 #include <boost/make_shared.hpp>
+#include <boost/ref.hpp>
 
 #include <algorithm>
 #include <cstdint>
 #include <functional>
 #include <limits>
 #include <new>
+#include <string>
+#include <thread>
+#include <type_traits>
+#include <typeinfo>
 
 namespace Tarn {
 
@@ -30,6 +38,18 @@ constexpr const char* kHasListenerName = "Tarn::Broadcaster::HasListener";
 template <class WeakPtr>
 bool OwnerEquivalent(const WeakPtr& inA, const WeakPtr& inB) noexcept {
   return !inA.owner_before(inB) && !inB.owner_before(inA);
+}
+
+template <class WeakPtr>
+bool HasOwner(const WeakPtr& inWeak) noexcept {
+  return inWeak.owner_before(WeakPtr()) || WeakPtr().owner_before(inWeak);
+}
+
+// An entry has exactly one field set.
+Tracing::ListenerKind KindOf(const ListenerEntry& inEntry) noexcept {
+  if (inEntry.mListener != nullptr) return Tracing::ListenerKind::kPlain;
+  if (inEntry.mSafeListener) return Tracing::ListenerKind::kSafe;
+  return HasOwner(inEntry.mBoostWeakListener) ? Tracing::ListenerKind::kBoostWeak : Tracing::ListenerKind::kStdWeak;
 }
 
 // Holds a core's lock for a scope, exceptions included.
@@ -154,7 +174,8 @@ bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
   return true;
 }
 
-void BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck) {
+BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait,
+                                                 bool inCheck) {
   Locked lock(mMutex, "Broadcaster::RemoveListener1");
   const auto found = mIndex.find(inListener);
   if (found != mIndex.end()) {
@@ -165,25 +186,44 @@ void BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink
     mIndex.erase(found);
   }
   if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(weak_from_this());
-  if (inWait == Wait::kNever) return;
+  if (inWait == Wait::kNever) return Removed::kAtOnce;
   // The caller may destroy the listener next, so no delivery to it may still
   // run elsewhere. Deliveries on this thread are on the caller's own stack
   // (a handler removing itself, or anything it calls): waiting for them
   // would never end. Threads are compared, not main-thread registration,
   // which a handler may drop meanwhile.
   const std::uintptr_t self = kivcore::threads::CurrentThreadToken();
-  if (!OtherThreadDelivers(inListener, self)) return;
+  if (!OtherThreadDelivers(inListener, self)) return Removed::kAtOnce;
   Waiter waiter{&inListener, mGateMap.mFirst};
   mGateMap.mFirst = &waiter;
+  // Read only once this removal has to wait, so that removals that do not
+  // wait pay nothing for the report.
+  const std::chrono::milliseconds threshold = TracingState::RemovalWaitThreshold();
+  const auto start = std::chrono::steady_clock::now();
+  bool reportDue = threshold.count() > 0;
   do {
-    // The generation is read before the core's lock is let go, and bumped
-    // only after a delivery ended under that lock: no wake-up is missed.
-    std::unique_lock<std::mutex> wake(mWakeMutex);
-    const std::uint64_t seen = mWakeGeneration;
-    mMutex.Unlock();
-    mDeliveryEnded.wait(wake, [&] { return mWakeGeneration != seen; });
-    wake.unlock();
+    bool late = false;
+    {
+      // The generation is read before the core's lock is let go, and bumped
+      // only after a delivery ended under that lock: no wake-up is missed.
+      std::unique_lock<std::mutex> wake(mWakeMutex);
+      const std::uint64_t seen = mWakeGeneration;
+      mMutex.Unlock();
+      const auto ended = [&] { return mWakeGeneration != seen; };
+      if (reportDue) {
+        late = !mDeliveryEnded.wait_until(wake, start + threshold, ended);
+      } else {
+        mDeliveryEnded.wait(wake, ended);
+      }
+    }
     mMutex.Lock("Broadcaster::RemoveListener2");
+    if (late && OtherThreadDelivers(inListener, self)) {
+      // Once per removal; the wait goes on, since a handler may
+      // legitimately be slow.
+      reportDue = false;
+      ReportWait(inListener, self,
+                 std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - start));
+    }
   } while (OtherThreadDelivers(inListener, self));
   for (Waiter** link = &mGateMap.mFirst; *link != nullptr; link = &(*link)->mNext) {
     if (*link == &waiter) {
@@ -191,6 +231,43 @@ void BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink
       break;
     }
   }
+  return Removed::kWaited;
+}
+
+void BroadcasterCore::ReportWait(const ListenerEntry& inEntry, std::uintptr_t inSelf,
+                                 std::chrono::milliseconds inWaited) noexcept {
+  std::string text;
+  try {
+    // Everything the report names from this core is copied under its lock;
+    // the report itself runs without it, since an error handler may call
+    // anything, this broadcaster included.
+    const Frame* delivering = mFrames;
+    while (delivering != nullptr &&
+           !(delivering->mDelivering && delivering->mThread != inSelf && delivering->mCurrent == inEntry)) {
+      delivering = delivering->mNext;
+    }
+    const void* listener = inEntry.mListener;
+    if (inEntry.mSafeListener) listener = inEntry.mSafeListener->mObject;
+    std::string where;
+    if (delivering != nullptr && delivering->mTrace != nullptr) {
+      where = TracingState::DescribeBroadcaster(delivering->mTrace->mBroadcaster, delivering->mTrace->mStationID) +
+              ", delivering " + Tracing::ReadableTypeName(delivering->mTrace->mMessageType);
+    } else {
+      where = TracingState::DescribeBroadcaster(mOwner, kivcore::utility::ImmutableString());
+    }
+    text = "A removal of " + TracingState::DescribeListener(listener, KindOf(inEntry)) + " from " + where +
+           " has waited " + std::to_string(inWaited.count()) +
+           " ms for that listener's delivery on another thread to return, and goes on waiting. ";
+  } catch (...) {
+    return;  // no storage for the text: the removal matters more than its report
+  }
+  mMutex.Unlock();
+  try {
+    text += TracingState::DescribeCurrentDelivery();
+  } catch (...) {
+  }
+  TracingState::ReportRemovalWait(text);
+  mMutex.Lock("Broadcaster::RemoveListener2");
 }
 
 bool BroadcasterCore::Contains(const ListenerEntry& inEntry) {
@@ -204,14 +281,31 @@ bool BroadcasterCore::IsEmpty() {
 }
 
 void BroadcasterCore::Close() noexcept {
-  Locked lock(mMutex, "Broadcaster::~Broadcaster");
-  const std::weak_ptr<BroadcasterCore> self = weak_from_this();
-  for (const StoredEntry& stored : mEntries) {
-    if (stored.mEntry.mListener != nullptr) stored.mEntry.mListener->RemoveBroadcaster(self);
+#ifndef NDEBUG
+  bool inUse = false;
+#endif
+  {
+    Locked lock(mMutex, "Broadcaster::~Broadcaster");
+#ifndef NDEBUG
+    inUse = mFrames != nullptr || mGateMap.mFirst != nullptr;
+#endif
+    const std::weak_ptr<BroadcasterCore> self = weak_from_this();
+    for (const StoredEntry& stored : mEntries) {
+      if (stored.mEntry.mListener != nullptr) stored.mEntry.mListener->RemoveBroadcaster(self);
+    }
+    mEntries.clear();
+    mIndex.clear();
+    mOwner = nullptr;
   }
-  mEntries.clear();
-  mIndex.clear();
-  mOwner = nullptr;
+#ifndef NDEBUG
+  // Harmless here (the broadcast ends on the closed core, the remover holds
+  // it), but the owner of the broadcaster has lost track of its life: a
+  // derived broadcaster's own members are gone already.
+  if (inUse) {
+    TracingState::ReportMisuse("no broadcast runs on the broadcaster and no removal waits on it", __FILE__,
+                               "Tarn::Broadcaster::~Broadcaster", __LINE__);
+  }
+#endif
 }
 
 std::size_t BroadcasterCore::CountListeners(Broadcaster& inBroadcaster) {
@@ -220,10 +314,94 @@ std::size_t BroadcasterCore::CountListeners(Broadcaster& inBroadcaster) {
   return core.mEntries.size();
 }
 
+namespace {
+
+// The walk of an untraced broadcast: every delivery goes straight to the
+// error manager.
+struct Untraced {
+  void Deliver(kivcore::config::ErrorManager* inErrors, const boost::function<int()>& inDelivery,
+               const ListenerEntry&) {
+    inErrors->GuardedCall(inDelivery);
+  }
+};
+
+// The walk of a traced broadcast: each delivery is published for the
+// removal-wait report and, with a tracer, timed and told to it.
+struct Traced {
+  Tracing::Delivery mDelivery;            // the fixed part is set before the walk; main thread only
+  Tracing::DeliveryTracer* mTracer;       // read once, for the whole broadcast
+  const boost::function<int()>* mInner = nullptr;
+
+  void Deliver(kivcore::config::ErrorManager* inErrors, const boost::function<int()>& inDelivery,
+               const ListenerEntry& inEntry) {
+    mDelivery.mListenerKind = KindOf(inEntry);
+    switch (mDelivery.mListenerKind) {
+      case Tracing::ListenerKind::kPlain: mDelivery.mListener = inEntry.mListener; break;
+      case Tracing::ListenerKind::kSafe: mDelivery.mListener = inEntry.mSafeListener->mObject; break;  // not followed
+      // The reference taken here is dropped at once; if it was the last, the
+      // listener goes here rather than in its delivery, which finds it gone.
+      case Tracing::ListenerKind::kBoostWeak: mDelivery.mListener = inEntry.mBoostWeakListener.lock().get(); break;
+      case Tracing::ListenerKind::kStdWeak: mDelivery.mListener = inEntry.mStdWeakListener.lock().get(); break;
+    }
+    const TracingState::CurrentDelivery current(mDelivery);
+    if (mTracer == nullptr) {
+      inErrors->GuardedCall(inDelivery);
+      return;
+    }
+    mInner = &inDelivery;
+    // Held by reference, so that the function stores a pointer and
+    // allocates nothing.
+    inErrors->GuardedCall(boost::function<int()>(boost::ref(*this)));
+  }
+
+  // The tracer's calls and the delivery, in one guarded call: whatever
+  // throws, the broadcast goes on with the next listener.
+  int operator()() {
+    {
+      const TracingState::TracerCall inside;
+      mTracer->DeliveryBegins(mDelivery);
+    }
+    const auto start = std::chrono::steady_clock::now();
+    try {
+      (*mInner)();
+    } catch (...) {
+      Ended(start);
+      throw;
+    }
+    Ended(start);
+    return 0;
+  }
+
+  void Ended(std::chrono::steady_clock::time_point inStart) {
+    const auto took = std::chrono::steady_clock::now() - inStart;
+    const TracingState::TracerCall inside;
+    mTracer->DeliveryEnded(mDelivery, std::chrono::duration_cast<std::chrono::nanoseconds>(took));
+  }
+};
+
+}  // namespace
+
 void BroadcasterCore::Broadcast(const Message& inMessage) {
+  Untraced policy;
+  Walk(inMessage, policy);
+}
+
+void BroadcasterCore::BroadcastTraced(const Message& inMessage, const Broadcaster& inOwner) {
+  Traced policy{Tracing::Delivery(), TracingState::CurrentTracer()};
+  policy.mDelivery.mBroadcaster = &inOwner;
+  if (const Station* station = dynamic_cast<const Station*>(&inOwner)) policy.mDelivery.mStationID = station->GetStationID();
+  policy.mDelivery.mMessageID = inMessage.GetMessageID();
+  policy.mDelivery.mMessageType = typeid(inMessage).name();
+  policy.mDelivery.mThread = std::this_thread::get_id();
+  Walk(inMessage, policy);
+}
+
+template <class Policy>
+void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
   kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
   Frame frame;
   frame.mThread = kivcore::threads::CurrentThreadToken();
+  if constexpr (std::is_same<Policy, Traced>::value) frame.mTrace = &ioPolicy.mDelivery;
   bool currentIsPlain = true;  // frame.mCurrent has no weak field set
   bool gone = false;
   // Built once: the record refers to frame.mCurrent, which each pass
@@ -290,7 +468,7 @@ void BroadcasterCore::Broadcast(const Message& inMessage) {
     }
     // No lock is held while the listener runs.
     gone = false;
-    errors->GuardedCall(delivery);
+    ioPolicy.Deliver(errors, delivery, frame.mCurrent);
     // A weak or safe listener found gone is pruned as the broadcast passes.
     if (gone) Remove(frame.mCurrent, nullptr, Wait::kNever, false);
   }
@@ -423,7 +601,12 @@ void Broadcaster::BroadcastMessage(const Message& inMessage) {
   // Held for the whole broadcast: a handler that destroys this broadcaster
   // leaves the broadcast a closed, empty core to finish on.
   const std::shared_ptr<BroadcasterCore> core = mCore;
-  core->Broadcast(inMessage);
+  // The one read tracing costs an untraced broadcast.
+  if (TracingState::sActive.load(std::memory_order_relaxed) && !TracingState::InsideTracer()) {
+    core->BroadcastTraced(inMessage, *this);
+  } else {
+    core->Broadcast(inMessage);
+  }
 }
 
 }  // namespace Tarn

@@ -19,10 +19,12 @@
 #pragma once
 
 #include <TarnMessaging/Broadcaster.h>
+#include <TarnMessaging/Tracing.h>
 
 #include <kivcore/RecursiveMutex.h>
 #include <kivcore/SmallBlockAllocator.h>
 
+#include <chrono>
 #include <condition_variable>
 #include <cstdint>
 #include <map>
@@ -42,6 +44,9 @@ public:
     bool mDelivering = false;         // mCurrent is being delivered right now
     std::uintptr_t mThread = 0;       // the broadcasting thread
     Frame* mNext = nullptr;           // the next running broadcast
+    // A traced broadcast's broadcaster, station and message type, fixed
+    // before the frame is linked; null when untraced.
+    const Tracing::Delivery* mTrace = nullptr;
   };
   // A removal waiting for deliveries of an equal entry; on the remover's stack.
   struct Waiter {
@@ -71,17 +76,26 @@ public:
   // throws nothing).
   // inCheck runs the misuse check of a public removal (a second removal of
   // an equal entry while an earlier one still waits); it may throw.
-  void Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck);
+  // Returns kWaited when a delivery on another thread had to end first.
+  enum class Removed { kAtOnce, kWaited };
+  Removed Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck);
   bool Contains(const ListenerEntry& inEntry);
   bool IsEmpty();
-  // The broadcast itself; see Broadcaster::BroadcastMessage.
+  // The broadcast itself; see Broadcaster::BroadcastMessage. The traced
+  // one also tells the tracer and publishes each delivery (Tracing.h).
   void Broadcast(const Message& inMessage);
+  void BroadcastTraced(const Message& inMessage, const Broadcaster& inOwner);
   // The owner is being destroyed: plain listeners lose their back-links and
-  // every registration goes. Waits for nothing.
+  // every registration goes. Waits for nothing. In debug builds, reports a
+  // broadcast still running on the core or a removal still waiting on it.
   void Close() noexcept;
   // The registrations of inBroadcaster, dead weak ones not yet pruned
   // included, for the registry's snapshot. Takes the core's lock.
   static std::size_t CountListeners(Broadcaster& inBroadcaster);
+  // Detaches ioListener from every core that holds it by plain pointer.
+  // inWhole is false from ~Listener, once the derived part is gone: debug
+  // builds then report a delivery that was still running on another thread.
+  static void DetachListener(Listener& ioListener, bool inWhole) noexcept;
 
 private:
   template <class T>
@@ -106,6 +120,13 @@ private:
   // The position of the entry with inSerial, or of the first newer one.
   std::size_t PositionOf(std::uint64_t inSerial) const noexcept;
   bool OtherThreadDelivers(const ListenerEntry& inEntry, std::uintptr_t inSelf) const noexcept;
+  // The walk of a broadcast; Policy is untraced (does nothing) or traced.
+  template <class Policy>
+  void Walk(const Message& inMessage, Policy& ioPolicy);
+  // The removal-wait report of a remover that has waited inWaited for
+  // another thread's delivery of inEntry. mMutex must be held; it is let go
+  // while the report runs and held again on return.
+  void ReportWait(const ListenerEntry& inEntry, std::uintptr_t inSelf, std::chrono::milliseconds inWaited) noexcept;
   // Ends a frame's delivery and wakes waiting removers. mMutex must be held.
   void EndDelivery(Frame& ioFrame) noexcept;
   void Unlink(Frame& ioFrame) noexcept;

@@ -6,6 +6,10 @@
 
 #include <TarnFoundation/TimeStamp.h>
 
+#include <kivcore/MainThread.h>
+
+#include "TracingState.h"
+
 #include <new>
 
 namespace Tarn {
@@ -13,6 +17,15 @@ namespace Tarn {
 IdleCountdownTimer::IdleCountdownTimer() : mStationID(StationRegistry::RegisterUniqueStation()) {}
 
 IdleCountdownTimer::~IdleCountdownTimer() {
+#ifndef NDEBUG
+  // The timer's state is the main thread's, unguarded: destroyed elsewhere it
+  // races with the idle handler. With no main thread registered (after the
+  // last Terminate, at exit) nothing can deliver to it.
+  if (!kivcore::threads::CurrentThreadIsMainThread() && kivcore::threads::GetRegisteredMainThread()) {
+    TracingState::ReportMisuse("the timer is destroyed on the main thread", __FILE__,
+                               "Tarn::IdleCountdownTimer::~IdleCountdownTimer", __LINE__);
+  }
+#endif
   // Detached here, while the timer is whole: ~Listener detaches only once
   // ListenToMessage is pure again, and a delivery reaching the timer then
   // would call a pure function.

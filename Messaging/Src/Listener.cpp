@@ -2,6 +2,7 @@
 #include <TarnMessaging/Listener.h>
 
 #include "BroadcasterCore.h"
+#include "TracingState.h"
 
 #include <algorithm>
 #include <thread>
@@ -40,27 +41,42 @@ Listener& Listener::operator=(const Listener& inOther) noexcept {
   return *this;
 }
 
-Listener::~Listener() { DetachFromBroadcasters(); }
+Listener::~Listener() { BroadcasterCore::DetachListener(*this, false); }
 
-void Listener::DetachFromBroadcasters() noexcept {
+void Listener::DetachFromBroadcasters() noexcept { BroadcasterCore::DetachListener(*this, true); }
+
+void BroadcasterCore::DetachListener(Listener& ioListener, bool inWhole) noexcept {
   // The link stays in the list until the core takes it out together with the
   // entry, under the core's lock: a broadcaster closing meanwhile on another
   // thread then finds either both or neither.
   for (;;) {
     std::weak_ptr<BroadcasterCore> link;
     {
-      BroadcastersLock lock(mBroadcastersBusy);
-      if (mBroadcasters.empty()) return;
-      link = mBroadcasters.front().mCore;
+      BroadcastersLock lock(ioListener.mBroadcastersBusy);
+      if (ioListener.mBroadcasters.empty()) return;
+      link = ioListener.mBroadcasters.front().mCore;
     }
     if (const std::shared_ptr<BroadcasterCore> core = link.lock()) {
       ListenerEntry entry;
-      entry.mListener = this;
-      core->Remove(entry, this, BroadcasterCore::Wait::kForOtherThreads, false);
+      entry.mListener = &ioListener;
+      const Removed removed = core->Remove(entry, &ioListener, Wait::kForOtherThreads, false);
+#ifndef NDEBUG
+      // From ~Listener the derived part is already destroyed, so the
+      // delivery just waited for ran on a half-destroyed listener.
+      if (!inWhole && removed == Removed::kWaited) {
+        TracingState::ReportMisuse(
+            "no delivery runs on another thread when ~Listener starts (call DetachFromBroadcasters() in the "
+            "derived destructor)",
+            __FILE__, "Tarn::Listener::~Listener", __LINE__);
+      }
+#else
+      (void)removed;
+      (void)inWhole;
+#endif
     } else {
       // The broadcaster is gone and its core with it; only a link left by a
       // removal that did not update this listener can be in that state.
-      RemoveBroadcaster(link);
+      ioListener.RemoveBroadcaster(link);
     }
   }
 }

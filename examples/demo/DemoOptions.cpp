@@ -11,6 +11,7 @@ namespace {
 constexpr std::uint32_t kMaxWorkers = 256;
 constexpr std::uint64_t kMaxMessages = 100000000;
 constexpr std::uint32_t kMaxIdleMilliSeconds = 10000;
+constexpr std::uint32_t kMaxTraceSlowMilliSeconds = 60000;
 
 // A whole decimal number in [inMin, inMax]; no sign, no trailing characters.
 bool ParseCount(const char* inText, std::uint64_t inMin, std::uint64_t inMax, std::uint64_t& outValue) {
@@ -66,6 +67,9 @@ ParseResult ParseDemoOptions(int inArgc, const char* const* inArgv, DemoOptions&
     } else if (name == "--idle-ms") {
       min = 0;
       max = kMaxIdleMilliSeconds;
+    } else if (name == "--trace-slow") {
+      min = 0;
+      max = kMaxTraceSlowMilliSeconds;
     } else {
       outError = "unknown option '" + std::string(inArgv[i]) + "'";
       return ParseResult::kError;
@@ -87,6 +91,8 @@ ParseResult ParseDemoOptions(int inArgc, const char* const* inArgv, DemoOptions&
       outOptions.mWorkers = static_cast<std::uint32_t>(number);
     } else if (name == "--messages") {
       outOptions.mMessages = number;
+    } else if (name == "--trace-slow") {
+      outOptions.mTraceSlowMilliSeconds = static_cast<std::int64_t>(number);
     } else {
       outOptions.mIdleMilliSeconds = static_cast<std::uint32_t>(number);
     }
@@ -119,12 +125,17 @@ void PrintDemoHelp(std::FILE* inStream) {
                "  --json         the summary as one JSON object on stdout, and nothing else\n"
                "  --dump-stations  at the end of the run, every station of the registry with\n"
                "                 its state, retains and listeners (on stderr with --json)\n"
+               "  --trace-slow MS  time every delivery and, after the summary, list the ten\n"
+               "                 slowest handlers (listener, station, message) whose slowest\n"
+               "                 delivery took MS milliseconds or more, 0 to %u (on stderr\n"
+               "                 with --json)\n"
                "  --help         this text\n"
                "\n"
                "Exit status: 0 when every message is accounted for and nothing leaked;\n"
                "1 when a message was lost or duplicated, storage leaked, or another check\n"
                "failed (the summary names it); 2 for a bad command line.\n",
-               kMaxWorkers, DefaultWorkerCount(), static_cast<unsigned long long>(kMaxMessages), kMaxIdleMilliSeconds);
+               kMaxWorkers, DefaultWorkerCount(), static_cast<unsigned long long>(kMaxMessages), kMaxIdleMilliSeconds,
+               kMaxTraceSlowMilliSeconds);
 }
 
 }  // namespace tarn_demo

@@ -22,6 +22,7 @@ struct DemoOptions {
   bool mQuiet = false;                    // no progress output, only the summary
   bool mJson = false;                     // the summary as one JSON object, nothing else on stdout
   bool mDumpStations = false;             // the station registry's snapshot at the end of the run
+  std::int64_t mTraceSlowMilliSeconds = -1;  // --trace-slow: list handlers at least this slow; -1: no tracing
 };
 
 enum class ParseResult { kRun, kHelp, kError };

@@ -3,6 +3,9 @@
 #     a short run with --json: exit status 0, and a summary in which every
 #     message posted was delivered or dropped by design, none lost, nothing
 #     leaked, and every burst autosaved
+#   cmake -DDEMO=<path to tarn-demo> -DMODE=trace -P SmokeTest.cmake
+#     a short traced run: exit status 0, stdout still one JSON object, and the
+#     slowest handlers on stderr with the status-bar station among them
 #   cmake -DDEMO=<path to tarn-demo> -DMODE=options -P SmokeTest.cmake
 #     bad command lines exit with status 2 and say why on stderr only;
 #     --help exits with 0
@@ -56,6 +59,18 @@ if(MODE STREQUAL "summary")
   message(STATUS "tarn-demo: ${posted} posted, ${delivered} delivered, ${dropped_by_design} dropped by design, "
                  "${autosaves} autosaves")
 
+elseif(MODE STREQUAL "trace")
+  execute_process(
+    COMMAND "${DEMO}" --workers 2 --messages 5000 --idle-ms 30 --json --trace-slow 0
+    RESULT_VARIABLE result OUTPUT_VARIABLE SUMMARY ERROR_VARIABLE errors TIMEOUT 60)
+  string(JSON ok ERROR_VARIABLE parseError GET "${SUMMARY}" ok)
+  if(NOT result STREQUAL "0" OR parseError OR NOT ok STREQUAL "ON")
+    message(FATAL_ERROR "traced run: exit status '${result}' (${parseError})\nstdout: ${SUMMARY}\nstderr: ${errors}")
+  endif()
+  if(NOT errors MATCHES "slowest handlers \\([0-9,]+ deliveries traced" OR NOT errors MATCHES "tarn\\.app\\.status\\.bar")
+    message(FATAL_ERROR "traced run: no list of slow handlers on stderr\n${errors}")
+  endif()
+
 elseif(MODE STREQUAL "options")
   # One command line per entry, arguments separated by blanks.
   set(badCommandLines
@@ -68,6 +83,8 @@ elseif(MODE STREQUAL "options")
     "--idle-ms"
     "--idle-ms 99999999"
     "--json=yes"
+    "--trace-slow"
+    "--trace-slow 60001"
     "--quiet extra")
   foreach(shown IN LISTS badCommandLines)
     string(REPLACE " " ";" arguments "${shown}")
@@ -91,5 +108,5 @@ elseif(MODE STREQUAL "options")
   endif()
 
 else()
-  message(FATAL_ERROR "MODE must be 'summary' or 'options', not '${MODE}'")
+  message(FATAL_ERROR "MODE must be 'summary', 'trace' or 'options', not '${MODE}'")
 endif()

@@ -3,9 +3,14 @@
 // reading.
 #include "DemoHost.h"
 #include "DemoOptions.h"
+#include "SlowHandlers.h"
 #include "Summary.h"
 
+#include <TarnMessaging/Tracing.h>
+
+#include <chrono>
 #include <cstdio>
+#include <optional>
 #include <string>
 
 int main(int argc, char** argv) {
@@ -22,13 +27,22 @@ int main(int argc, char** argv) {
       break;
   }
 
+  // Installed and removed on this, the main thread, outside every broadcast:
+  // no delivery can reach it after it is removed.
+  std::optional<tarn_demo::SlowHandlers> slow;
+  if (options.mTraceSlowMilliSeconds >= 0) {
+    slow.emplace(std::chrono::milliseconds(options.mTraceSlowMilliSeconds));
+    Tarn::Tracing::SetDeliveryTracer(&*slow);
+  }
   tarn_demo::DemoSummary summary = tarn_demo::RunDemo(options);
+  if (slow) Tarn::Tracing::SetDeliveryTracer(nullptr);
   tarn_demo::CheckSummary(summary);
   if (options.mJson) {
     tarn_demo::PrintSummaryJson(summary, stdout);
   } else {
     tarn_demo::PrintSummaryTable(summary, stdout);
   }
+  if (slow) slow->Print(options.mJson ? stderr : stdout);
   // A lost or duplicated message, a leak, or any other failed check.
   return summary.mFaults.empty() ? 0 : 1;
 }

@@ -39,7 +39,15 @@
 /// the same time on two threads: ~Broadcaster only closes the core and calls
 /// no listener, ~Listener detaches from the cores still open. A broadcaster
 /// destroyed by a handler of its own broadcast leaves that broadcast to end
-/// on the closed core; a remover waiting on it keeps the core alive.
+/// on the closed core; a remover waiting on it keeps the core alive. Both are
+/// misuse all the same (a derived broadcaster's own members are gone while
+/// its broadcast or removal still runs): debug builds report them through the
+/// contract check, run inside the error manager's GuardedCall since a
+/// destructor cannot throw. Release builds add nothing to the destructor.
+///
+/// Diagnostics (Tracing.h): a broadcast reads one flag to learn whether a
+/// delivery tracer or the removal-wait report is on; a removal that has
+/// waited past the removal-wait threshold reports once and goes on waiting.
 ///
 /// Misuse (a null or expired listener) is reported through the contract-check
 /// procedure; when the report returns, the call goes on harmlessly.
@@ -93,7 +101,9 @@ public:
   Broadcaster(const Broadcaster& inOther);
   Broadcaster& operator=(const Broadcaster&) = delete;
   /// Closes the core: plain-pointer listeners lose their back-links, weak and
-  /// safe ones are not told. Calls no listener and waits for nothing.
+  /// safe ones are not told. Calls no listener and waits for nothing. Debug
+  /// builds report a broadcast still running on it or a removal still
+  /// waiting on it (see Lifetime above).
   virtual ~Broadcaster();
 
   /// Delivers inMessage, by reference, to every listener (see above). Does
