@@ -30,7 +30,6 @@ IdleCountdownTimer::~IdleCountdownTimer() {
   // ListenToMessage is pure again, and a delivery reaching the timer then
   // would call a pure function.
   if (mListeningForIdle) {
-    mListeningForIdle = false;
     try {
       StationUtils::RemoveListener(kStation_Idle, this);
     } catch (const std::bad_alloc&) {
