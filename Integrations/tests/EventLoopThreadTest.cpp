@@ -1,10 +1,13 @@
 // The event-loop integrations, one scenario body for each loop: posts arrive
 // once and in order across a replacement of the integration, the destructor
-// runs follow-ups, and a pending call may destroy the integration.
+// runs follow-ups, a pending call or an idle listener may destroy the
+// integration, and the idle source broadcasts when the loop runs dry, also
+// while a worker posts, but never while messages are queued.
 #include "IntegrationTestSupport.h"
 
 #include <kivcore/Error.h>
 
+#include <chrono>
 #include <stdexcept>
 #include <thread>
 #include <type_traits>
@@ -22,11 +25,13 @@ public:
     mInOrder = mInOrder && message.mSequence == mNext && std::this_thread::get_id() == mMainThread;
     mNext = message.mSequence + 1;
     ++mTotal;
+    mDelivering = true;
     if (mAction) mAction(message);
+    mDelivering = false;
   }
   std::function<void(const Numbered&)> mAction;
   int mTotal = 0, mNext = 0;
-  bool mInOrder = true;
+  bool mInOrder = true, mDelivering = false;
   const std::thread::id mMainThread = std::this_thread::get_id();
 };
 
@@ -48,8 +53,29 @@ protected:
   Loop mLoop;
 };
 
-#if TARN_HAVE_GLIB_INTEGRATION
+// Hears the idle station: when, and whether a delivery of Heard's was on the
+// stack (it never may be) or messages were queued.
+class IdleHeard : public Tarn::Listener {
+public:
+  explicit IdleHeard(const Heard& inHeard) : mHeard(inHeard) { Tarn::StationUtils::AddListener(Tarn::kStation_Idle, this); }
+  ~IdleHeard() override { Tarn::StationUtils::RemoveListener(Tarn::kStation_Idle, this); }
+  void ListenToMessage(const Tarn::Message& inMessage) override {
+    if (inMessage.GetMessageID() != Tarn::ApplicationIdleMessage::StaticMessageID()) return;
+    ++mTotal;
+    mWrong += mHeard.mDelivering || std::this_thread::get_id() != mHeard.mMainThread;
+    if (mAction) mAction();
+  }
+  const Heard& mHeard;
+  std::function<void()> mAction;
+  int mTotal = 0, mWrong = 0;
+};
+
+#if TARN_HAVE_GLIB_INTEGRATION && TARN_HAVE_QT_INTEGRATION
+using Loops = ::testing::Types<AsioLoop, GLibLoop, QtLoop>;
+#elif TARN_HAVE_GLIB_INTEGRATION
 using Loops = ::testing::Types<AsioLoop, GLibLoop>;
+#elif TARN_HAVE_QT_INTEGRATION
+using Loops = ::testing::Types<AsioLoop, QtLoop>;
 #else
 using Loops = ::testing::Types<AsioLoop>;
 #endif
@@ -120,6 +146,85 @@ TYPED_TEST(EventLoopTest, APendingCallMayDestroyTheIntegrationWhileALaterOneThro
   EXPECT_EQ((std::is_same<TypeParam, AsioLoop>::value ? 1 : 0), caught);
   EXPECT_EQ(2, caught + reported);
   EXPECT_EQ(1, ran);
+}
+
+// A worker posts in bursts with pauses; the loop must broadcast idle in the
+// pauses, often enough for an IdleCountdownTimer to fire without help and
+// no more often than the interval allows, and lose no post.
+TYPED_TEST(EventLoopTest, IdleBroadcastsComeInThePausesWhilePostsArriveAndStopWhenSwitchedOff) {
+  using namespace std::chrono;
+  constexpr int kBursts = 8, kEach = 200;
+  constexpr milliseconds kInterval{2};
+  IdleHeard idle(this->mHeard);
+  Tarn::IdleCountdownTimer timer;
+  bool fired = false;
+  Tarn::Registration firing = Tarn::Subscribe<Tarn::IdleCountdownTimerMessage>(timer.GetStationID(), [&](const Tarn::IdleCountdownTimerMessage&) { fired = true; });
+  auto integration = this->mLoop.Make();
+  EXPECT_THROW(integration->SetIdleInterval(milliseconds(-1)), std::invalid_argument);
+  integration->SetIdleInterval(kInterval);
+  timer.SetDuration(20);
+  const auto start = steady_clock::now();
+  timer.ArmTimer();
+  std::thread producer([this] {
+    for (int i = 0; i < kBursts * kEach; ++i) {
+      Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, i), false);
+      if (i % kEach == kEach - 1) std::this_thread::sleep_for(milliseconds(4));
+    }
+  });
+  EXPECT_TRUE(PollUntil(this->mLoop, [&] { return fired && this->mHeard.mTotal == kBursts * kEach; }));
+  producer.join();
+  const auto elapsed = steady_clock::now() - start;
+  EXPECT_TRUE(this->mHeard.mInOrder);
+  EXPECT_EQ(kBursts * kEach, this->mHeard.mTotal);
+  EXPECT_EQ(0, idle.mWrong) << "idle heard inside a delivery or off the main thread";
+  EXPECT_EQ(static_cast<std::uint64_t>(idle.mTotal), integration->IdleBroadcasts());
+  EXPECT_LE(idle.mTotal, elapsed / kInterval + 1) << "the interval must throttle the broadcasts";
+
+  integration->SetIdleInterval(Tarn::Integration::PendingCallRunner::kIdleOff);
+  const int before = idle.mTotal;
+  PollUntil(this->mLoop, [] { return false; }, 10 * kInterval);
+  EXPECT_EQ(before, idle.mTotal) << "switched off";
+  integration->SetIdleInterval(kInterval);
+  EXPECT_TRUE(PollUntil(this->mLoop, [&] { return idle.mTotal > before; }));
+}
+
+// A handler keeps one message queued for several intervals: the loop never
+// runs dry meanwhile, so no idle broadcast may come; then one must.
+TYPED_TEST(EventLoopTest, NoIdleBroadcastWhileMessagesAreQueued) {
+  using namespace std::chrono;
+  IdleHeard idle(this->mHeard);
+  auto integration = this->mLoop.Make();
+  integration->SetIdleInterval(milliseconds(1));
+  const auto until = steady_clock::now() + milliseconds(15);
+  this->mHeard.mAction = [&](const Numbered& inMessage) {
+    if (steady_clock::now() < until) Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, inMessage.mSequence + 1), true);
+  };
+  Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, 0), true);
+  EXPECT_TRUE(PollUntil(this->mLoop, [&] { return idle.mTotal > 0; }));
+  EXPECT_LE(until, steady_clock::now());
+  EXPECT_LT(10, this->mHeard.mTotal);
+  EXPECT_EQ(0, idle.mWrong);
+}
+
+// An idle listener posts a message and destroys the integration during the
+// broadcast: the destructor delivers the post, the source stops with it, and
+// a new integration broadcasts again.
+TYPED_TEST(EventLoopTest, AnIdleListenerMayDestroyTheIntegration) {
+  IdleHeard idle(this->mHeard);
+  auto integration = this->mLoop.Make();
+  integration->SetIdleInterval(std::chrono::milliseconds(1));
+  idle.mAction = [&] {
+    Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, 0), true);
+    integration.reset();
+  };
+  EXPECT_TRUE(PollUntil(this->mLoop, [&] { return integration == nullptr; }));
+  EXPECT_EQ(1, this->mHeard.mTotal);
+  idle.mAction = nullptr;
+  PollUntil(this->mLoop, [] { return false; }, std::chrono::milliseconds(10));
+  EXPECT_EQ(1, idle.mTotal) << "the source must go with its integration";
+  integration = this->mLoop.Make();
+  integration->SetIdleInterval(std::chrono::milliseconds(1));
+  EXPECT_TRUE(PollUntil(this->mLoop, [&] { return idle.mTotal == 2; }));
 }
 
 }  // namespace
