@@ -53,8 +53,8 @@ protected:
   Loop mLoop;
 };
 
-// Hears the idle station: when, and whether a delivery of Heard's was on the
-// stack (it never may be) or messages were queued.
+// Hears the idle station, and counts as wrong a broadcast off the main
+// thread or nested in a delivery of Heard's or in another idle broadcast.
 class IdleHeard : public Tarn::Listener {
 public:
   explicit IdleHeard(const Heard& inHeard) : mHeard(inHeard) { Tarn::StationUtils::AddListener(Tarn::kStation_Idle, this); }
@@ -62,12 +62,15 @@ public:
   void ListenToMessage(const Tarn::Message& inMessage) override {
     if (inMessage.GetMessageID() != Tarn::ApplicationIdleMessage::StaticMessageID()) return;
     ++mTotal;
-    mWrong += mHeard.mDelivering || std::this_thread::get_id() != mHeard.mMainThread;
+    mWrong += mHeard.mDelivering || mInside || std::this_thread::get_id() != mHeard.mMainThread;
+    mInside = true;
     if (mAction) mAction();
+    mInside = false;
   }
   const Heard& mHeard;
   std::function<void()> mAction;
   int mTotal = 0, mWrong = 0;
+  bool mInside = false;
 };
 
 #if TARN_HAVE_GLIB_INTEGRATION && TARN_HAVE_QT_INTEGRATION
@@ -206,14 +209,16 @@ TYPED_TEST(EventLoopTest, NoIdleBroadcastWhileMessagesAreQueued) {
   EXPECT_EQ(0, idle.mWrong);
 }
 
-// An idle listener posts a message and destroys the integration during the
-// broadcast: the destructor delivers the post, the source stops with it, and
-// a new integration broadcasts again.
-TYPED_TEST(EventLoopTest, AnIdleListenerMayDestroyTheIntegration) {
+// An idle listener runs a nested loop, in which idle checks come due, then
+// posts a message and destroys the integration during the broadcast: no
+// broadcast nests, the destructor delivers the post, the source stops with
+// the integration, and a new integration broadcasts again.
+TYPED_TEST(EventLoopTest, AnIdleListenerMayNestTheLoopAndDestroyTheIntegration) {
   IdleHeard idle(this->mHeard);
   auto integration = this->mLoop.Make();
   integration->SetIdleInterval(std::chrono::milliseconds(1));
   idle.mAction = [&] {
+    PollUntil(this->mLoop, [] { return false; }, std::chrono::milliseconds(5));
     Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, 0), true);
     integration.reset();
   };
@@ -225,6 +230,7 @@ TYPED_TEST(EventLoopTest, AnIdleListenerMayDestroyTheIntegration) {
   integration = this->mLoop.Make();
   integration->SetIdleInterval(std::chrono::milliseconds(1));
   EXPECT_TRUE(PollUntil(this->mLoop, [&] { return idle.mTotal == 2; }));
+  EXPECT_EQ(0, idle.mWrong);
 }
 
 }  // namespace

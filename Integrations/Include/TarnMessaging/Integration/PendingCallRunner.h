@@ -38,8 +38,8 @@
 /// anything. The check is armed again before each broadcast, so the interval
 /// counts from the start of one broadcast to the next; a check that finds
 /// calls queued skips its turn, as the loop has not run out of work. An idle
-/// broadcast is never nested in another, nor in a run of the pending calls
-/// made by the runner. SetIdleInterval(kIdleOff) switches the source off.
+/// broadcast is never nested in another. SetIdleInterval(kIdleOff) switches
+/// the source off.
 ///
 /// Threading: Install, Uninstall, SetIdleInterval, CheckIdle, ArmIdleCheck
 /// and DisarmIdleCheck on the main thread. Wakeup runs on whichever thread
@@ -175,13 +175,6 @@ public:
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
     if (!adaptor) return;
-    // An idle check reached from inside the run (a call running a nested
-    // loop) is not the loop running out of work.
-    ++mRunDepth;
-    struct Leave {
-      int& mDepth;
-      ~Leave() { --mDepth; }
-    } leave{mRunDepth};
     if (inPolicy == kPropagate) {
       adaptor->RunPendingCalls();
       return;
@@ -207,8 +200,8 @@ public:
 
   /// What an armed idle check calls when it comes due, on the thread running
   /// the host loop (the main thread): arms the next check, then broadcasts
-  /// the idle message unless calls are queued, a run of ours is under way, or
-  /// an idle broadcast is. Does nothing after Uninstall.
+  /// the idle message unless calls are queued or an idle broadcast is under
+  /// way (an idle listener running a nested loop). Does nothing after Uninstall.
   void CheckIdle(ExceptionPolicy inPolicy) {
     if (!mInstalled.load(std::memory_order_acquire) || mIdleInterval == kIdleOff) return;
     // Armed first, so that an exception leaving the broadcast, or a handler
@@ -216,7 +209,7 @@ public:
     ArmIdleCheck(mIdleInterval);
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
-    if (!adaptor || !kivcore::threads::CurrentThreadIsMainThread() || mRunDepth != 0 || mIdleBroadcasting) return;
+    if (!adaptor || !kivcore::threads::CurrentThreadIsMainThread() || mIdleBroadcasting) return;
     if (adaptor->PendingCallCount() != 0) return;
     mIdleBroadcasting = true;
     struct Leave {
@@ -260,7 +253,6 @@ private:
   std::atomic<std::uint64_t> mScheduledRuns{0};  // statistics only
   std::atomic<std::uint64_t> mIdleBroadcasts{0}; // statistics only
   std::chrono::milliseconds mIdleInterval = kDefaultIdleInterval;  // main thread
-  int mRunDepth = 0;                             // runs of ours on the stack; main thread
   bool mIdleBroadcasting = false;                // main thread
 };
 
