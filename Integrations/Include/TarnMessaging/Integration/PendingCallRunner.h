@@ -196,6 +196,7 @@ public:
     if (inInterval == kIdleOff) DisarmIdleCheck();
     else ArmIdleCheck(inInterval);
   }
+  /// The idle interval; kIdleOff while the idle source is off. Main thread.
   std::chrono::milliseconds IdleInterval() const noexcept { return mIdleInterval; }
 
   /// What an armed idle check calls when it comes due, on the thread running
