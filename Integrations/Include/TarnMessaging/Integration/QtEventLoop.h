@@ -16,9 +16,12 @@
 /// living on the main thread, and its handler runs every call pending by
 /// then: a burst of posted messages costs one Qt event, not one per message
 /// (PendingCallRunner.h explains it). ScheduledRuns() counts the events
-/// posted. A plain QEvent is posted rather than a queued functor: the event
-/// carries no data of ours from the posting thread to the main thread, so
-/// nothing of ours depends on Qt's locks for its ordering.
+/// posted. A plain QEvent is posted rather than a queued functor, so that no
+/// data of ours travels with it from the posting thread to the main thread;
+/// the event itself is published through an atomic of the receiver as well,
+/// so that ThreadSanitizer, which does not see Qt's own locks, orders the
+/// main thread's handling and freeing of it after the posting thread that
+/// made it.
 ///
 /// Idle source: a precise timer of the receiver comes due every idle interval
 /// (PendingCallRunner::kDefaultIdleInterval unless SetIdleInterval says
@@ -59,6 +62,7 @@
 #include <QtCore/QTimerEvent>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <memory>
@@ -135,8 +139,16 @@ private:
       mIdleTimer = 0;
     }
 
+    // Posting thread, under the runner's mutex.
+    void Post() {
+      QEvent* const event = new QEvent(RunEventType());
+      mPublished.fetch_add(1, std::memory_order_release);
+      QCoreApplication::postEvent(this, event);
+    }
+
   protected:
     bool event(QEvent* inEvent) override {
+      mPublished.load(std::memory_order_acquire);
       if (inEvent->type() != RunEventType()) return QObject::event(inEvent);
       Handle([](Runner& inRunner) { inRunner.RunPending(PendingCallRunner::kToErrorManager); });
       return true;
@@ -162,6 +174,7 @@ private:
     }
 
     const std::weak_ptr<Runner> mRunner;
+    std::atomic<std::uint64_t> mPublished{0};  // see Post
     int mDepth = 0;        // handlers of this receiver on the stack; main thread
     bool mLetGo = false;   // main thread
     int mIdleTimer = 0;    // Qt's timer id, 0 when none; main thread
@@ -187,7 +200,7 @@ private:
     }
 
   private:
-    void PostRun() override { QCoreApplication::postEvent(mReceiver, new QEvent(Receiver::RunEventType())); }
+    void PostRun() override { mReceiver->Post(); }
     void ForgetLoop() noexcept override {
       Receiver* const receiver = mReceiver;
       mReceiver = nullptr;
