@@ -205,25 +205,10 @@ public:
   /// way (an idle listener running a nested loop). Does nothing after Uninstall.
   void CheckIdle(ExceptionPolicy inPolicy) {
     if (!mInstalled.load(std::memory_order_acquire) || mIdleInterval == kIdleOff) return;
-    // Armed first, so that an exception leaving the broadcast, or a handler
-    // that destroys the integration, leaves the source in a known state.
-    ArmIdleCheck(mIdleInterval);
-    const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
-        kivcore::threads::GetRegisteredMainThread();
-    if (!adaptor || !kivcore::threads::CurrentThreadIsMainThread() || mIdleBroadcasting) return;
-    if (adaptor->PendingCallCount() != 0) return;
-    mIdleBroadcasting = true;
-    struct Leave {
-      bool& mFlag;
-      ~Leave() { mFlag = false; }
-    } leave{mIdleBroadcasting};
-    mIdleBroadcasts.fetch_add(1, std::memory_order_relaxed);
-    auto broadcast = [] {
-      Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
-      return 1;
-    };
-    if (inPolicy == kPropagate) broadcast();
-    else kivcore::config::ErrorManager::Get(false)->GuardedCall(broadcast);
+    // Re-arming can fail too (std::bad_alloc), and must not unwind through a
+    // C loop either; the source then stays off until SetIdleInterval.
+    if (inPolicy == kPropagate) ArmAndBroadcast();
+    else kivcore::config::ErrorManager::Get(false)->GuardedCall([this] { return ArmAndBroadcast(); });
   }
 
   /// Number of runs posted to the host loop so far: one per batch of queued
@@ -249,6 +234,24 @@ protected:
   virtual void DisarmIdleCheck() noexcept {}
 
 private:
+  // Armed first, so that an exception leaving the broadcast, or a listener
+  // that destroys the integration, leaves the source in a known state.
+  int ArmAndBroadcast() {
+    ArmIdleCheck(mIdleInterval);
+    const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
+        kivcore::threads::GetRegisteredMainThread();
+    if (!adaptor || !kivcore::threads::CurrentThreadIsMainThread() || mIdleBroadcasting) return 0;
+    if (adaptor->PendingCallCount() != 0) return 0;
+    mIdleBroadcasting = true;
+    struct Leave {
+      bool& mFlag;
+      ~Leave() { mFlag = false; }
+    } leave{mIdleBroadcasting};
+    mIdleBroadcasts.fetch_add(1, std::memory_order_relaxed);
+    Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
+    return 1;
+  }
+
   std::mutex mMutex;                             // serialises PostRun with Uninstall
   std::atomic<bool> mInstalled{false};           // written under mMutex; read by runs without it
   std::atomic<std::uint64_t> mScheduledRuns{0};  // statistics only
