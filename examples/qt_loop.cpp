@@ -61,7 +61,7 @@ int main(int argc, char** argv) {
     done.Reset();
   }  // the integration goes before the library does
   Tarn::Messaging::Terminate();
-  std::printf("%d messages received through %llu Qt events; %llu idle broadcasts, the last one quit after %u ms of quiet\n",
+  std::printf("%d messages received through %llu Qt events; %llu idle broadcasts, the last one after %u ms of quiet\n",
               received, events, idles, kQuietMilliSeconds);
   return received == kWorkers * kStepsPerWorker ? 0 : 1;
 }

@@ -44,10 +44,18 @@ inline Numbered::~Numbered() {
   if (mIsCopy && !mHeard && gOnUnheardCopy != nullptr) gOnUnheardCopy(*this);
 }
 
+// Idle checks come due every millisecond, so that idle broadcasts mix with
+// whatever a test does.
+template <class Integration>
+std::unique_ptr<Integration> QuickIdle(std::unique_ptr<Integration> inIntegration) {
+  inIntegration->SetIdleInterval(std::chrono::milliseconds(1));
+  return inIntegration;
+}
+
 struct AsioLoop {
   using Integration = Tarn::Integration::AsioEventLoop;
   boost::asio::io_context mContext;
-  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(mContext); }
+  std::unique_ptr<Integration> Make() { return QuickIdle(std::make_unique<Integration>(mContext)); }
   void Poll() {
     mContext.restart();
     mContext.poll();
@@ -59,7 +67,7 @@ struct GLibLoop {
   using Integration = Tarn::Integration::GLibEventLoop;
   GMainContext* mContext = g_main_context_new();
   ~GLibLoop() { g_main_context_unref(mContext); }
-  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(mContext); }
+  std::unique_ptr<Integration> Make() { return QuickIdle(std::make_unique<Integration>(mContext)); }
   void Poll() {
     while (g_main_context_iteration(mContext, FALSE)) {
     }
@@ -74,27 +82,19 @@ struct QtLoop {
   using Integration = Tarn::Integration::QtEventLoop;
   QtLoop() {
     static int argc = 1;
-    static char name[] = "integration_tests";
-    static char* argv[] = {name, nullptr};
+    static char* argv[] = {const_cast<char*>("integration_tests"), nullptr};
     static QCoreApplication application(argc, argv);
   }
-  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(); }
-  void Poll() {
-    QCoreApplication::processEvents();
-    QCoreApplication::sendPostedEvents();
-  }
+  std::unique_ptr<Integration> Make() { return QuickIdle(std::make_unique<Integration>()); }
+  void Poll() { QCoreApplication::processEvents(); }
 };
 #endif
 
 // Polls inLoop until inDone() or inTimeout passes; returns inDone().
 template <class Loop, class Predicate>
 bool PollUntil(Loop& inLoop, Predicate inDone, std::chrono::milliseconds inTimeout = tarn_test::kDeadline) {
-  return tarn_test::WaitUntil(
-      [&] {
-        inLoop.Poll();
-        return inDone();
-      },
-      inTimeout);
+  auto pollThenCheck = [&] { return inLoop.Poll(), inDone(); };
+  return tarn_test::WaitUntil(pollThenCheck, inTimeout);
 }
 
 }  // namespace integration_test

@@ -12,7 +12,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <chrono>
 #include <memory>
 #include <numeric>
 #include <random>
@@ -47,21 +46,19 @@ struct Scenario {
   std::shared_ptr<void> mIntegration;
 
   int Pick(int inBound) { return std::uniform_int_distribution<int>(0, inBound - 1)(mRandom); }
-  // Idle checks come due often, so that idle broadcasts mix with the posts.
-  template <class Loop>
-  static std::shared_ptr<void> Start(Loop& inLoop) {
-    std::shared_ptr<typename Loop::Integration> integration = inLoop.Make();
-    integration->SetIdleInterval(std::chrono::milliseconds(1));
-    return integration;
-  }
   std::shared_ptr<void> MakeIntegration() {
 #if TARN_HAVE_GLIB_INTEGRATION
-    if (Pick(3) == 0) return Start(mGLib);
+    if (Pick(3) == 0) return mGLib.Make();
 #endif
 #if TARN_HAVE_QT_INTEGRATION
-    if (Pick(2) == 0) return Start(mQt);
+    if (Pick(2) == 0) return mQt.Make();
 #endif
-    return Start(mAsio);
+    return mAsio.Make();
+  }
+  // Either order: the new integration built before the old one goes, or after.
+  void SwapIntegration() {
+    if (Pick(2) == 0) mIntegration.reset();
+    mIntegration = MakeIntegration();
   }
   void Poll() {
     mAsio.Poll();
@@ -114,9 +111,7 @@ class Handler : public Tarn::Listener {
         break;
       }
       case 4:
-        // Either order: the new integration built before the old one goes, or after.
-        if (run.mDepth == 1 && run.Pick(2) == 0) run.mIntegration.reset();
-        if (run.mDepth == 1) run.mIntegration = run.MakeIntegration();
+        if (run.mDepth == 1) run.SwapIntegration();
         break;
     }
     --run.mDepth;
@@ -129,12 +124,8 @@ class IdleHandler : public Tarn::Listener {
   void ListenToMessage(const Tarn::Message&) override {
     Scenario& run = *sRun;
     if (run.mTerminating) return;
-    run.mNestedIdles += run.mDepth != 0;
-    ++run.mDepth;
-    if (run.Pick(4) == 0) {
-      if (run.Pick(2) == 0) run.mIntegration.reset();
-      run.mIntegration = run.MakeIntegration();
-    }
+    run.mNestedIdles += run.mDepth++ != 0;
+    if (run.Pick(4) == 0) run.SwapIntegration();
     --run.mDepth;
   }
 };

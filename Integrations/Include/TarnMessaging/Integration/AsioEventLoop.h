@@ -131,7 +131,8 @@ private:
       const std::uint64_t generation = ++mIdleGeneration;
       mIdleTimer->expires_after(inDelay);
       std::shared_ptr<Runner> self = std::static_pointer_cast<Runner>(shared_from_this());
-      mIdleTimer->async_wait([self, generation, executor = mIdleTimer->get_executor()](const boost::system::error_code& inError) {
+      auto executor = mIdleTimer->get_executor();
+      mIdleTimer->async_wait([self, generation, executor](const boost::system::error_code& inError) {
         if (inError || generation != self->mIdleGeneration) return;
         boost::asio::post(executor, [self, generation] {
           if (generation == self->mIdleGeneration) self->CheckIdle(kPropagate);

@@ -191,7 +191,9 @@ private:
       if (application == nullptr || QThread::currentThread() != application->thread())
         throw std::logic_error("Tarn::Integration::QtEventLoop: construct it on the thread of the QCoreApplication");
       if (!kivcore::threads::CurrentThreadIsMainThread())
-        throw std::logic_error("Tarn::Integration::QtEventLoop: the QCoreApplication's thread is not the main thread; call Tarn::Messaging::Initialize there");
+        throw std::logic_error(
+            "Tarn::Integration::QtEventLoop: the QCoreApplication's thread is not the main thread; call "
+            "Tarn::Messaging::Initialize there");
       mReceiver = new Receiver(std::static_pointer_cast<Runner>(shared_from_this()));
       try {
         PendingCallRunner::Install();
@@ -216,7 +218,9 @@ private:
       if (mReceiver != nullptr) mReceiver->StopIdleTimer();
     }
 
-    Receiver* mReceiver = nullptr;  // owned; guarded by the runner's mutex, and used on the main thread only besides PostRun
+    // Owned; guarded by the runner's mutex, and used on the main thread only
+    // besides PostRun.
+    Receiver* mReceiver = nullptr;
   };
 
   std::shared_ptr<Runner> mRunner;
