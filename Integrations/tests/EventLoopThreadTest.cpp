@@ -156,9 +156,10 @@ TYPED_TEST(EventLoopTest, APendingCallMayDestroyTheIntegrationWhileALaterOneThro
   EXPECT_EQ(1, ran);
 }
 
-// A worker posts in bursts with pauses: idle broadcasts come in the pauses,
-// often enough for an IdleCountdownTimer to fire without help, no more often
-// than the interval allows, and no post is lost. Switched off, none comes;
+// A worker posts in bursts with pauses for a few idle intervals: with the
+// integration's defaults, idle broadcasts come often enough for an
+// IdleCountdownTimer to fire without help, no more often than the interval
+// allows, and no post is lost. Switched off, none comes;
 // switched on while a handler keeps one message queued for several
 // intervals, none comes before the handler stops.
 TYPED_TEST(EventLoopTest, IdleBroadcastsComeOnlyWhenNothingIsQueuedAndStopWhenSwitchedOff) {
@@ -171,22 +172,22 @@ TYPED_TEST(EventLoopTest, IdleBroadcastsComeOnlyWhenNothingIsQueuedAndStopWhenSw
   Tarn::Registration firing = Tarn::Subscribe<Tarn::IdleCountdownTimerMessage>(
       timer.GetStationID(), [&](const Tarn::IdleCountdownTimerMessage&) { fired = true; });
   auto integration = this->mLoop.Make();
-  EXPECT_THROW(integration->SetIdleInterval(milliseconds(-1)), std::invalid_argument);
-  integration->SetIdleInterval(kInterval);
   timer.SetDuration(20);
   const auto start = steady_clock::now();
   timer.ArmTimer();
   std::thread producer([this] {
     for (int i = 0; i < kPosts; ++i) {
       Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, i), false);
-      if (i % 200 == 199) std::this_thread::sleep_for(milliseconds(4));
+      if (i % 200 == 199) std::this_thread::sleep_for(milliseconds(15));
     }
   });
   EXPECT_TRUE(PollUntil(this->mLoop, [&] { return fired && this->mHeard.mTotal == kPosts; }));
   producer.join();
   EXPECT_EQ(static_cast<std::uint64_t>(idle.mTotal), integration->IdleBroadcasts());
-  EXPECT_LE(idle.mTotal, (steady_clock::now() - start) / kInterval + 1) << "the interval must throttle the broadcasts";
+  EXPECT_LE(idle.mTotal, (steady_clock::now() - start) / Tarn::Integration::PendingCallRunner::kDefaultIdleInterval + 1)
+      << "the interval must throttle the broadcasts";
 
+  EXPECT_THROW(integration->SetIdleInterval(milliseconds(-1)), std::invalid_argument);
   integration->SetIdleInterval(Tarn::Integration::PendingCallRunner::kIdleOff);
   const int before = idle.mTotal;
   PollUntil(this->mLoop, [] { return false; }, 10 * kInterval);
@@ -211,7 +212,7 @@ TYPED_TEST(EventLoopTest, IdleBroadcastsComeOnlyWhenNothingIsQueuedAndStopWhenSw
 // the integration.
 TYPED_TEST(EventLoopTest, AnIdleListenerMayNestTheLoopAndDestroyTheIntegration) {
   IdleHeard idle;
-  auto integration = this->mLoop.Make();
+  auto integration = QuickIdle(this->mLoop.Make());
   idle.mAction = [&] {
     PollUntil(this->mLoop, [] { return false; }, std::chrono::milliseconds(5));
     Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, 0), true);

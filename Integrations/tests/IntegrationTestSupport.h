@@ -44,8 +44,8 @@ inline Numbered::~Numbered() {
   if (mIsCopy && !mHeard && gOnUnheardCopy != nullptr) gOnUnheardCopy(*this);
 }
 
-// Idle checks come due every millisecond, so that idle broadcasts mix with
-// whatever a test does.
+// Idle checks every millisecond, so that idle broadcasts mix with whatever a
+// test does.
 template <class Integration>
 std::unique_ptr<Integration> QuickIdle(std::unique_ptr<Integration> inIntegration) {
   inIntegration->SetIdleInterval(std::chrono::milliseconds(1));
@@ -55,7 +55,7 @@ std::unique_ptr<Integration> QuickIdle(std::unique_ptr<Integration> inIntegratio
 struct AsioLoop {
   using Integration = Tarn::Integration::AsioEventLoop;
   boost::asio::io_context mContext;
-  std::unique_ptr<Integration> Make() { return QuickIdle(std::make_unique<Integration>(mContext)); }
+  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(mContext); }
   void Poll() {
     mContext.restart();
     mContext.poll();
@@ -67,7 +67,7 @@ struct GLibLoop {
   using Integration = Tarn::Integration::GLibEventLoop;
   GMainContext* mContext = g_main_context_new();
   ~GLibLoop() { g_main_context_unref(mContext); }
-  std::unique_ptr<Integration> Make() { return QuickIdle(std::make_unique<Integration>(mContext)); }
+  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(mContext); }
   void Poll() {
     while (g_main_context_iteration(mContext, FALSE)) {
     }
@@ -85,7 +85,7 @@ struct QtLoop {
     static char* argv[] = {const_cast<char*>("integration_tests"), nullptr};
     static QCoreApplication application(argc, argv);
   }
-  std::unique_ptr<Integration> Make() { return QuickIdle(std::make_unique<Integration>()); }
+  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(); }
   void Poll() { QCoreApplication::processEvents(); }
 };
 #endif

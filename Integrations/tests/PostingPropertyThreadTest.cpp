@@ -48,12 +48,12 @@ struct Scenario {
   int Pick(int inBound) { return std::uniform_int_distribution<int>(0, inBound - 1)(mRandom); }
   std::shared_ptr<void> MakeIntegration() {
 #if TARN_HAVE_GLIB_INTEGRATION
-    if (Pick(3) == 0) return mGLib.Make();
+    if (Pick(3) == 0) return QuickIdle(mGLib.Make());
 #endif
 #if TARN_HAVE_QT_INTEGRATION
-    if (Pick(2) == 0) return mQt.Make();
+    if (Pick(2) == 0) return QuickIdle(mQt.Make());
 #endif
-    return mAsio.Make();
+    return QuickIdle(mAsio.Make());
   }
   // Either order: the new integration built before the old one goes, or after.
   void SwapIntegration() {

@@ -197,7 +197,6 @@ private:
     }
 
     void ForgetLoop() noexcept override {
-      DisarmIdleCheck();
       DestroySources();
       g_main_context_unref(mContext);
       mContext = nullptr;
