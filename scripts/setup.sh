@@ -17,7 +17,7 @@ optional=(
   clang-tidy        # the lint target
   clang             # the fuzzer (libFuzzer) and the clang++ header check
   libsigc++-3.0-dev # more peer rows in the benchmarks
-  qtbase5-dev       # more peer rows in the benchmarks (Qt 5 signals and queued calls)
+  qtbase5-dev       # the Qt event-loop integration, its example and tests; Qt rows in the benchmarks
   python3           # the benchmark report (bench/report.py)
   gnuplot-nox       # the benchmark chart
   time              # make compile-time (GNU time's CPU seconds)

@@ -16,6 +16,11 @@
 #if TARN_HAVE_GLIB_INTEGRATION
 #include <TarnMessaging/Integration/GLibEventLoop.h>
 #endif
+#if TARN_HAVE_QT_INTEGRATION
+#include <TarnMessaging/Integration/QtEventLoop.h>
+
+#include <QtCore/QCoreApplication>
+#endif
 
 #include <kivcore/MainThread.h>
 
@@ -127,6 +132,25 @@ private:
 };
 #endif
 
+#if TARN_HAVE_QT_INTEGRATION
+// Needs the QCoreApplication that main makes.
+class QtLoop : public MainLoop {
+public:
+  const char* Name() const override { return "qt"; }
+  void Drain() override { QCoreApplication::sendPostedEvents(); }
+  void RunUntilDone(Counter& inCounter) override {
+    inCounter.mOnTarget = [] { QCoreApplication::quit(); };
+    QCoreApplication::exec();
+    inCounter.mOnTarget = nullptr;
+  }
+
+  std::uint64_t ScheduledRuns() const override { return mMessaging.ScheduledRuns(); }
+
+private:
+  Tarn::Integration::QtEventLoop mMessaging;
+};
+#endif
+
 double NanosecondsPer(Clock::duration inElapsed, int inMessages) {
   return std::chrono::duration<double, std::nano>(inElapsed).count() / inMessages;
 }
@@ -190,6 +214,9 @@ struct Contender {
 int main(int argc, char** argv) {
   const int messages = argc > 1 ? std::max(1, std::atoi(argv[1])) : 200000;
   const int repetitions = argc > 2 ? std::max(1, std::atoi(argv[2])) : 5;
+#if TARN_HAVE_QT_INTEGRATION
+  QCoreApplication application(argc, argv);
+#endif
   Tarn::Messaging::Initialize();
   std::printf("%d messages, median of %d repetitions, ns per message\n", messages, repetitions);
   std::vector<Contender> contenders;
@@ -197,6 +224,9 @@ int main(int argc, char** argv) {
   contenders.push_back({"asio", [] { return std::make_unique<AsioLoop>(); }, {}});
 #if TARN_HAVE_GLIB_INTEGRATION
   contenders.push_back({"glib", [] { return std::make_unique<GLibLoop>(); }, {}});
+#endif
+#if TARN_HAVE_QT_INTEGRATION
+  contenders.push_back({"qt", [] { return std::make_unique<QtLoop>(); }, {}});
 #endif
   // Round robin, so that a change of machine load hits every contender alike;
   // one integration exists at a time.

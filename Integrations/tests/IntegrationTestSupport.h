@@ -1,6 +1,6 @@
 // Shared pieces of the event-loop integration tests: a numbered message, the
-// two loops driven the same way (Asio and, where built, GLib), and polling a
-// loop until a condition holds or the deadline passes.
+// loops driven the same way (Asio and, where built, GLib and Qt), and polling
+// a loop until a condition holds or the deadline passes.
 //
 // Threading: everything here is for the main thread, except posting.
 #pragma once
@@ -9,6 +9,9 @@
 #include <TarnMessaging/Integration/AsioEventLoop.h>
 #if TARN_HAVE_GLIB_INTEGRATION
 #include <TarnMessaging/Integration/GLibEventLoop.h>
+#endif
+#if TARN_HAVE_QT_INTEGRATION
+#include <TarnMessaging/Integration/QtEventLoop.h>
 #endif
 
 #include <gtest/gtest.h>
@@ -41,6 +44,14 @@ inline Numbered::~Numbered() {
   if (mIsCopy && !mHeard && gOnUnheardCopy != nullptr) gOnUnheardCopy(*this);
 }
 
+// Idle checks every millisecond, so that idle broadcasts mix with whatever a
+// test does.
+template <class Integration>
+std::unique_ptr<Integration> QuickIdle(std::unique_ptr<Integration> inIntegration) {
+  inIntegration->SetIdleInterval(std::chrono::milliseconds(1));
+  return inIntegration;
+}
+
 struct AsioLoop {
   using Integration = Tarn::Integration::AsioEventLoop;
   boost::asio::io_context mContext;
@@ -64,13 +75,26 @@ struct GLibLoop {
 };
 #endif
 
-// Polls inLoop until inDone() or the deadline; returns inDone().
+#if TARN_HAVE_QT_INTEGRATION
+// The process has one QCoreApplication, made by the first QtLoop on the test
+// thread, which is the main thread of every test.
+struct QtLoop {
+  using Integration = Tarn::Integration::QtEventLoop;
+  QtLoop() {
+    static int argc = 1;
+    static char* argv[] = {const_cast<char*>("integration_tests"), nullptr};
+    static QCoreApplication application(argc, argv);
+  }
+  std::unique_ptr<Integration> Make() { return std::make_unique<Integration>(); }
+  void Poll() { QCoreApplication::processEvents(); }
+};
+#endif
+
+// Polls inLoop until inDone() or inTimeout passes; returns inDone().
 template <class Loop, class Predicate>
-bool PollUntil(Loop& inLoop, Predicate inDone) {
-  return tarn_test::WaitUntil([&] {
-    inLoop.Poll();
-    return inDone();
-  });
+bool PollUntil(Loop& inLoop, Predicate inDone, std::chrono::milliseconds inTimeout = tarn_test::kDeadline) {
+  auto pollThenCheck = [&] { return inLoop.Poll(), inDone(); };
+  return tarn_test::WaitUntil(pollThenCheck, inTimeout);
 }
 
 }  // namespace integration_test

@@ -1,7 +1,8 @@
 // The posting promise as one property, on random runs with fixed seeds:
 // producers post numbered messages while the main thread's handlers flush
 // re-entrantly, post follow-ups, stop and start stations and swap the
-// event-loop integration; Terminate comes with posts still queued. For every
+// event-loop integration, which its idle broadcasts do as well; Terminate
+// comes with posts still queued. For every
 // producer, what is heard is exactly what it posted, in order, minus drops
 // that a stopped station or Terminate explains; nothing twice; every copy
 // freed.
@@ -31,7 +32,7 @@ struct Scenario {
   std::vector<kivcore::utility::ImmutableString> mStations;
   std::vector<bool> mStopped = std::vector<bool>(kStations, false);
   std::vector<std::vector<int>> mHeard{kProducers + 2}, mDropped{kProducers + 2};  // by producer, in order
-  int mUnexplainedDrops = 0, mDepth = 0;
+  int mUnexplainedDrops = 0, mDepth = 0, mNestedIdles = 0;
   int mPosted[2] = {0, 0};  // by handlers so far: queued, at once
   bool mTerminating = false;
   std::atomic<int> mSettled{0};  // posts heard or dropped, for the producers' pacing
@@ -39,19 +40,33 @@ struct Scenario {
 #if TARN_HAVE_GLIB_INTEGRATION
   GLibLoop mGLib;
 #endif
+#if TARN_HAVE_QT_INTEGRATION
+  QtLoop mQt;
+#endif
   std::shared_ptr<void> mIntegration;
 
   int Pick(int inBound) { return std::uniform_int_distribution<int>(0, inBound - 1)(mRandom); }
   std::shared_ptr<void> MakeIntegration() {
 #if TARN_HAVE_GLIB_INTEGRATION
-    if (Pick(2) == 0) return mGLib.Make();
+    if (Pick(3) == 0) return QuickIdle(mGLib.Make());
 #endif
-    return mAsio.Make();
+#if TARN_HAVE_QT_INTEGRATION
+    if (Pick(2) == 0) return QuickIdle(mQt.Make());
+#endif
+    return QuickIdle(mAsio.Make());
+  }
+  // Either order: the new integration built before the old one goes, or after.
+  void SwapIntegration() {
+    if (Pick(2) == 0) mIntegration.reset();
+    mIntegration = MakeIntegration();
   }
   void Poll() {
     mAsio.Poll();
 #if TARN_HAVE_GLIB_INTEGRATION
     mGLib.Poll();
+#endif
+#if TARN_HAVE_QT_INTEGRATION
+    mQt.Poll();
 #endif
   }
 };
@@ -96,11 +111,21 @@ class Handler : public Tarn::Listener {
         break;
       }
       case 4:
-        // Either order: the new integration built before the old one goes, or after.
-        if (run.mDepth == 1 && run.Pick(2) == 0) run.mIntegration.reset();
-        if (run.mDepth == 1) run.mIntegration = run.MakeIntegration();
+        if (run.mDepth == 1) run.SwapIntegration();
         break;
     }
+    --run.mDepth;
+  }
+};
+
+// An idle broadcast comes only between deliveries, and may swap the
+// integration whose idle source made it.
+class IdleHandler : public Tarn::Listener {
+  void ListenToMessage(const Tarn::Message&) override {
+    Scenario& run = *sRun;
+    if (run.mTerminating) return;
+    run.mNestedIdles += run.mDepth++ != 0;
+    if (run.Pick(4) == 0) run.SwapIntegration();
     --run.mDepth;
   }
 };
@@ -117,6 +142,8 @@ TEST_P(PostingPropertyTest, EachProducersPostsAreHeardOnceInOrderOrDroppedForARe
   sRun = &run;
   gOnUnheardCopy = &RecordDrop;
   Handler handler;
+  IdleHandler idle;
+  Tarn::StationUtils::AddListener(Tarn::kStation_Idle, &idle);
   for (int s = 0; s < kStations; ++s) {
     run.mStations.push_back(Tarn::StationRegistry::RegisterUniqueStation());
     Tarn::StationUtils::AddListener(run.mStations.back(), &handler);
@@ -151,10 +178,12 @@ TEST_P(PostingPropertyTest, EachProducersPostsAreHeardOnceInOrderOrDroppedForARe
   }
   run.mTerminating = true;
   for (int s = 0; s < kStations; ++s) Tarn::StationUtils::RemoveListener(run.mStations[s], &handler);
+  Tarn::StationUtils::RemoveListener(Tarn::kStation_Idle, &idle);
   Tarn::Messaging::Terminate();
   gOnUnheardCopy = nullptr;
 
   EXPECT_EQ(0, run.mUnexplainedDrops);
+  EXPECT_EQ(0, run.mNestedIdles) << "idle broadcasts nested in deliveries";
   for (int p = 0; p <= kDirect; ++p) {
     std::vector<int> all(run.mHeard[p]), each(p < kProducers ? kEach : run.mPosted[p - kFollowUps]);
     all.insert(all.end(), run.mDropped[p].begin(), run.mDropped[p].end());

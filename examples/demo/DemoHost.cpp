@@ -8,10 +8,13 @@
 #include "Workers.h"
 
 #include <TarnMessaging.h>
+#include <TarnMessaging/Integration/AsioEventLoop.h>
 
 #include <kivcore/MainThread.h>
 #include <kivcore/SmallBlockAllocator.h>
 
+#include <boost/asio/executor_work_guard.hpp>
+#include <boost/asio/io_context.hpp>
 #include <boost/make_shared.hpp>
 #include <boost/shared_ptr.hpp>
 #include <boost/weak_ptr.hpp>
@@ -182,28 +185,22 @@ void DemoApplication::OnAutosave() {
   mBoard.OpenBurst(mBurst);
 }
 
-// The event loop: run what the workers posted; when nothing is pending, tell
-// the application it is idle, at most every idleInterval. Ends once the last
-// burst is saved and the application is not suspended.
+// The event loop: an io_context that runs what the workers posted, and whose
+// integration tells the application it is idle when nothing is pending, at
+// most every idle interval. After each handler, or a millisecond without one,
+// the loop reports progress to the workers and checks the suspension and the
+// stall limit. Ends once the last burst is saved and the application is not
+// suspended.
 bool DemoApplication::RunEventLoop() {
-  const std::int64_t idleInterval =
-      std::clamp<std::int64_t>(mOptions.mIdleMilliSeconds / 4, 1, 5) * kNanoSecondsPerMilliSecond;
-  std::int64_t nextIdleAt = 0;
+  boost::asio::io_context context;
+  Tarn::Integration::AsioEventLoop messaging(context);
+  messaging.SetIdleInterval(std::chrono::milliseconds(std::clamp<std::uint32_t>(mOptions.mIdleMilliSeconds / 4, 1, 5)));
+  const auto work = boost::asio::make_work_guard(context);
   std::uint64_t lastProgress = 0;
   std::int64_t lastProgressAt = SteadyNanoSeconds();
   while (mBurst < kBursts || mStage == SuspendStage::kSuspended) {
-    const std::int64_t before = SteadyNanoSeconds();
-    const int waitMilliSeconds =
-        nextIdleAt > before
-            ? static_cast<int>((nextIdleAt - before + kNanoSecondsPerMilliSecond - 1) / kNanoSecondsPerMilliSecond)
-            : 0;
-    if (mMainThread->WaitForPendingCalls(waitMilliSeconds)) {
-      mMainThread->RunPendingCalls();
-      mBoard.NoteHandled(mStatusBar.Delivered() + mLedger.mDroppedWhileStopped);
-    } else if (SteadyNanoSeconds() >= nextIdleAt) {
-      Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
-      nextIdleAt = SteadyNanoSeconds() + idleInterval;
-    }
+    context.run_one_for(std::chrono::milliseconds(1));
+    mBoard.NoteHandled(mStatusBar.Delivered() + mLedger.mDroppedWhileStopped);
 
     const std::int64_t now = SteadyNanoSeconds();
     SuspendOrResume(now);

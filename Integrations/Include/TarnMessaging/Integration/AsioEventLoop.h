@@ -16,6 +16,15 @@
 /// not one per message (PendingCallRunner.h explains it).
 /// ScheduledRuns() counts the handlers posted.
 ///
+/// Idle source: a steady_timer on the io_context expires every idle interval
+/// (PendingCallRunner::kDefaultIdleInterval unless SetIdleInterval says
+/// otherwise) and posts the idle check behind the handlers ready by then; the
+/// check broadcasts Tarn::ApplicationIdleMessage on Tarn::kStation_Idle when
+/// no posted message is waiting (PendingCallRunner.h). While the source is on
+/// the io_context always has a timer to wait for, so run() returns only once
+/// stopped; a host that relies on run() returning when the work is done
+/// switches the source off with SetIdleInterval(PendingCallRunner::kIdleOff).
+///
 /// Threading: construct and destroy the object on the main thread, after
 /// Tarn::Messaging::Initialize and before the last Tarn::Messaging::Terminate.
 /// Run the io_context on the main thread only: the handler runs the pending
@@ -49,7 +58,9 @@
 
 #include <boost/asio/io_context.hpp>
 #include <boost/asio/post.hpp>
+#include <boost/asio/steady_timer.hpp>
 
+#include <chrono>
 #include <cstdint>
 #include <memory>
 
@@ -85,20 +96,59 @@ public:
 
   /// Number of handlers posted to the io_context so far. Any thread.
   std::uint64_t ScheduledRuns() const noexcept { return mRunner->ScheduledRuns(); }
+  /// Number of idle broadcasts so far. Any thread.
+  std::uint64_t IdleBroadcasts() const noexcept { return mRunner->IdleBroadcasts(); }
+  /// Sets the idle interval; PendingCallRunner::kIdleOff switches the idle
+  /// source off. Main thread. Precondition: inInterval >= kIdleOff; otherwise
+  /// throws std::invalid_argument.
+  void SetIdleInterval(std::chrono::milliseconds inInterval) { mRunner->SetIdleInterval(inInterval); }
 
 private:
   class Runner : public PendingCallRunner {
   public:
-    explicit Runner(boost::asio::io_context& inContext) : mContext(&inContext) {}
+    explicit Runner(boost::asio::io_context& inContext)
+        : mContext(&inContext), mIdleTimer(std::make_unique<boost::asio::steady_timer>(inContext)) {}
 
   private:
     void PostRun() override {
       std::shared_ptr<PendingCallRunner> self = shared_from_this();
       boost::asio::post(*mContext, [self] { self->RunPending(kPropagate); });
     }
-    void ForgetLoop() noexcept override { mContext = nullptr; }
+    // The timer goes here, on the main thread: a wakeup still under way on a
+    // worker may hold the last reference on the runner, and the io_context
+    // may be gone by then.
+    void ForgetLoop() noexcept override {
+      mContext = nullptr;
+      mIdleTimer.reset();
+    }
+
+    // The timer's handler posts the check rather than making it, so that the
+    // handlers that became ready with it run first. Each armed wait carries
+    // its generation: a wait that completed before a re-arm, a disarm or
+    // ForgetLoop could cancel it finds a newer generation and does nothing.
+    void ArmIdleCheck(std::chrono::milliseconds inDelay) override {
+      if (!mIdleTimer) return;
+      const std::uint64_t generation = ++mIdleGeneration;
+      mIdleTimer->expires_after(inDelay);
+      std::shared_ptr<Runner> self = std::static_pointer_cast<Runner>(shared_from_this());
+      auto executor = mIdleTimer->get_executor();
+      mIdleTimer->async_wait([self, generation, executor](const boost::system::error_code& inError) {
+        if (inError || generation != self->mIdleGeneration) return;
+        boost::asio::post(executor, [self, generation] {
+          if (generation == self->mIdleGeneration) self->CheckIdle(kPropagate);
+        });
+      });
+    }
+    void DisarmIdleCheck() noexcept override {
+      ++mIdleGeneration;
+      boost::system::error_code ignored;
+      if (mIdleTimer) mIdleTimer->cancel(ignored);
+    }
 
     boost::asio::io_context* mContext;  // guarded by the runner's mutex; null after ForgetLoop
+    // Main thread only, like the io_context's handlers; null after ForgetLoop.
+    std::unique_ptr<boost::asio::steady_timer> mIdleTimer;
+    std::uint64_t mIdleGeneration = 0;  // main thread
   };
 
   std::shared_ptr<Runner> mRunner;

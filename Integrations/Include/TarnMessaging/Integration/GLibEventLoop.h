@@ -16,6 +16,14 @@
 /// per message (PendingCallRunner.h explains it). ScheduledRuns()
 /// counts the sources attached.
 ///
+/// Idle source: a timeout source of priority G_PRIORITY_DEFAULT_IDLE comes due
+/// every idle interval (PendingCallRunner::kDefaultIdleInterval unless
+/// SetIdleInterval says otherwise); GLib dispatches it only in an iteration
+/// where no source of higher priority is ready, and it broadcasts
+/// Tarn::ApplicationIdleMessage on Tarn::kStation_Idle when no posted message
+/// is waiting either (PendingCallRunner.h). SetIdleInterval(
+/// PendingCallRunner::kIdleOff) switches it off.
+///
 /// The source is attached explicitly rather than through
 /// g_main_context_invoke: invoke runs the function at once, on the calling
 /// thread, whenever that thread can acquire the context, which a worker can
@@ -57,7 +65,9 @@
 
 #include <glib.h>
 
+#include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -98,6 +108,12 @@ public:
 
   /// Number of sources attached to the context so far. Any thread.
   std::uint64_t ScheduledRuns() const noexcept { return mRunner->ScheduledRuns(); }
+  /// Number of idle broadcasts so far. Any thread.
+  std::uint64_t IdleBroadcasts() const noexcept { return mRunner->IdleBroadcasts(); }
+  /// Sets the idle interval; PendingCallRunner::kIdleOff switches the idle
+  /// source off. Main thread. Precondition: inInterval >= kIdleOff; otherwise
+  /// throws std::invalid_argument.
+  void SetIdleInterval(std::chrono::milliseconds inInterval) { mRunner->SetIdleInterval(inInterval); }
 
 private:
   class Runner : public PendingCallRunner {
@@ -152,6 +168,34 @@ private:
       g_source_attach(source, mContext);
     }
 
+    // The idle source is made, dispatched and destroyed on the main thread.
+    // Its callback data holds the runner until GLib frees it, which is after
+    // the dispatch even when a broadcast destroys the source.
+    static gboolean DispatchIdle(gpointer inRunner) {
+      std::shared_ptr<Runner> runner = *static_cast<std::shared_ptr<Runner>*>(inRunner);
+      runner->CheckIdle(kToErrorManager);
+      return G_SOURCE_REMOVE;
+    }
+    static void FreeRunner(gpointer inRunner) { delete static_cast<std::shared_ptr<Runner>*>(inRunner); }
+
+    void ArmIdleCheck(std::chrono::milliseconds inDelay) override {
+      if (mContext == nullptr) return;
+      auto keep = std::make_unique<std::shared_ptr<Runner>>(std::static_pointer_cast<Runner>(shared_from_this()));
+      DisarmIdleCheck();
+      const auto milliseconds = std::min<std::chrono::milliseconds::rep>(inDelay.count(), G_MAXUINT);
+      mIdleSource = g_timeout_source_new(static_cast<guint>(milliseconds));
+      g_source_set_priority(mIdleSource, G_PRIORITY_DEFAULT_IDLE);
+      g_source_set_name(mIdleSource, "Tarn::Integration::GLibEventLoop idle");
+      g_source_set_callback(mIdleSource, &DispatchIdle, keep.release(), &FreeRunner);
+      g_source_attach(mIdleSource, mContext);
+    }
+    void DisarmIdleCheck() noexcept override {
+      if (mIdleSource == nullptr) return;
+      g_source_destroy(mIdleSource);
+      g_source_unref(mIdleSource);
+      mIdleSource = nullptr;
+    }
+
     void ForgetLoop() noexcept override {
       DestroySources();
       g_main_context_unref(mContext);
@@ -186,6 +230,7 @@ private:
     const int mPriority;
     std::mutex mSourcesMutex;
     std::vector<GSource*> mSources;  // attached, not yet dispatched, one reference each; guarded by mSourcesMutex
+    GSource* mIdleSource = nullptr;  // armed, or dispatched and not yet replaced; one reference; main thread
   };
 
   std::shared_ptr<Runner> mRunner;

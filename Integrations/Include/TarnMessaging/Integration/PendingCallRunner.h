@@ -30,11 +30,27 @@
 /// handler keeps re-posting past that stay queued for the next integration,
 /// FlushPostedMessagesOnUIThread or the last Tarn::Messaging::Terminate.
 ///
-/// Threading: Install and Uninstall on the main thread. Wakeup runs on
-/// whichever thread queues a call, once per batch, and takes mMutex.
-/// RunPending on the thread that runs the host loop, which must be the main
-/// thread. PostRun and ForgetLoop are called with mMutex held.
+/// Idle source: a runner whose loop can wait (ArmIdleCheck) broadcasts
+/// Tarn::ApplicationIdleMessage on Tarn::kStation_Idle when the loop gets to
+/// its idle check and the main thread's queue is empty, at most once per idle
+/// interval (kDefaultIdleInterval unless SetIdleInterval says otherwise), so
+/// that an armed Tarn::IdleCountdownTimer fires without the host broadcasting
+/// anything. The check is armed again before each broadcast, so the interval
+/// counts from the start of one broadcast to the next; a check that finds
+/// calls queued skips its turn, as the loop has not run out of work. An idle
+/// broadcast is never nested in another. SetIdleInterval(kIdleOff) switches
+/// the source off.
+///
+/// Threading: Install, Uninstall, SetIdleInterval, CheckIdle, ArmIdleCheck
+/// and DisarmIdleCheck on the main thread. Wakeup runs on whichever thread
+/// queues a call, once per batch, and takes mMutex. RunPending on the thread
+/// that runs the host loop, which must be the main thread. PostRun and
+/// ForgetLoop are called with mMutex held.
 #pragma once
+
+#include <TarnMessaging/IdleCountdownTimer.h>
+#include <TarnMessaging/StationIDs.h>
+#include <TarnMessaging/StationUtils.h>
 
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
@@ -42,6 +58,7 @@
 #include <boost/shared_ptr.hpp>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -49,7 +66,8 @@
 
 /// @namespace Tarn::Integration
 /// Header-only adaptors that run the main thread's pending calls from a host
-/// event loop (Boost.Asio, GLib).
+/// event loop (Boost.Asio, GLib, Qt), and broadcast idle messages when it has
+/// nothing else to do.
 namespace Tarn::Integration {
 
 /// Base of the event-loop integrations: coalesces wakeups of the main
@@ -69,6 +87,10 @@ public:
 
   /// Most runs of the final drain in Uninstall.
   static constexpr int kDrainPasses = 64;
+  /// The idle interval of a new runner.
+  static constexpr std::chrono::milliseconds kDefaultIdleInterval{50};
+  /// The idle interval that switches the idle source off.
+  static constexpr std::chrono::milliseconds kIdleOff{0};
 
   PendingCallRunner() = default;
   PendingCallRunner(const PendingCallRunner&) = delete;
@@ -85,10 +107,19 @@ public:
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
     if (!adaptor) throw std::logic_error("Tarn::Integration: no main thread; call Tarn::Messaging::Initialize first");
-    mInstalled.store(true, std::memory_order_release);
     std::shared_ptr<PendingCallRunner> self = shared_from_this();
-    // Calls already queued wake us from inside this call.
-    adaptor->SetWakeupHandler([self] { self->Wakeup(); }, this);
+    mInstalled.store(true, std::memory_order_release);
+    try {
+      if (mIdleInterval > kIdleOff) ArmIdleCheck(mIdleInterval);
+      // Calls already queued wake us from inside this call.
+      adaptor->SetWakeupHandler([self] { self->Wakeup(); }, this);
+    } catch (...) {
+      // Nothing of ours stays armed or installed: the integration's
+      // constructor fails, and no destructor will run for it.
+      mInstalled.store(false, std::memory_order_release);
+      DisarmIdleCheck();
+      throw;
+    }
   }
 
   /// Removes this runner's wakeup handler (not one installed since by another
@@ -103,6 +134,7 @@ public:
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
     if (adaptor) adaptor->RemoveWakeupHandler(this);
+    DisarmIdleCheck();
     {
       // A wakeup already under way on another thread may be about to post;
       // once this lock is released none will touch the loop again.
@@ -153,9 +185,37 @@ public:
     });
   }
 
+  /// Sets the idle interval and re-arms the idle check with it; kIdleOff
+  /// switches the idle source off. Main thread; takes effect at once.
+  /// Precondition: inInterval >= kIdleOff; otherwise throws
+  /// std::invalid_argument and changes nothing.
+  void SetIdleInterval(std::chrono::milliseconds inInterval) {
+    if (inInterval < kIdleOff) throw std::invalid_argument("Tarn::Integration: the idle interval must not be negative");
+    mIdleInterval = inInterval;
+    if (!mInstalled.load(std::memory_order_acquire)) return;
+    if (inInterval == kIdleOff) DisarmIdleCheck();
+    else ArmIdleCheck(inInterval);
+  }
+  /// The idle interval; kIdleOff while the idle source is off. Main thread.
+  std::chrono::milliseconds IdleInterval() const noexcept { return mIdleInterval; }
+
+  /// What an armed idle check calls when it comes due, on the thread running
+  /// the host loop (the main thread): arms the next check, then broadcasts
+  /// the idle message unless calls are queued or an idle broadcast is under
+  /// way (an idle listener running a nested loop). Does nothing after Uninstall.
+  void CheckIdle(ExceptionPolicy inPolicy) {
+    if (!mInstalled.load(std::memory_order_acquire) || mIdleInterval == kIdleOff) return;
+    // Re-arming can fail too (std::bad_alloc), and must not unwind through a
+    // C loop either; the source then stays off until SetIdleInterval.
+    if (inPolicy == kPropagate) ArmAndBroadcast();
+    else kivcore::config::ErrorManager::Get(false)->GuardedCall([this] { return ArmAndBroadcast(); });
+  }
+
   /// Number of runs posted to the host loop so far: one per batch of queued
   /// calls, not one per call. Any thread.
   std::uint64_t ScheduledRuns() const noexcept { return mScheduledRuns.load(std::memory_order_relaxed); }
+  /// Number of idle broadcasts made so far. Any thread.
+  std::uint64_t IdleBroadcasts() const noexcept { return mIdleBroadcasts.load(std::memory_order_relaxed); }
 
 protected:
   /// Posts one call of RunPending to the host loop, to run on its thread.
@@ -164,11 +224,40 @@ protected:
   /// Lets go of the host loop; PostRun is not called afterwards. Called once,
   /// with mMutex held, by Uninstall.
   virtual void ForgetLoop() noexcept = 0;
+  /// Has the host loop call CheckIdle once, inDelay from now, when it has no
+  /// other work ready; replaces a check already armed. Main thread, also from
+  /// inside CheckIdle; may throw std::bad_alloc. The default arms nothing: a
+  /// runner that does not override it has no idle source.
+  virtual void ArmIdleCheck(std::chrono::milliseconds inDelay) { static_cast<void>(inDelay); }
+  /// Disarms the idle check; CheckIdle is not called afterwards until the next
+  /// ArmIdleCheck. Main thread, also from inside CheckIdle.
+  virtual void DisarmIdleCheck() noexcept {}
 
 private:
+  // Armed first, so that an exception leaving the broadcast, or a listener
+  // that destroys the integration, leaves the source in a known state.
+  int ArmAndBroadcast() {
+    ArmIdleCheck(mIdleInterval);
+    const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
+        kivcore::threads::GetRegisteredMainThread();
+    if (!adaptor || !kivcore::threads::CurrentThreadIsMainThread() || mIdleBroadcasting) return 0;
+    if (adaptor->PendingCallCount() != 0) return 0;
+    mIdleBroadcasting = true;
+    struct Leave {
+      bool& mFlag;
+      ~Leave() { mFlag = false; }
+    } leave{mIdleBroadcasting};
+    mIdleBroadcasts.fetch_add(1, std::memory_order_relaxed);
+    Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
+    return 1;
+  }
+
   std::mutex mMutex;                             // serialises PostRun with Uninstall
   std::atomic<bool> mInstalled{false};           // written under mMutex; read by runs without it
   std::atomic<std::uint64_t> mScheduledRuns{0};  // statistics only
+  std::atomic<std::uint64_t> mIdleBroadcasts{0}; // statistics only
+  std::chrono::milliseconds mIdleInterval = kDefaultIdleInterval;  // main thread
+  bool mIdleBroadcasting = false;                // main thread
 };
 
 }  // namespace Tarn::Integration
