@@ -16,7 +16,9 @@
 #include <boost/ref.hpp>
 
 #include <algorithm>
+#include <chrono>
 #include <cstdint>
+#include <exception>
 #include <functional>
 #include <limits>
 #include <new>
@@ -355,11 +357,17 @@ struct Traced {
   }
 
   // The tracer's calls and the delivery, in one guarded call: whatever
-  // throws, the broadcast goes on with the next listener.
+  // throws, the broadcast goes on with the next listener. A tracer that
+  // throws before the delivery does not cost the listener its message: its
+  // exception goes to the error manager once the delivery has run (unless
+  // the handler's own exception goes instead).
   int operator()() {
-    {
+    std::exception_ptr tracerFailure;
+    try {
       const TracingState::TracerCall inside;
       mTracer->DeliveryBegins(mDelivery);
+    } catch (...) {
+      tracerFailure = std::current_exception();
     }
     const auto start = std::chrono::steady_clock::now();
     try {
@@ -369,6 +377,7 @@ struct Traced {
       throw;
     }
     Ended(start);
+    if (tracerFailure) std::rethrow_exception(tracerFailure);
     return 0;
   }
 

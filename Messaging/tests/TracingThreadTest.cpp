@@ -116,6 +116,18 @@ TEST(Tracing, EachDeliveryIsTracedOnceWithStationTypeAndListenerAndNoneAfterTheT
   EXPECT_EQ(tracer.mEnded.size(), 3u);
   station.BroadcastMessage(NumberMessage(3));
   EXPECT_EQ(tracer.mEnded.size(), 3u) << "a replaced tracer was called by a later broadcast";
+
+  // A tracer that throws costs no listener its message.
+  struct Throwing : Tarn::Tracing::DeliveryTracer {
+    void DeliveryBegins(const Tarn::Tracing::Delivery&) override { throw std::runtime_error("tracer failed"); }
+    void DeliveryEnded(const Tarn::Tracing::Delivery&, std::chrono::nanoseconds) override {}
+  } throwing;
+  Tarn::Tracing::SetDeliveryTracer(&throwing);
+  const int heard = inner.Calls() + echo.Calls();
+  const std::size_t reported = exceptions.Count();
+  bare.BroadcastMessage(PingMessage());
+  EXPECT_EQ(inner.Calls() + echo.Calls(), heard + 2) << "a throwing tracer cost a delivery";
+  EXPECT_EQ(exceptions.Count(), reported + 2) << "the tracer's exceptions must reach the error manager";
 }
 
 // The main thread is stuck in a nested delivery (a handler on the station

@@ -35,7 +35,8 @@
 /// A tracer may broadcast; the deliveries of broadcasts made from inside the
 /// tracer are not traced, so it cannot recurse into itself. An exception a
 /// tracer throws goes to the error manager's GuardedCall, as a handler's
-/// would; a throw from DeliveryBegins skips that delivery.
+/// would; a throw from DeliveryBegins does not skip the delivery (the
+/// exception goes to the error manager after it).
 ///
 /// Removal-wait report: a removal (RemoveListener, a listener's destructor,
 /// a registration's destruction) made on one thread while another thread (the
@@ -106,7 +107,7 @@ TARN_MESSAGING_API DeliveryTracer* SetDeliveryTracer(DeliveryTracer* inTracer) n
 constexpr std::chrono::milliseconds kDefaultRemovalWaitReport{2000};
 
 /// The key of the removal-wait report; the text follows the '='.
-constexpr const char* kRemovalWaitKey = "$$$/TarnMessaging/Diagnostics/RemovalWait=";
+constexpr const char* kRemovalWaitKey = "$$$/TarnMessaging/Tracing/RemovalWait=";
 
 /// Sets how long a removal waits for a delivery on another thread before it
 /// reports (zero or less: never), for removals that start waiting from now
