@@ -346,9 +346,10 @@ void TerminateFrom(const void* inCallSite) {
       StationRetirement::Delete(station);
     }
   }
+  // Stations retired here go at the end of their broadcasts, like every
+  // retired station; the room made for them is given back if none was.
   RegistryLock lock("StationRegistry::Terminate");
   PendingStationList& pending = GetPendingStationList();
-  if (kivcore::threads::CurrentThreadIsMainThread()) DeleteAll(pending, Sweep::kRetired);
   if (pending.empty()) PendingStationList().swap(pending);
 }
 

@@ -107,6 +107,10 @@ TEST(Tracing, EachDeliveryIsTracedOnceWithStationTypeAndListenerAndNoneAfterTheT
   EXPECT_GE(echo.Calls(), 5) << "the tracer's own broadcasts must still deliver";
   EXPECT_EQ(Tarn::Tracing::ReadableTypeName("no type"), "no type");
   EXPECT_THROW(Tarn::Tracing::ReadableTypeName(nullptr), kivcore::config::Error);
+  {
+    messaging_test::ErrorRecorder returning;
+    EXPECT_EQ(Tarn::Tracing::ReadableTypeName(nullptr), "") << "a returned report must not let the null through";
+  }
 
   // Replaced by a handler: the running broadcast keeps its tracer to the end.
   tracer.mEnded.clear();
