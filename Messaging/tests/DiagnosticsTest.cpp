@@ -42,7 +42,10 @@ TEST(MessageIDCollision, TheSecondTypeIsReportedNamingBothAndNeverTakenForTheFir
   const std::string condition = dialog.Violations()[0].condition;
   EXPECT_NE(condition.find("diagnostics_test::CollisionXf (N16diagnostics_test11CollisionXfE) and "
                            "diagnostics_test::CollisionYa"), std::string::npos) << condition;
-  EXPECT_EQ(errors.Count(), 1u);
+  ASSERT_EQ(errors.Count(), 1u);
+  const kivcore::config::ErrorReport report = errors.Reports()[0];
+  EXPECT_TRUE(report.level == 0 && report.number == 105u && report.code == 25 && report.flag)
+      << "not the report a failed contract check makes";
   EXPECT_EQ(second.As<CollisionXf>(), nullptr);
   // Another module finds the name's own ID, and the report is not repeated.
   EXPECT_EQ(Tarn::Detail::GlobalMessageID(typeid(CollisionYa).name()), second.GetMessageID());
