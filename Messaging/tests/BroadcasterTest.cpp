@@ -173,4 +173,25 @@ TEST_F(BroadcasterTest, TheIndexStaysInStepWithTheEntriesThroughEveryChange) {
   EXPECT_FALSE(broadcaster.HasListeners()) << "an entry outlived its removal or prune";
 }
 
+// A copy, made or assigned, takes the listen state and none of the
+// original's broadcasters; an assigned listener keeps its own.
+TEST(ListenerCopy, ACopyTakesTheListenStateButNoBroadcaster) {
+  struct Quiet : Tarn::Listener {
+    void ListenToMessage(const Tarn::Message&) override {}
+  };
+  Tarn::Broadcaster broadcaster, other;
+  Quiet original, assigned;
+  broadcaster.AddListener(&original);
+  other.AddListener(&assigned);
+  original.StopListening();
+  Quiet copy(original);
+  assigned = original;
+  EXPECT_FALSE(copy.IsListening() || assigned.IsListening());
+  EXPECT_TRUE(original.HasBroadcaster(&broadcaster) && !copy.HasBroadcaster(&broadcaster) &&
+              !assigned.HasBroadcaster(&broadcaster) && assigned.HasBroadcaster(&other));
+  original.StartListening();
+  assigned = original;
+  EXPECT_TRUE(assigned.IsListening());
+}
+
 }  // namespace
