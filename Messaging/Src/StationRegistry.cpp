@@ -389,19 +389,28 @@ void StationRetainer::Release(const ImmutableString& inStationID, const std::uin
     StationRecord& record = found->second;
     if (record.mStation == nullptr) return;
     if (record.mRetainCount == 1 && record.mDisposeRequested) {
-      const bool onMainThread = kivcore::threads::CurrentThreadIsMainThread();
-      PendingStationList& pending = GetPendingStationList();
-      // Room is made before anything changes, so an exhausted allocator
-      // leaves the registry as it was.
-      if (onMainThread) pending.reserve(pending.size() + 1);
       doomed = record.mStation;
-      map->erase(found);
+      PendingStationList& pending = GetPendingStationList();
       // On the main thread, a release from inside a broadcast on the station
-      // (its own relay, say) must not pull the station from under it.
-      if (onMainThread && StationRetirement::IsBroadcasting(*doomed)) {
+      // (its own relay, say) must not pull the station from under it: it is
+      // retired, in room made before anything changes, so that an exhausted
+      // allocator leaves the registry as it was.
+      if (kivcore::threads::CurrentThreadIsMainThread() && StationRetirement::IsBroadcasting(*doomed)) {
+        try {
+          pending.reserve(pending.size() + 1);
+        } catch (const std::bad_alloc&) {
+          if (inLife == nullptr) throw;
+          // A call's own hold is released from a destructor and cannot
+          // fail: the station stays, its disposal pending, for the next
+          // disposal, release or Terminate to complete.
+          --record.mRetainCount;
+          return;
+        }
+        map->erase(found);
         Retire(doomed);
         return;
       }
+      map->erase(found);
       if (pending.empty()) PendingStationList().swap(pending);
     } else {
       --record.mRetainCount;

@@ -39,6 +39,13 @@ struct Scene {
     mBroadcaster.BroadcastMessage(NumberMessage(1));
     Tarn::StationUtils::BroadcastMessage(mStation, NumberMessage(1));
   }
+  void DisposedInItsOwnBroadcast(bool inByID) {
+    mStation = Tarn::StationRegistry::RegisterUniqueStation();
+    mPlain.SetAction([id = mStation](const Tarn::Message&) { Tarn::StationRegistry::DisposeStation(id); });
+    Tarn::StationUtils::AddListener(mStation, &mPlain);
+    if (inByID) Tarn::StationUtils::BroadcastMessage(mStation, NumberMessage(1));
+    else Tarn::StationRegistry::FindStation(mStation)->BroadcastMessage(NumberMessage(1));
+  }
   void FireTimer() {
     if (!mTimer) mTimer = std::make_unique<Tarn::IdleCountdownTimer>();
     Tarn::StationUtils::AddListener(mTimer->GetStationID(), &mPlain);
@@ -57,6 +64,10 @@ TEST(AllocationFailure, EveryOperationThrowsBadAllocOrCompletesAndLeavesTheLibra
       {[](Scene& s) { s.mStation = Tarn::StationRegistry::RegisterUniqueStation(); }, 0},
       {[](Scene& s) { s.AttachAndBroadcast(); }, 3},
       {[](Scene& s) { s.FireTimer(); }, 1},
+      // A station disposed of by a handler of its own broadcast: made by ID
+      // (the call's release completes the disposal) and made on the station.
+      {[](Scene& s) { s.DisposedInItsOwnBroadcast(true); }, 1},
+      {[](Scene& s) { s.DisposedInItsOwnBroadcast(false); }, 1},
   };
   for (const auto& [operation, callsWhenDone] : operations) {
     for (long long k = -1;; ++k) {  // -1: a first run that never fails, for what is made once per process

@@ -6,10 +6,14 @@
 
 #include <pthread.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cstdint>
 #include <cstring>
 #include <random>
+#include <set>
+#include <thread>
+#include <vector>
 
 using kivcore::utility::SmallBlockAllocator;
 
@@ -137,6 +141,27 @@ TEST(SmallBlockAllocatorThreads, AllocationsInAThreadExitCleanupAreCountedAndRet
     ASSERT_FALSE(HasFailure()) << "round " << round;
   }
   pthread_key_delete(key);
+}
+
+// The cache of a thread that has exited serves the next thread empty: the
+// blocks it held went to the pool, and none is handed out twice.
+TEST(SmallBlockAllocatorThreads, ARetiredCacheServesTheNextThreadEmpty) {
+  std::thread([] {
+    void* blocks[20];
+    for (void*& block : blocks) block = SmallBlockAllocator::Allocate(32);
+    for (void* block : blocks) SmallBlockAllocator::Dispose(block, 32);
+  }).join();
+  std::vector<void*> theirs, mine;
+  std::thread([&theirs] {
+    for (int i = 0; i < 200; ++i) theirs.push_back(SmallBlockAllocator::Allocate(32));
+  }).join();
+  for (int i = 0; i < 200; ++i) mine.push_back(SmallBlockAllocator::Allocate(32));
+  const std::set<void*> taken(theirs.begin(), theirs.end());
+  EXPECT_EQ(taken.size(), theirs.size());
+  EXPECT_TRUE(std::none_of(mine.begin(), mine.end(), [&](void* inBlock) { return taken.count(inBlock) != 0; }))
+      << "a block was handed out twice";
+  for (void* block : theirs) SmallBlockAllocator::Dispose(block, 32);
+  for (void* block : mine) SmallBlockAllocator::Dispose(block, 32);
 }
 
 }  // namespace
