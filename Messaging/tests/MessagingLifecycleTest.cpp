@@ -2,6 +2,7 @@
 // registry at process exit.
 #include "StationTestSupport.h"
 
+#include <kivcore/InitializerRegistry.h>
 #include <kivcore/SmallBlockAllocator.h>
 
 #include <sys/wait.h>
@@ -61,6 +62,15 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   Registry::DisposeStation(Tarn::kStation_Idle);
   EXPECT_EQ(Registry::FindStation(Tarn::kStation_Idle), nullptr) << "the new station is held by a retain it never had";
   Tarn::Messaging::Terminate();
+}
+
+// A host that brings its libraries up through the initializer registry
+// brings this one up and down with them.
+TEST(MessagingLifecycleTest, TheInitializerRegistryBringsTheLibraryUpAndDown) {
+  ASSERT_TRUE(kivcore::config::InitializerRegistry::InitializeAll(kivcore::proplist::PropList()));
+  EXPECT_TRUE(kivcore::threads::CurrentThreadIsMainThread());
+  kivcore::config::InitializerRegistry::TerminateAll();
+  EXPECT_FALSE(kivcore::threads::CurrentThreadIsMainThread());
 }
 
 // The library brought up, used (a station made, retired under its own
