@@ -74,7 +74,8 @@ TEST(MessagingLifecycleTest, TheInitializerRegistryBringsTheLibraryUpAndDown) {
 }
 
 // The library brought up, used (a station made, retired under its own
-// broadcast, disposed of) and terminated gives back every small block it took.
+// broadcast, disposed of; a post left waiting for idle time) and terminated
+// gives back every small block it took.
 TEST(MessagingLifecycleTest, TerminateGivesBackEverySmallBlock) {
   const auto before = kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse;
   Tarn::Messaging::Initialize();
@@ -85,6 +86,7 @@ TEST(MessagingLifecycleTest, TerminateGivesBackEverySmallBlock) {
     Utils::AddListener(id, &disposer);
     Utils::BroadcastMessage(id, NumberMessage(1));
     EXPECT_EQ(Registry::FindStation(id), nullptr);
+    Utils::PostMessageAtIdleTime(Tarn::kStation_Idle, NumberMessage(2));  // waits for an idle broadcast that never comes
   }
   Tarn::Messaging::Terminate();
   EXPECT_EQ(kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse, before);
