@@ -30,6 +30,7 @@ std::string Report(const char* inKey) {
 // handler reports it or a host's handler takes it or throws. Each Set
 // returns the previous handler; an empty one restores the default.
 TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoes) {
+  EXPECT_FALSE(kivcore::debug::IsDebuggerAttached()) << "the suite runs without a debugger";
   EXPECT_FALSE(debug::BreakAfterContractDialog("in != NULL", "Broadcaster.cpp", "Tarn::AddListener", 92));
   EXPECT_EQ("$$$/K=a=b -> a=b: in != NULL in Tarn::AddListener at Broadcaster.cpp:92", Report("$$$/K=a=b"));
   EXPECT_EQ("$$$/K=a=b -> a=b", Report("$$$/K=a=b"));
