@@ -318,13 +318,15 @@ std::size_t BroadcasterCore::CountListeners(Broadcaster& inBroadcaster) {
 
 namespace {
 
-// The walk of an untraced broadcast: every delivery goes straight to the
-// error manager.
-struct Untraced {
-  void Deliver(kivcore::config::ErrorManager* inErrors, const boost::function<int()>& inDelivery,
-               const ListenerEntry&) {
-    inErrors->GuardedCall(inDelivery);
-  }
+// The walk of an untraced broadcast: the walk calls each listener itself and
+// hands what it throws to the error manager (see Walk).
+struct Untraced {};
+
+// Raises the exception being handled again, inside the error manager's
+// guarded call, so that the manager's handler receives it exactly as if the
+// delivery had run inside that call.
+struct RethrowCurrent {
+  int operator()() const { throw; }
 };
 
 // The walk of a traced broadcast: each delivery is published for the
@@ -414,27 +416,22 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
   bool currentIsPlain = true;  // frame.mCurrent has no weak field set
   bool gone = false;
   // Built once: the record refers to frame.mCurrent, which each pass
-  // refills. The call names the delivery directly (no function pointer to
-  // follow) and fits inside the boost::function, so nothing is allocated.
+  // refills.
   const Broadcaster::BroadcastMessageRecord record{frame.mCurrent, inMessage, &gone};
+  // The traced walk hands each delivery to its policy as a call. It names
+  // the delivery directly (no function pointer to follow) and fits inside
+  // the boost::function, so nothing is allocated.
   struct Deliver {
     const Broadcaster::BroadcastMessageRecord* mRecord;
     int operator()() const { return Broadcaster::DeliverToListener(*mRecord); }
   };
-  const boost::function<int()> delivery(Deliver{&record});
-  {
-    Locked lock(mMutex, "Broadcaster::BroadcastMessage1");
-    frame.mNextBelow = mNextSerial;
-    frame.mPosition = mEntries.size();
-    frame.mNext = mFrames;
-    mFrames = &frame;
-  }
   // Unlinks the frame on every way out, so that no remover waits for a
-  // broadcast that has ended.
+  // broadcast that has ended. Only a delivery can throw, and none runs under
+  // the lock, so the scope never finds the lock held by the walk.
   struct FrameScope {
     BroadcasterCore& mCore;
     Frame& mFrame;
-    bool mLinked = true;
+    bool mLinked = false;
     ~FrameScope() {
       if (!mLinked) return;
       Locked lock(mCore.mMutex, "Broadcaster::BroadcastMessage2");
@@ -442,9 +439,16 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
     }
   } scope{*this, frame};
 
+  // One hold of the lock links the frame and picks the first entry; each
+  // later hold ends one delivery and picks the next.
+  mMutex.Lock("Broadcaster::BroadcastMessage1");
+  frame.mNextBelow = mNextSerial;
+  frame.mPosition = mEntries.size();
+  frame.mNext = mFrames;
+  mFrames = &frame;
+  scope.mLinked = true;
   for (;;) {
     {
-      Locked lock(mMutex, "Broadcaster::BroadcastMessage1");
       EndDelivery(frame);
       // The newest entry older than the last one served. Unless entries
       // were added or removed meanwhile, it sits just below where the last
@@ -458,6 +462,7 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
       if (position == 0) {
         Unlink(frame);
         scope.mLinked = false;
+        mMutex.Unlock();
         return;
       }
       const StoredEntry* const next = &mEntries[--position];
@@ -475,11 +480,28 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
       }
       frame.mDelivering = true;
     }
+    mMutex.Unlock();
     // No lock is held while the listener runs.
     gone = false;
-    ioPolicy.Deliver(errors, delivery, frame.mCurrent);
+    if constexpr (std::is_same<Policy, Untraced>::value) {
+      // The error manager's guarded call, inline: a plain listener is called
+      // straight from here, and only an exception goes through the manager.
+      try {
+        Listener* const listener = frame.mCurrent.mListener;
+        if (listener == nullptr) {
+          Broadcaster::DeliverToListener(record);
+        } else if (listener->IsListening()) {
+          listener->ProcessMessage(inMessage);
+        }
+      } catch (...) {
+        errors->GuardedCall(boost::function<int()>(RethrowCurrent()));
+      }
+    } else {
+      ioPolicy.Deliver(errors, boost::function<int()>(Deliver{&record}), frame.mCurrent);
+    }
     // A weak or safe listener found gone is pruned as the broadcast passes.
     if (gone) Remove(frame.mCurrent, nullptr, Wait::kNever, false);
+    mMutex.Lock("Broadcaster::BroadcastMessage1");
   }
 }
 
