@@ -162,7 +162,7 @@ bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
   try {
     mEntries.push_back(StoredEntry{inEntry, mNextSerial});
     stored = true;
-    if (inEntry.mListener != nullptr) inEntry.mListener->AddBroadcaster(mOwner, weak_from_this());
+    if (inEntry.mListener != nullptr) inEntry.mListener->AddBroadcaster(mOwner, mSelf);
   } catch (...) {
     // Out of storage, or without its back-link the listener could not
     // detach itself when it dies: take the whole registration back.
@@ -178,6 +178,8 @@ bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
 
 BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait,
                                                  bool inCheck) {
+  // Declared before the lock, so that it is let go after the lock is.
+  std::shared_ptr<BroadcasterCore> keep;
   Locked lock(mMutex, "Broadcaster::RemoveListener1");
   const auto found = mIndex.find(inListener);
   if (found != mIndex.end()) {
@@ -187,7 +189,7 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
     mEntries.erase(mEntries.begin() + static_cast<std::ptrdiff_t>(PositionOf(found->second)));
     mIndex.erase(found);
   }
-  if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(weak_from_this());
+  if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(mSelf);
   if (inWait == Wait::kNever) return Removed::kAtOnce;
   // The caller may destroy the listener next, so no delivery to it may still
   // run elsewhere. Deliveries on this thread are on the caller's own stack
@@ -196,6 +198,12 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
   // which a handler may drop meanwhile.
   const std::uintptr_t self = kivcore::threads::CurrentThreadToken();
   if (!OtherThreadDelivers(inListener, self)) return Removed::kAtOnce;
+  // The lock is let go while this removal waits, and a handler on the
+  // delivering thread may destroy the broadcaster meanwhile: the removal
+  // holds the core itself from here, so that it finds a closed core rather
+  // than freed memory. The delivering broadcast holds the core now, so the
+  // reference can be had.
+  keep = mSelf.lock();
   Waiter waiter{&inListener, mGateMap.mFirst};
   mGateMap.mFirst = &waiter;
   // Read only once this removal has to wait, so that removals that do not
@@ -291,9 +299,8 @@ void BroadcasterCore::Close() noexcept {
 #ifndef NDEBUG
     inUse = mFrames != nullptr || mGateMap.mFirst != nullptr;
 #endif
-    const std::weak_ptr<BroadcasterCore> self = weak_from_this();
     for (const StoredEntry& stored : mEntries) {
-      if (stored.mEntry.mListener != nullptr) stored.mEntry.mListener->RemoveBroadcaster(self);
+      if (stored.mEntry.mListener != nullptr) stored.mEntry.mListener->RemoveBroadcaster(mSelf);
     }
     mEntries.clear();
     mIndex.clear();
@@ -508,9 +515,14 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
 // ---------------------------------------------------------------------------
 // Broadcaster
 
-Broadcaster::Broadcaster()
-    : mCore(std::allocate_shared<BroadcasterCore>(
-          kivcore::utility::SmallBlockAllocator::STLAllocator<BroadcasterCore>(), this)) {}
+std::shared_ptr<BroadcasterCore> BroadcasterCore::Make(Broadcaster* inOwner) {
+  std::shared_ptr<BroadcasterCore> core =
+      std::allocate_shared<BroadcasterCore>(kivcore::utility::SmallBlockAllocator::STLAllocator<BroadcasterCore>(), inOwner);
+  core->mSelf = core;
+  return core;
+}
+
+Broadcaster::Broadcaster() : mCore(BroadcasterCore::Make(this)) {}
 
 Broadcaster::Broadcaster(const Broadcaster& inOther) : Broadcaster() {
   mBroadcasting.store(inOther.IsBroadcasting(), std::memory_order_relaxed);
@@ -549,40 +561,35 @@ void Broadcaster::AddListener(const std::weak_ptr<Listener>& inListener) {
   mCore->Add(entry);
 }
 
-// Each removal holds the core for its whole length, so that a broadcaster
-// destroyed while a remover waits leaves the remover a closed core rather
-// than freed memory.
+// A removal that has to wait holds the core from then on (see
+// BroadcasterCore::Remove).
 void Broadcaster::RemoveListener(Listener* inListener, bool inUpdateListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
   if (inListener == nullptr) return;  // never follow a null pointer
   ListenerEntry entry;
   entry.mListener = inListener;
-  const std::shared_ptr<BroadcasterCore> core = mCore;
-  core->Remove(entry, inUpdateListener ? inListener : nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
+  mCore->Remove(entry, inUpdateListener ? inListener : nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 void Broadcaster::RemoveListener(InterfaceRef<ISafeListener> inListener) {
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
   ListenerEntry entry;
   entry.mSafeListener = GetSafeListenerHandle(inListener);
-  const std::shared_ptr<BroadcasterCore> core = mCore;
-  core->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
+  mCore->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 void Broadcaster::RemoveListener(const boost::weak_ptr<Listener>& inListener) {
   TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   ListenerEntry entry;
   entry.mBoostWeakListener = inListener;
-  const std::shared_ptr<BroadcasterCore> core = mCore;
-  core->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
+  mCore->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 void Broadcaster::RemoveListener(const std::weak_ptr<Listener>& inListener) {
   TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   ListenerEntry entry;
   entry.mStdWeakListener = inListener;
-  const std::shared_ptr<BroadcasterCore> core = mCore;
-  core->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
+  mCore->Remove(entry, nullptr, BroadcasterCore::Wait::kForOtherThreads, true);
 }
 
 bool Broadcaster::HasListener(Listener* inListener) {

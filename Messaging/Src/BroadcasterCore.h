@@ -34,7 +34,7 @@
 
 namespace Tarn {
 
-class BroadcasterCore : public std::enable_shared_from_this<BroadcasterCore> {
+class BroadcasterCore {
 public:
   // One running broadcast; lives on the broadcasting thread's stack.
   struct Frame {
@@ -61,6 +61,8 @@ public:
   };
   enum class Wait { kForOtherThreads, kNever };
 
+  // The core of inOwner, from the small-block allocator.
+  static std::shared_ptr<BroadcasterCore> Make(Broadcaster* inOwner);
   explicit BroadcasterCore(Broadcaster* inOwner) noexcept : mOwner(inOwner) {}
   BroadcasterCore(const BroadcasterCore&) = delete;
   BroadcasterCore& operator=(const BroadcasterCore&) = delete;
@@ -131,6 +133,10 @@ private:
   void EndDelivery(Frame& ioFrame) noexcept;
   void Unlink(Frame& ioFrame) noexcept;
 
+  // A weak link to this core, set once by Make: every back-link is a copy
+  // of it, and removals compare with it, so attaching and detaching take no
+  // reference count of their own beyond the back-link's.
+  std::weak_ptr<BroadcasterCore> mSelf;
   kivcore::threads::RecursiveMutex mMutex;
   Broadcaster* mOwner;                // guarded by mMutex; null once closed
   EntryVector mEntries;               // guarded by mMutex; oldest first, serials rising
