@@ -41,6 +41,10 @@ struct StationRecord {
   // destroyed inside the factory, and its destructor looks its own ID up:
   // that lookup must not call the factory again (it would recurse for ever).
   bool mMaking = false;
+  // The holds of running calls among mRetainCount. While one stands the
+  // record stays in the map, whatever a host's unbalanced releases did to
+  // the count, so that the call's release can find it by address.
+  std::uint32_t mCallHolds = 0;
 };
 
 // Keys compare by identity (interned handles), never by text.
@@ -91,6 +95,7 @@ public:
   }
   StationMap& operator*() const noexcept { return *mMap; }
   StationMap* operator->() const noexcept { return mMap; }
+  bool IsOrphan() const noexcept { return mOrphan != nullptr; }
 
 private:
   StationMap* mMap = nullptr;
@@ -184,6 +189,37 @@ Station* MakeStation(StationRecord& ioRecord) {
   return ioRecord.mStation;
 }
 
+// The release that completes a pending disposal: the record goes, and its
+// station is returned, to be deleted once the lock is let go. On the main
+// thread, a release from inside a broadcast on the station (its own relay,
+// say) must not pull the station from under it: the station is retired
+// instead, in room made before anything changes, and null is returned. When
+// that room cannot be had, a host's release throws std::bad_alloc with
+// nothing changed; a call's own release runs in a destructor and cannot
+// fail, so it leaves the station, its disposal pending, for the next
+// disposal, release or Terminate to complete. The registry's lock must be
+// held.
+Station* CompleteDisposal(StationMap& ioMap, StationMap::iterator inFound, bool inCallsOwn) {
+  StationRecord& record = inFound->second;
+  Station* const doomed = record.mStation;
+  PendingStationList& pending = GetPendingStationList();
+  if (kivcore::threads::CurrentThreadIsMainThread() && StationRetirement::IsBroadcasting(*doomed)) {
+    try {
+      pending.reserve(pending.size() + 1);
+    } catch (const std::bad_alloc&) {
+      if (!inCallsOwn) throw;
+      --record.mRetainCount;
+      return nullptr;
+    }
+    ioMap.erase(inFound);
+    Retire(doomed);
+    return nullptr;
+  }
+  ioMap.erase(inFound);
+  if (pending.empty()) PendingStationList().swap(pending);
+  return doomed;
+}
+
 // Reports the stations that Terminate is about to delete while they are
 // still retained or still have listeners: their users will find them gone
 // without a word. The map is the caller's own by now, so no lock is needed.
@@ -252,12 +288,26 @@ Station* FindStation(const ImmutableString& inStationID) {
   return MakeStation(found->second);
 }
 
-Station* RetainStation(const ImmutableString& inStationID) {
-  std::uint64_t life = 0;
-  return StationRetainer::Retain(inStationID, life);
-}
+Station* RetainStation(const ImmutableString& inStationID) { return StationRetainer::Retain(inStationID, nullptr); }
 
-void ReleaseStation(const ImmutableString& inStationID) { StationRetainer::Release(inStationID, nullptr); }
+void ReleaseStation(const ImmutableString& inStationID) {
+  Station* doomed = nullptr;
+  {
+    RegistryLock lock("StationRegistry::ReleaseStation");
+    StationMapAccess map;
+    const auto found = map->find(inStationID);
+    if (found == map->end()) return;
+    StationRecord& record = found->second;
+    if (record.mStation == nullptr) return;
+    if (record.mRetainCount != 1 || !record.mDisposeRequested || record.mCallHolds != 0) {
+      --record.mRetainCount;
+      return;
+    }
+    doomed = CompleteDisposal(*map, found, false);
+  }
+  // Deleted after the lock is released; see StationRetainer::Release.
+  StationRetirement::Delete(doomed);
+}
 
 void DisposeStation(const ImmutableString& inStationID) {
   RegistryLock lock(nullptr);
@@ -265,7 +315,7 @@ void DisposeStation(const ImmutableString& inStationID) {
   const auto found = map->find(inStationID);
   if (found == map->end()) return;
   StationRecord& record = found->second;
-  if (record.mRetainCount != 0) {
+  if (record.mRetainCount != 0 || record.mCallHolds != 0) {
     record.mDisposeRequested = true;
     return;
   }
@@ -355,9 +405,8 @@ void TerminateFrom(const void* inCallSite) {
 
 }  // namespace StationRegistry
 
-Station* StationRetainer::Retain(const ImmutableString& inStationID, std::uint64_t& outLife) {
+Station* StationRetainer::Retain(const ImmutableString& inStationID, Hold* outHold) {
   RegistryLock lock("StationRegistry::RetainStation");
-  outLife = sLife;
   StationMapAccess map;
   const auto found = map->find(inStationID);
   if (found == map->end()) return nullptr;
@@ -374,48 +423,36 @@ Station* StationRetainer::Retain(const ImmutableString& inStationID, std::uint64
     --record.mRetainCount;
     throw;
   }
-  if (station == nullptr) --record.mRetainCount;
+  if (station == nullptr) {
+    --record.mRetainCount;
+  } else if (outHold != nullptr) {
+    ++record.mCallHolds;
+    outHold->mRecord = &record;
+    outHold->mLife = sLife;
+  }
   return station;
 }
 
-void StationRetainer::Release(const ImmutableString& inStationID, const std::uint64_t* inLife) {
+void StationRetainer::Release(const Hold& inHold) noexcept {
   Station* doomed = nullptr;
   {
     RegistryLock lock("StationRegistry::ReleaseStation");
-    if (inLife != nullptr && *inLife != sLife) return;
+    // After a Terminate the record is gone, and the ID may name a new
+    // station that this hold never counted.
+    if (inHold.mLife != sLife) return;
     StationMapAccess map;
-    const auto found = map->find(inStationID);
-    if (found == map->end()) return;
-    StationRecord& record = found->second;
-    if (record.mStation == nullptr) return;
-    if (record.mRetainCount == 1 && record.mDisposeRequested) {
-      doomed = record.mStation;
-      PendingStationList& pending = GetPendingStationList();
-      // On the main thread, a release from inside a broadcast on the station
-      // (its own relay, say) must not pull the station from under it: it is
-      // retired, in room made before anything changes, so that an exhausted
-      // allocator leaves the registry as it was.
-      if (kivcore::threads::CurrentThreadIsMainThread() && StationRetirement::IsBroadcasting(*doomed)) {
-        try {
-          pending.reserve(pending.size() + 1);
-        } catch (const std::bad_alloc&) {
-          if (inLife == nullptr) throw;
-          // A call's own hold is released from a destructor and cannot
-          // fail: the station stays, its disposal pending, for the next
-          // disposal, release or Terminate to complete.
-          --record.mRetainCount;
-          return;
-        }
-        map->erase(found);
-        Retire(doomed);
-        return;
-      }
-      map->erase(found);
-      if (pending.empty()) PendingStationList().swap(pending);
-    } else {
+    if (map.IsOrphan()) return;
+    // The record stands: only this hold's own release removes a record
+    // while call holds remain.
+    StationRecord& record = *static_cast<StationRecord*>(inHold.mRecord);
+    --record.mCallHolds;
+    // A count of 0 here is a host's unbalanced release: the disposal this
+    // hold deferred is still completed.
+    if (record.mRetainCount > 1 || !record.mDisposeRequested || record.mCallHolds != 0) {
       --record.mRetainCount;
       return;
     }
+    doomed = CompleteDisposal(*map, map->find(record.mStationID), true);
   }
   // Deleted after the lock is released: on a worker thread the station's
   // destructor waits for a delivery to it running on the main thread, whose

@@ -14,14 +14,10 @@ namespace Tarn {
 // Retains a station for one call and releases it on every way out.
 class StationRetainer {
 public:
-  // The ID is copied now: by the release the station may be gone (a handler
-  // of its broadcast terminated the library), and the release may delete the
-  // station and the caller's string with it, so neither is read after the
-  // broadcast.
   explicit StationRetainer(const kivcore::utility::ImmutableString& inStationID)
-      : mStation(Retain(inStationID, mLife)), mStationID(inStationID) {}
+      : mStation(Retain(inStationID, &mHold)) {}
   ~StationRetainer() {
-    if (mStation != nullptr) Release(mStationID, &mLife);
+    if (mStation != nullptr) Release(mHold);
   }
   StationRetainer(const StationRetainer&) = delete;
   StationRetainer& operator=(const StationRetainer&) = delete;
@@ -32,20 +28,27 @@ public:
 
 private:
   friend Station* StationRegistry::RetainStation(const kivcore::utility::ImmutableString&);
-  friend void StationRegistry::ReleaseStation(const kivcore::utility::ImmutableString&);
 
-  // The registry's retain and release, defined with it. Each Terminate ends
-  // one life of the registry. A retain notes the life it was made in, and a
-  // release given that life does nothing in a later one: a handler may
+  // What a call's retain needs for its release: the registry record it
+  // counted on, and the registry's life it was made in. Each Terminate ends
+  // one life; a release in a later one does nothing, since a handler may
   // terminate the library and bring it back, and the ID may then name a new
-  // station that this retain never counted. A host's release (no life) is
-  // counted on whatever station the ID names.
-  static Station* Retain(const kivcore::utility::ImmutableString& inStationID, std::uint64_t& outLife);
-  static void Release(const kivcore::utility::ImmutableString& inStationID, const std::uint64_t* inLife);
+  // station that this retain never counted. The release neither looks the ID
+  // up nor reads the caller's string, which the release may delete with the
+  // station.
+  struct Hold {
+    void* mRecord = nullptr;
+    std::uint64_t mLife = 0;
+  };
 
-  std::uint64_t mLife = 0;  // initialised before mStation, which Retain sets it for
+  // The registry's retain and a call's release, defined with it. A retain
+  // with a hold is a call's: its record keeps its place in the registry until
+  // the release. Without one it is a host's RetainStation.
+  static Station* Retain(const kivcore::utility::ImmutableString& inStationID, Hold* outHold);
+  static void Release(const Hold& inHold) noexcept;
+
+  Hold mHold;  // initialised before mStation, which Retain fills it for
   Station* const mStation;
-  const kivcore::utility::ImmutableString mStationID;
 };
 
 }  // namespace Tarn

@@ -53,6 +53,26 @@ TEST_F(StationTest, RelayDisposedOrReleasedFromInsideItsOwnBroadcastIsDeletedWhe
   }
 }
 
+// A host's unbalanced release and a disposal, from a handler of a broadcast
+// made by ID: the broadcast's own hold keeps the record until it ends (its
+// release reaches the record by address), and that release completes the
+// disposal instead of wrapping the count.
+TEST_F(StationTest, AnUnbalancedReleaseUnderABroadcastByIDNeitherFreesNorKeepsTheStation) {
+  StationLog::Reset();
+  const ImmutableString id = MakeCounted();
+  RecordingListener listener("L");
+  listener.SetAction([&](const Tarn::Message&) {
+    Registry::ReleaseStation(id);
+    Registry::DisposeStation(id);
+    EXPECT_NE(Registry::FindStation(id), nullptr) << "the record went while the broadcast held it";
+  });
+  Tarn::StationUtils::AddListener(id, &listener);
+  Tarn::StationUtils::BroadcastMessage(id, NumberMessage(1));
+  EXPECT_EQ(listener.Calls(), 1);
+  EXPECT_EQ(StationLog::Destructions(), 1) << "the disposal was left pending for ever";
+  EXPECT_EQ(Registry::FindStation(id), nullptr);
+}
+
 // A retain whose factory throws or gives no station is not counted, so a
 // later disposal deletes the record at once instead of waiting for ever.
 TEST_F(StationTest, ARetainThatMakesNoStationLeavesNoCountBehind) {
