@@ -98,6 +98,64 @@ TEST(BroadcasterThreads, RemoversAndDestructorsWaitForTheRunningHandlerAndNeedNo
   EXPECT_EQ(returned.load(), 3);
 }
 
+// A listener added again while a removal of it still waits, and removed a
+// second time from another thread: the contract check reports the second
+// removal, and both return once the delivery has ended.
+TEST(BroadcasterThreads, ASecondRemovalWhileAnEarlierOneWaitsIsReported) {
+  messaging_test::MainThreadGuard mainThread;
+  messaging_test::ContractDialogRecorder dialog;
+  messaging_test::ErrorRecorder errors;
+  Tarn::Broadcaster broadcaster;
+  messaging_test::RecordingListener held("H");
+  Latch entered;
+  std::atomic<int> returned{0};
+  const auto remove = [&] {
+    broadcaster.RemoveListener(&held, true);
+    returned.fetch_add(1);
+  };
+  std::thread first([&] {
+    ASSERT_TRUE(entered.WaitFor());
+    remove();
+  }), second;
+  held.SetAction([&](const Tarn::Message&) {
+    entered.CountDown();
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));  // the first removal is waiting by now
+    broadcaster.AddListener(&held);
+    second = std::thread(remove);
+    EXPECT_TRUE(messaging_test::WaitUntil([&] { return errors.Count() == 1; }));
+    EXPECT_EQ(returned.load(), 0);
+  });
+  broadcaster.AddListener(&held);
+  broadcaster.BroadcastMessage(NumberMessage(1));
+  first.join();
+  second.join();
+  EXPECT_EQ(returned.load(), 2);
+  EXPECT_EQ(dialog.Count(), 1u);
+  EXPECT_FALSE(broadcaster.HasListeners());
+}
+
+// One listener attached to and detached from two broadcasters on two threads
+// at once: both change its list of back-links, behind the list's own lock.
+TEST(BroadcasterThreads, OneListenerAttachedAndDetachedOnTwoThreadsKeepsExactBackLinks) {
+  messaging_test::RecordingListener listener("L");
+  Tarn::Broadcaster first, second;
+  ThreadGroup threads;
+  for (Tarn::Broadcaster* broadcaster : {&first, &second}) {
+    threads.Start([&listener, broadcaster] {
+      for (int round = 0; round < 20000; ++round) {
+        broadcaster->AddListener(&listener);
+        broadcaster->RemoveListener(&listener, true);
+      }
+      broadcaster->AddListener(&listener);
+    });
+  }
+  threads.JoinAll();
+  EXPECT_TRUE(listener.HasBroadcaster(&first) && listener.HasBroadcaster(&second));
+  first.RemoveListener(&listener, true);
+  EXPECT_FALSE(listener.HasBroadcaster(&first));
+  EXPECT_TRUE(listener.HasBroadcaster(&second));
+}
+
 // ~Broadcaster on the main thread and ~Listener on a worker at the same
 // moment: each once walked the other's list unguarded (use after free).
 TEST(BroadcasterThreads, BroadcasterAndListenerDestroyedAtOnceOnTwoThreads) {

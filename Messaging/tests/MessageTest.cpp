@@ -13,6 +13,7 @@
 #include <set>
 #include <stdexcept>
 #include <typeinfo>
+#include <vector>
 
 const Tarn::Message& OtherUnitProgress();  // MessageOtherUnit.cpp
 
@@ -83,6 +84,21 @@ TEST(MessageID, TypesOfOneNameInTheAnonymousNamespacesOfTwoSourcesGetDistinctIDs
   first.reset();
   third.emplace(name);
   EXPECT_EQ(third->GetMessageID(), Tarn::HashMessageTypeNameToMessageID(name));
+  // Modules loaded on two threads at once list their types at once: each
+  // record still gets an ID of its own, and each leaves the list whole.
+  std::vector<std::unique_ptr<Tarn::Detail::LocalMessageType>> loaded[2];
+  messaging_test::ThreadGroup modules;
+  for (auto& types : loaded) {
+    modules.Start([&types, name] {
+      for (int type = 0; type < 150; ++type) types.push_back(std::make_unique<Tarn::Detail::LocalMessageType>(name));
+    });
+  }
+  modules.JoinAll();
+  std::set<Tarn::MessageID> distinct{third->GetMessageID()};
+  for (const auto& types : loaded) {
+    for (const auto& type : types) distinct.insert(type->GetMessageID());
+  }
+  EXPECT_EQ(distinct.size(), 301u);
 }
 
 TEST(MessageClone, ACloneAndACloneOfItAreCopiesInOneExactBlockEachThatDeleteReturns) {

@@ -90,6 +90,7 @@ TEST_F(StationTest, ARetainThatMakesNoStationLeavesNoCountBehind) {
   EXPECT_EQ(StationLog::Destructions(), 1) << "a failed retain kept the station's count up";
   EXPECT_EQ(Registry::FindStation(id), nullptr);
   Registry::RegisterStation(static_cast<Tarn::Station*>(nullptr));  // nothing to register
+  Registry::ReleaseStation(id);  // no longer registered: nothing to release, nothing read
 }
 
 }  // namespace

@@ -18,6 +18,7 @@
 #include <optional>
 #include <stdexcept>
 #include <thread>
+#include <tuple>
 
 namespace {
 
@@ -191,6 +192,8 @@ TEST(Tracing, ARemovalWaitingPastTheThresholdReportsOnceAndGoesOnWaiting) {
     EXPECT_GE(std::atoi(text.c_str() + (waited == std::string::npos ? text.size() : waited + 11)), 30) << text;
     if (!throwingHandler) {
       EXPECT_EQ(text.rfind(Tarn::Tracing::kRemovalWaitKey, 0), 0u) << text;
+      const kivcore::config::ErrorReport report = recorder->Reports().at(0);
+      EXPECT_EQ(std::make_tuple(report.level, report.number, report.code, report.flag), std::make_tuple(0, 0u, 0, false));
     }
     for (const std::string& part :
          {"plain listener " + Address(&outer), std::string("\"") + station.GetStationID().c_str() + "\"",

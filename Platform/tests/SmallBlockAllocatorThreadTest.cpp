@@ -5,10 +5,14 @@
 #include <gtest/gtest.h>
 
 #include <pthread.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cstdint>
+#include <cstdio>
 #include <cstring>
 #include <random>
 #include <set>
@@ -66,6 +70,36 @@ TEST(SmallBlockAllocator, FailAfterRefusesAllocationsOnceTheAllowanceIsUsedUp) {
   EXPECT_THROW(SmallBlockAllocator::STLAllocator<std::uint64_t>().allocate(std::size_t{1} << 62), std::bad_alloc);
   SmallBlockAllocator::Dispose(nullptr, 24);
   ExpectCounts(before, 0, 0, 3);
+}
+
+// With the system out of memory for a new chunk, an allocation gives null,
+// both when the thread cache refills and when the pool carves, instead of
+// carving from a null chunk. Run in a child whose address space is capped;
+// the sanitizers' runtimes cannot live under such a cap.
+TEST(SmallBlockAllocator, ASystemOutOfMemoryGivesNullInsteadOfACrash) {
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+  GTEST_SKIP() << "the sanitizer runtimes reserve more address space than the cap allows";
+#else
+  const pid_t child = ::fork();
+  ASSERT_NE(child, -1);
+  if (child == 0) {
+    long pages = 0;
+    if (std::FILE* statm = std::fopen("/proc/self/statm", "r")) {
+      if (std::fscanf(statm, "%ld", &pages) != 1) pages = 0;
+      std::fclose(statm);
+    }
+    const rlim_t cap = static_cast<rlim_t>(pages) * static_cast<rlim_t>(::sysconf(_SC_PAGESIZE)) + (rlim_t{8} << 20);
+    const rlimit limit{cap, cap};
+    if (pages == 0 || ::setrlimit(RLIMIT_AS, &limit) != 0) ::_exit(2);
+    for (long made = 0; made < (1L << 24); ++made) {
+      if (SmallBlockAllocator::Allocate(48) == nullptr) ::_exit(0);
+    }
+    ::_exit(3);  // the cap never bit
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "child status " << status;
+#endif
 }
 
 // Each thread takes bursts of blocks (spanning several pool chunks, and
