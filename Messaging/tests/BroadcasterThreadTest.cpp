@@ -11,6 +11,7 @@
 #include <chrono>
 #include <optional>
 #include <thread>
+#include <vector>
 
 namespace {
 
@@ -139,10 +140,17 @@ TEST(BroadcasterThreads, ASecondRemovalWhileAnEarlierOneWaitsIsReported) {
 TEST(BroadcasterThreads, OneListenerAttachedAndDetachedOnTwoThreadsKeepsExactBackLinks) {
   messaging_test::RecordingListener listener("L");
   Tarn::Broadcaster first, second;
+  // Many links make each change of the list a long walk, so that the two
+  // threads' changes overlap often.
+  std::vector<Tarn::Broadcaster> others(64);
+  for (Tarn::Broadcaster& other : others) other.AddListener(&listener);
+  Latch ready(2);
   ThreadGroup threads;
   for (Tarn::Broadcaster* broadcaster : {&first, &second}) {
-    threads.Start([&listener, broadcaster] {
-      for (int round = 0; round < 20000; ++round) {
+    threads.Start([&, broadcaster] {
+      ready.CountDown();
+      ASSERT_TRUE(ready.WaitFor());
+      for (int round = 0; round < 250000; ++round) {
         broadcaster->AddListener(&listener);
         broadcaster->RemoveListener(&listener, true);
       }
