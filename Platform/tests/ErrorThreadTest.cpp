@@ -50,28 +50,38 @@ TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoe
   EXPECT_EQ("$$$/K -> $$$/K", Report("$$$/K"));
 }
 
-// Threads swap handlers while they report: every report reaches exactly one
-// handler (none falls through to the default, which would throw), no handler
-// is destroyed while it runs, and no thread sees another's failed check.
+// Threads swap handlers while they report: every report and every contract
+// dialog reaches exactly one handler (none falls through to the default,
+// which would throw), no handler is destroyed while it runs, and no thread
+// sees another's failed check.
 TEST(ErrorReportingThreads, SwappedHandlersSeeEachReportOnceAndFailedChecksStayOnTheirThread) {
-  std::atomic<int> handled{0};
+  constexpr int kRounds = 2000;
+  std::atomic<int> handled{0}, dialogs{0};
   debug::BreakAfterContractDialog("main's", "t.cpp", "Main::Check", 3);
   platform_test::ThreadGroup threads;
   for (int t = 0; t < 4; ++t) {
-    threads.Start([&handled] {
-      for (int i = 0; i < 2000; ++i) {
+    threads.Start([&handled, &dialogs] {
+      for (int i = 0; i < kRounds; ++i) {
         auto calls = std::make_shared<std::atomic<int>>(0);  // freed with the handler
         config::SetErrorHandler([&handled, calls](const config::ErrorReport&) {
           handled.fetch_add(debug::TakeLastContractViolation().empty() ? 1 : 1000000);
           calls->fetch_add(1);
         });
         EXPECT_EQ("returned", Report("$$$/K"));
+        debug::SetContractDialogHandler([&dialogs, calls](const char*, const char*, const char*, int) {
+          calls->fetch_add(1);
+          return dialogs.fetch_add(1) >= 0;
+        });
+        EXPECT_TRUE(debug::BreakAfterContractDialog("t", "t.cpp", "T", 1));
+        debug::TakeLastContractViolation();
       }
     });
   }
   threads.JoinAll();
   config::SetErrorHandler(nullptr);
-  EXPECT_EQ(4 * 2000, handled.load());
+  debug::SetContractDialogHandler(nullptr);
+  EXPECT_EQ(4 * kRounds, handled.load());
+  EXPECT_EQ(4 * kRounds, dialogs.load());
   EXPECT_EQ("main's, Main::Check, t.cpp:3", debug::TakeLastContractViolation());
 }
 
