@@ -86,19 +86,24 @@ TEST(MessageID, TypesOfOneNameInTheAnonymousNamespacesOfTwoSourcesGetDistinctIDs
   EXPECT_EQ(third->GetMessageID(), Tarn::HashMessageTypeNameToMessageID(name));
   // Modules loaded on two threads at once list their types at once: each
   // record still gets an ID of its own, and each leaves the list whole.
-  std::vector<std::unique_ptr<Tarn::Detail::LocalMessageType>> loaded[2];
+  std::vector<Tarn::MessageID> loaded[2];
+  messaging_test::Latch started(2), listed(2);
   messaging_test::ThreadGroup modules;
-  for (auto& types : loaded) {
-    modules.Start([&types, name] {
-      for (int type = 0; type < 150; ++type) types.push_back(std::make_unique<Tarn::Detail::LocalMessageType>(name));
+  for (auto& ids : loaded) {
+    modules.Start([&, name] {
+      std::vector<std::unique_ptr<Tarn::Detail::LocalMessageType>> types;
+      started.CountDown();
+      ASSERT_TRUE(started.WaitFor());
+      for (int type = 0; type < 200; ++type) types.push_back(std::make_unique<Tarn::Detail::LocalMessageType>(name));
+      for (const auto& type : types) ids.push_back(type->GetMessageID());
+      listed.CountDown();
+      ASSERT_TRUE(listed.WaitFor());  // then both unload at once
     });
   }
   modules.JoinAll();
   std::set<Tarn::MessageID> distinct{third->GetMessageID()};
-  for (const auto& types : loaded) {
-    for (const auto& type : types) distinct.insert(type->GetMessageID());
-  }
-  EXPECT_EQ(distinct.size(), 301u);
+  for (const auto& ids : loaded) distinct.insert(ids.begin(), ids.end());
+  EXPECT_EQ(distinct.size(), 401u);
 }
 
 TEST(MessageClone, ACloneAndACloneOfItAreCopiesInOneExactBlockEachThatDeleteReturns) {

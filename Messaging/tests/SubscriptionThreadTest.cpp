@@ -124,17 +124,30 @@ TEST_F(SubscriptionTest, TypedHandlerSeesOnlyItsTypeAndMayEndItsOwnSubscription)
 }
 
 TEST_F(SubscriptionTest, BroadcasterOrStationGoneFirstAndBadInputLeaveNothingToDetach) {
-  for (int kind = 0; kind < Listeners::kKinds; ++kind) {
+  for (int kind = 0; kind < 2 * Listeners::kKinds; ++kind) {
+    // In the second round the broadcaster goes from one of its handlers,
+    // whose broadcast still holds the closed core when the registration
+    // detaches from it.
+    const bool fromHandler = kind >= Listeners::kKinds;
     SCOPED_TRACE(kind);
     Listeners listeners;
     auto broadcaster = std::make_unique<Tarn::Broadcaster>();
     const ImmutableString station = MakeCounted();
-    Registration onBroadcaster = listeners.Attach(*broadcaster, kind);
-    Registration onStation = listeners.Attach(station, kind);
+    Registration onBroadcaster, onStation;
+    listeners.mAction = [&] {
+      broadcaster.reset();
+      onBroadcaster.Reset();
+    };
+    onBroadcaster = listeners.Attach(*broadcaster, kind % Listeners::kKinds);
+    onStation = listeners.Attach(station, kind % Listeners::kKinds);
+    if (fromHandler) {
+      broadcaster->BroadcastMessage(NumberMessage(1));
+      EXPECT_EQ(broadcaster, nullptr) << "the handler did not run";
+    }
     broadcaster.reset();
     Tarn::StationRegistry::DisposeStation(station);
     ASSERT_EQ(nullptr, Tarn::StationRegistry::RetainStation(station));
-    // Both registrations are destroyed here, after what they were attached to.
+    // The registrations left are destroyed here, after what they were attached to.
   }
   messaging_test::ContractDialogRecorder dialogs;
   messaging_test::ErrorRecorder errors;
