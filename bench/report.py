@@ -22,7 +22,8 @@ import subprocess
 import sys
 import tempfile
 
-DELIVERY = [("Floor", "raw loop of virtual calls (floor)"), ("Signals2", "boost::signals2"),
+DELIVERY = [("Floor", "raw loop of virtual calls (floor)"),
+            ("LockedFloor", "the same, one lock hold per step (the floor of Tarn's walk)"), ("Signals2", "boost::signals2"),
             ("Sigc", "libsigc++ 3"), ("QtFunctor", "Qt 5, direct connection to a functor"),
             ("QtSlot", "Qt 5, direct connection to a slot"), ("TarnPlain", "Tarn Broadcaster, Listener*"),
             ("TarnWeak", "Tarn Broadcaster, std::weak_ptr"), ("TarnStation", "Tarn, by station ID")]
@@ -231,7 +232,8 @@ def chart(res, posting_runs, path):
                 values = [res.get(f"Posting/{k}/{p}", "items_per_second") for p in (1, 2)]
                 f.write(f'"{SHORT.get(k, k)}" ' + " ".join(
                     str(v / 1e6) if v else "NaN" for v in values) + "\n")
-        lines = ", ".join(f"'{delivery}' index {i} using 1:2 with linespoints lw 2 title '{label}'"
+        # A quote inside a single-quoted gnuplot string is written twice.
+        lines = ", ".join(f"'{delivery}' index {i} using 1:2 with linespoints lw 2 title '{label.replace(chr(39), chr(39) * 2)}'"
                           for i, (_, label) in enumerate(peers))
         terminal = "pngcairo size 1200,480 font 'sans,10'" if path.endswith(".png") else \
             "svg size 1200,480 dynamic font 'sans,11' background '#ffffff'"

@@ -115,6 +115,18 @@ TEST_F(IdleCountdownTimerTest, ATimerWorksAgainOnceTheLibraryIsInitializedAnew) 
   timer.ArmTimer();
   SendIdle();
   EXPECT_EQ(recorder.Firings(), 1u);
+  // An idle station whose factory gives nothing at its first call: the
+  // attach makes it at the second, and the timer listens to that station.
+  Tarn::Messaging::Terminate();
+  static int sCalls = 0;
+  Tarn::StationRegistry::RegisterStation(Tarn::kStation_Idle, [](const kivcore::utility::ImmutableString& inID) {
+    return sCalls++ == 0 ? nullptr : new Tarn::Station(inID);
+  });
+  Tarn::Messaging::Initialize();
+  AddListener(timer.GetStationID(), &recorder);
+  timer.ArmTimer();
+  SendIdle();
+  EXPECT_EQ(recorder.Firings(), 2u);
 }
 
 TEST_F(IdleCountdownTimerTest, HandlersMayRearmNestIdleMessagesAndThrowWithoutStoppingTheTimer) {
