@@ -16,6 +16,8 @@
 // delivers the pair to every attached handler.
 #include "BenchSupport.h"
 
+#include <kivcore/RecursiveMutex.h>
+
 #include <boost/signals2/signal.hpp>
 
 #if defined(TARN_BENCH_HAVE_SIGC)
@@ -44,6 +46,22 @@ struct Floor {
     for (PairSink* sink : mSinks) sink->OnPair(PairArgs{kA, kB});
   }
   std::vector<PairSink*> mSinks;
+};
+
+// The floor of a walk that holds a lock once per step, as Tarn's does: the
+// same loop, with one lock and unlock of kivcore's mutex around the pick of
+// each handler and one more to find the end.
+struct LockedFloor : Floor {
+  void Emit() {
+    for (std::size_t i = 0;; ++i) {
+      mMutex.Lock(nullptr);
+      PairSink* const sink = i < mSinks.size() ? mSinks[i] : nullptr;
+      mMutex.Unlock();
+      if (sink == nullptr) return;
+      sink->OnPair(PairArgs{kA, kB});
+    }
+  }
+  kivcore::threads::RecursiveMutex mMutex;
 };
 
 // A slot library's handler: a lambda over the tally, and its connection.
@@ -247,6 +265,7 @@ void Register(const std::string& inName) {
 
 const bool sRegistered = [] {
   Register<Floor, false, false>("Floor");
+  Register<LockedFloor, false, false>("LockedFloor");
   Register<Signals2>("Signals2");
 #if defined(TARN_BENCH_HAVE_SIGC)
   Register<Sigc>("Sigc");
