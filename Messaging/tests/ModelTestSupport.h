@@ -5,7 +5,6 @@
 //   TARN_LONG_TESTS=1        longer runs
 //   TARN_TEST_SEED=N         first seed (replays a failure)
 //   TARN_TEST_SEQUENCES=N    number of sequences (1 to replay one)
-//   TARN_SOAK_SECONDS=N      duration of the soak suites
 //
 // Threading: a Random is used by one thread at a time; the functions only
 // read the environment.
@@ -30,12 +29,6 @@ inline std::uint64_t EnvironmentNumber(const char* inName, std::uint64_t inDefau
 }
 
 inline bool LongTestsRequested() { return EnvironmentNumber("TARN_LONG_TESTS", 0) != 0; }
-
-// TARN_SOAK_SECONDS, else inDefault (long mode: two minutes).
-inline std::chrono::milliseconds SoakDuration(std::chrono::milliseconds inDefault) {
-  const std::uint64_t seconds = EnvironmentNumber("TARN_SOAK_SECONDS", LongTestsRequested() ? 120 : 0);
-  return seconds != 0 ? std::chrono::seconds(seconds) : inDefault;
-}
 
 // A seeded generator; std::mt19937_64 and plain arithmetic give the same
 // sequence on every platform (the standard distributions do not).

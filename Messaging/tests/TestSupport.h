@@ -119,10 +119,6 @@ public:
     std::lock_guard<std::mutex> lock(mState->mMutex);
     return mState->mViolations.size();
   }
-  void Clear() {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    mState->mViolations.clear();
-  }
 
 private:
   struct State {
@@ -271,12 +267,6 @@ public:
   std::vector<std::string> Entries() const {
     std::lock_guard<std::mutex> lock(mMutex);
     return mEntries;
-  }
-  std::size_t Count(const std::string& inEntry) const {
-    std::lock_guard<std::mutex> lock(mMutex);
-    std::size_t count = 0;
-    for (const std::string& entry : mEntries) count += entry == inEntry ? 1 : 0;
-    return count;
   }
   void Clear() {
     std::lock_guard<std::mutex> lock(mMutex);
@@ -458,26 +448,6 @@ public:
         inBroadcaster.RemoveListener(mSafe);
         break;
     }
-  }
-  // A callable that detaches the listener from inBroadcaster without
-  // touching this handle, for a handler that removes its own listener while
-  // another thread may be destroying the handle. Call it only while the
-  // listener is alive (from its own handler, for instance).
-  std::function<void()> MakeDetacher(Tarn::Broadcaster& inBroadcaster) const {
-    Tarn::Broadcaster* const broadcaster = &inBroadcaster;
-    switch (mKind) {
-      case ListenerKind::kPlainPointer:
-        return [broadcaster, listener = mPlain.get()] { broadcaster->RemoveListener(listener, true); };
-      case ListenerKind::kBoostWeak:
-        return [broadcaster, listener = boost::weak_ptr<Tarn::Listener>(mBoost)] {
-          broadcaster->RemoveListener(listener);
-        };
-      case ListenerKind::kStdWeak:
-        return [broadcaster, listener = std::weak_ptr<Tarn::Listener>(mStd)] { broadcaster->RemoveListener(listener); };
-      case ListenerKind::kSafe:
-        return [broadcaster, listener = mSafe.get()] { broadcaster->RemoveListener(Tarn::ISafeListenerRef(listener)); };
-    }
-    return [] {};
   }
   // Ends the handle's ownership. The listener itself may live on for a
   // delivery in progress (weak and safe kinds); IsDestroyed tells.
