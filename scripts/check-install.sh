@@ -1,9 +1,11 @@
 #!/usr/bin/env bash
 # Installs a build into a scratch prefix and builds and runs a small consumer
 # (examples/consumer) against it the two ways the README documents:
-#   1. find_package(TarnMessaging) in a CMake project;
+#   1. find_package(TarnMessaging) in a CMake project, with the event-loop
+#      examples linked to each integration the build has (its components);
 #   2. pkg-config, as C++17 with LD_LIBRARY_PATH and as C++20 with an rpath
-#      (the .pc files must leave the language level to the consumer).
+#      (the .pc files must leave the language level to the consumer), and each
+#      event-loop example through its integration's .pc file.
 # Each consumer must load the libraries of the prefix, not of the build tree.
 #
 #   scripts/check-install.sh BUILD_DIR [WORK_DIR]
@@ -37,12 +39,31 @@ uses_prefix() {
   grep -q "libTarnMessaging.so.* => $libdir/" <<< "$loaded" || fail "$1 does not load libTarnMessaging from $libdir"
 }
 
-step "find_package route"
+# The integrations this build installed, each a component of the package:
+# the consumer requires every one of them.
+loops=()
+components=()
+for targets in "$libdir"/cmake/TarnMessaging/Tarn*IntegrationTargets.cmake; do
+  [ -e "$targets" ] || continue
+  component=$(basename "$targets" Targets.cmake)
+  component=${component#Tarn}
+  components+=("$component")
+  loop=${component%Integration}
+  loops+=("${loop,,}")
+done
+[ ${#components[@]} -gt 0 ] || fail "no integration installed under $libdir/cmake/TarnMessaging"
+
+step "find_package route (components: ${components[*]})"
 cmake -S "$consumer" -B "$work/cmake-build" -DCMAKE_PREFIX_PATH="$prefix" -DCMAKE_BUILD_TYPE=Release \
-  -DCMAKE_FIND_PACKAGE_NO_PACKAGE_REGISTRY=ON > "$work/cmake.log" || fail "configuring the consumer (see $work/cmake.log)"
+  -DCMAKE_FIND_PACKAGE_NO_PACKAGE_REGISTRY=ON "-DTARN_COMPONENTS=$(IFS=';'; echo "${components[*]}")" \
+  -DTARN_LOOP_EXAMPLES="$source_dir/examples" > "$work/cmake.log" || fail "configuring the consumer (see $work/cmake.log)"
 cmake --build "$work/cmake-build" -j 2 >> "$work/cmake.log" || fail "building the consumer (see $work/cmake.log)"
 uses_prefix "$work/cmake-build/tarn-consumer"
 "$work/cmake-build/tarn-consumer" || fail "the find_package consumer"
+for loop in "${loops[@]}"; do
+  uses_prefix "$work/cmake-build/tarn-$loop-loop"
+  "$work/cmake-build/tarn-$loop-loop" > "$work/$loop-loop.log" || fail "the find_package $loop example (see $work/$loop-loop.log)"
+done
 
 step "pkg-config route"
 export PKG_CONFIG_PATH=$libdir/pkgconfig
@@ -59,4 +80,14 @@ LD_LIBRARY_PATH=$libdir "$work/consumer-env" || fail "the pkg-config consumer wi
   fail "building with pkg-config (C++20, rpath)"
 uses_prefix "$work/consumer-rpath"
 "$work/consumer-rpath" || fail "the pkg-config consumer with an rpath"
+for i in "${!loops[@]}"; do
+  loop=${loops[$i]}
+  pc=Tarn${components[$i]}
+  # -fPIC: Debian's Qt refuses code built without it.
+  # shellcheck disable=SC2046 # the flags are word lists
+  "$CXX" -std=c++17 -fPIC "$source_dir/examples/${loop}_loop.cpp" -o "$work/$loop-loop-pc" \
+    $(pkg-config --cflags --libs "$pc") -pthread -Wl,-rpath,"$libdir" || fail "building the $loop example with pkg-config ($pc)"
+  uses_prefix "$work/$loop-loop-pc"
+  "$work/$loop-loop-pc" > "$work/$loop-loop-pc.log" || fail "the pkg-config $loop example (see $work/$loop-loop-pc.log)"
+done
 step "both routes work"
