@@ -18,6 +18,7 @@
 #include <TarnMessaging/StationUtils.h>
 #include <TarnMessaging/Subscription.h>
 #include <TarnMessaging/Tracing.h>
+#include <TarnMessaging/TypedStation.h>
 
 /// @namespace Tarn
 /// The messaging library's public classes and functions: messages,

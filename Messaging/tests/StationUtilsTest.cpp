@@ -10,6 +10,7 @@ namespace {
 using namespace station_test;
 namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
+using messaging_test::PingMessage;
 using messaging_test::RecordingListener;
 
 class StationUtilsTest : public RegistryTest {};
@@ -72,6 +73,23 @@ TEST_F(StationUtilsTest, SwitchStationMovesTheListenerToTheNewestPlaceOfItsDesti
   EXPECT_EQ(Registry::FindStation(unregistered), nullptr);
   EXPECT_TRUE(DisposedAtOnce(from));
   EXPECT_TRUE(DisposedAtOnce(to));
+}
+
+// A typed station is its ID under another name: what goes through the handle
+// reaches listeners of the ID, and a worker's post through it is queued.
+TEST_F(StationUtilsTest, ATypedStationDeliversThroughItsIDEveryWayItIsCalled) {
+  const Tarn::TypedStation<NumberMessage, PingMessage> typed(RegisterCounted());
+  std::vector<int> heard;
+  Tarn::Registration numbers =
+      Tarn::Subscribe<NumberMessage>(typed, [&](const NumberMessage& inMessage) { heard.push_back(inMessage.mValue); });
+  Tarn::Registration pings = Tarn::Subscribe<PingMessage>(typed, [&](const PingMessage&) { heard.push_back(0); });
+  Utils::BroadcastMessage(typed, NumberMessage(1));
+  RunOnWorker([&] { Utils::PostMessageToUIThread(typed, NumberMessage(2), false); });
+  Utils::PostCoalescedMessageToUIThread(typed, NumberMessage(3));
+  Utils::PostMessageToUIThread(typed, PingMessage(), Tarn::PostCancelToken());
+  Utils::FlushPostedMessagesOnUIThread();
+  Utils::BroadcastMessage(typed.GetStationID(), NumberMessage(4));
+  EXPECT_EQ(heard, (std::vector<int>{1, 2, 3, 0, 4}));
 }
 
 }  // namespace

@@ -41,11 +41,27 @@
 #include <boost/function/function_fwd.hpp>
 
 #include <cstdint>
+#include <type_traits>
 
 namespace Tarn {
 
 /// The 32-bit ID of a message type: the hash of the type's decorated name.
 using MessageID = std::uint32_t;
+
+template <class T>
+class MessageImpl;
+
+/// Whether T is a message type: a class deriving from MessageImpl<T>, naming
+/// itself. A class that derives from another type's MessageImpl (or from
+/// another message type) carries that type's ID, so a typed entry point that
+/// took it would hand a listener the other type's objects cast to T. Every
+/// typed entry point (Message::Is and As, Subscribe, a TypedStation's calls)
+/// refuses such a T at compile time with TARN_MESSAGE_TYPE_REQUIRED.
+template <class T>
+struct IsMessageType : std::is_base_of<MessageImpl<T>, T> {};
+
+/// The text of that refusal.
+#define TARN_MESSAGE_TYPE_REQUIRED "T must be a message type that names itself: struct T : Tarn::MessageImpl<T>"
 
 /// The message ID of a type name: h = h * 5 + (signed char)byte over the
 /// bytes, from 0, wrapping modulo 2^32. inTypeName must not be null.
@@ -60,9 +76,12 @@ public:
   /// The ID of the message's type (MessageImpl<T>::StaticMessageID()).
   MessageID GetMessageID() const noexcept { return mMessageID; }
 
-  /// True when this message is a T (its ID is T's).
+  /// True when this message is a T (its ID is T's). T must be a message
+  /// type, `struct T : MessageImpl<T>`: a class deriving from another type's
+  /// MessageImpl shares that type's ID, so it is refused at compile time.
   template <class T>
   bool Is() const noexcept {
+    static_assert(IsMessageType<T>::value, TARN_MESSAGE_TYPE_REQUIRED);
     return mMessageID == T::StaticMessageID();
   }
   /// This message as a T, or null when it is of another type. A mismatch is

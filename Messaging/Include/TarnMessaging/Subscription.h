@@ -203,7 +203,7 @@ private:
 /// caller until it is handed to a Registration.
 template <class T, class Handler>
 OwnedListener* NewTypedListener(Handler&& inHandler) {
-  static_assert(std::is_base_of<Message, T>::value, "Subscribe<T>: T must be a message type (MessageImpl<T>)");
+  static_assert(IsMessageType<T>::value, TARN_MESSAGE_TYPE_REQUIRED);
   using Stored = std::decay_t<Handler>;
   static_assert(std::is_invocable<Stored&, const T&>::value, "Subscribe<T>: the handler must accept const T&");
   return new TypedListener<T, Stored>(std::forward<Handler>(inHandler));
