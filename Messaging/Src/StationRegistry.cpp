@@ -341,6 +341,16 @@ void DisposeStation(const ImmutableString& inStationID) {
   if (onMainThread) DeleteAll(pending, Sweep::kAll);
 }
 
+const char* ToString(StationState inState) noexcept {
+  switch (inState) {
+    case StationState::kNotMade: return "not made";
+    case StationState::kMade: return "made";
+    case StationState::kPendingDisposal: return "pending disposal";
+    case StationState::kPendingDeletion: return "pending deletion";
+  }
+  return "unknown";
+}
+
 StationSnapshotList Snapshot() {
   StationSnapshotList snapshot;
   RegistryLock lock("StationRegistry::Snapshot");

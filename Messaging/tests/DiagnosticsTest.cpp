@@ -122,17 +122,18 @@ TEST_F(RegistryTest, SnapshotShowsEveryStationsStateRetainsAndListeners) {
   const auto seen = [](const Registry::StationSnapshotList& inSnapshot, const ImmutableString& inID) {
     for (const Registry::StationSnapshot& station : inSnapshot)
       if (station.mStationID == inID)
-        return std::to_string(static_cast<int>(station.mState)) + "/" + std::to_string(station.mRetainCount) + "/" +
+        return Registry::ToString(station.mState) + std::string("/") + std::to_string(station.mRetainCount) + "/" +
                std::to_string(station.mListenerCount);
     return std::string("none");
   };
-  EXPECT_EQ(seen(Registry::Snapshot(), unmade), "0/0/0");  // not made
-  EXPECT_EQ(seen(Registry::Snapshot(), kept), "1/1/2");    // made
+  EXPECT_EQ(seen(Registry::Snapshot(), unmade), "not made/0/0");
+  EXPECT_EQ(seen(Registry::Snapshot(), kept), "made/1/2");
   Registry::DisposeStation(kept);
-  EXPECT_EQ(seen(Registry::Snapshot(), kept), "2/1/2");  // pending disposal
+  EXPECT_EQ(seen(Registry::Snapshot(), kept), "pending disposal/1/2");
   // Taken inside a broadcast on a station just disposed of: it waits, listed.
   Registry::FindStation(busy)->BroadcastMessage(messaging_test::PingMessage());
-  EXPECT_EQ(seen(inside, busy), "3/0/1");  // pending deletion
+  EXPECT_EQ(seen(inside, busy), "pending deletion/0/1");
+  EXPECT_STREQ(Registry::ToString(static_cast<Registry::StationState>(9)), "unknown");
   Utils::ReleaseStation(kept);
   const Registry::StationSnapshotList after = Registry::Snapshot();
   EXPECT_EQ(seen(after, kept) + seen(after, busy), "nonenone");

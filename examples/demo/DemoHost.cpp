@@ -288,23 +288,13 @@ void DemoApplication::CollectFigures(DemoSummary& ioSummary) {
 
 namespace {
 
-const char* StateName(Tarn::StationRegistry::StationState inState) {
-  switch (inState) {
-    case Tarn::StationRegistry::StationState::kNotMade: return "not made";
-    case Tarn::StationRegistry::StationState::kMade: return "made";
-    case Tarn::StationRegistry::StationState::kPendingDisposal: return "pending disposal";
-    case Tarn::StationRegistry::StationState::kPendingDeletion: return "pending deletion";
-  }
-  return "?";
-}
-
 // The registry as it stands, one station a line.
 void DumpStations(std::FILE* inStream) {
   const Tarn::StationRegistry::StationSnapshotList stations = Tarn::StationRegistry::Snapshot();
   std::fprintf(inStream, "Stations at the end of the run: %zu\n", stations.size());
   std::fprintf(inStream, "  %-40s %-17s %8s %10s\n", "station", "state", "retains", "listeners");
   for (const Tarn::StationRegistry::StationSnapshot& station : stations) {
-    std::fprintf(inStream, "  %-40s %-17s %8u %10zu\n", station.mStationID.c_str(), StateName(station.mState),
+    std::fprintf(inStream, "  %-40s %-17s %8u %10zu\n", station.mStationID.c_str(), Tarn::StationRegistry::ToString(station.mState),
                  static_cast<unsigned>(station.mRetainCount), station.mListenerCount);
   }
 }

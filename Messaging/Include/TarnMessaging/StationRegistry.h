@@ -89,6 +89,10 @@ enum class StationState {
                      ///< or, if queued off the main thread, by the next main-thread disposal
 };
 
+/// The state's name for printing: "not made", "made", "pending disposal",
+/// "pending deletion"; "unknown" for a value outside the enum.
+TARN_MESSAGING_API const char* ToString(StationState inState) noexcept;
+
 /// One station as Snapshot saw it.
 struct StationSnapshot {
   kivcore::utility::ImmutableString mStationID;  ///< its ID
