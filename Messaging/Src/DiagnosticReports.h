@@ -25,7 +25,9 @@ enum class Failure {
   kBroadcastOffMainThread,
   kUnregisteredStation,
   kRetainedAtTerminate,
-  kListenersAtTerminate
+  kListenersAtTerminate,
+  kInitializeOffMainThread,  // inCount: the Initialize count it raised to
+  kQueuedAtExit              // inCount: the calls still queued
 };
 
 extern std::atomic<bool> sReportsOn;

@@ -115,6 +115,19 @@ std::string ReportKey(Failure inFailure, const char* inOperation, const kivcore:
              std::to_string(inDetail) +
              ": they hear nothing more. Remove listeners (or end their subscriptions) before the last Terminate.";
       break;
+    case Failure::kInitializeOffMainThread:
+      key += "InitializeOffMainThread=" + operation + " on a thread that is not the main thread only counted (" +
+             std::to_string(inCount) +
+             " now): the main thread is still the one that made the first Initialize, and broadcasts from this "
+             "thread deliver nothing. Post to the main thread instead, or make the first Initialize on the thread "
+             "that runs your event loop.";
+      break;
+    case Failure::kQueuedAtExit:
+      key += "QueuedAtExit=" + operation + " was not made before the process exited: " + std::to_string(inCount) +
+             " posted call(s) were still queued and were never delivered. Run the main thread's pending calls "
+             "(or an event-loop integration) until the work is done, then call Tarn::Messaging::Terminate once "
+             "for every Initialize.";
+      break;
   }
   return key;
 }

@@ -21,6 +21,22 @@ kivcore::threads::RecursiveMutex sMessagingMutex;
 std::int32_t sInitializeCount = 0;  // guarded by sMessagingMutex
 boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> sMainThreadAdaptor;  // guarded by sMessagingMutex
 
+// At exit, a library still initialized with calls queued tells the host
+// that they were never delivered: a forgotten Terminate (or a loop that
+// stopped too soon) otherwise shows no sign at all. Defined after the
+// adaptor, so it runs before the adaptor is destroyed.
+struct ExitCheck {
+  ~ExitCheck() {
+    if (sInitializeCount == 0 || !sMainThreadAdaptor || !Diagnostics::Detail::ReportsOn()) return;
+    const std::size_t queued = sMainThreadAdaptor->PendingCallCount();
+    if (queued == 0) return;
+    // The check's own address stands in for a call site: Terminate was never
+    // called, so there is none.
+    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kQueuedAtExit, this,
+                                             "Tarn::Messaging::Terminate", kNoStation, queued);
+  }
+} sExitCheck;
+
 class MessagingLock {
 public:
   MessagingLock() { sMessagingMutex.Lock(nullptr); }
@@ -44,17 +60,27 @@ const kivcore::config::InitializerRegistrar sRegistrar(
 namespace Messaging {
 
 void Initialize() {
-  MessagingLock lock;
-  if (sInitializeCount == 0) {
-    sMainThreadAdaptor = kivcore::threads::RegisterCurrentThreadAsMainThread();
-    for (const kivcore::utility::ImmutableString* stationID :
-         {&kStation_Idle, &kStation_Repeat, &kStation_AppSuspend, &kStation_AppResume, &kStation_AboutDialog,
-          &kStation_DirectoryChange, &kStation_PanicSave, &kStation_StatusBar, &kStation_ColorPicker,
-          &kStation_LocateClip}) {
-      StationRegistry::RegisterStation(*stationID, nullptr);
+  std::size_t countedOffMainThread = 0;
+  {
+    MessagingLock lock;
+    if (sInitializeCount == 0) {
+      sMainThreadAdaptor = kivcore::threads::RegisterCurrentThreadAsMainThread();
+      for (const kivcore::utility::ImmutableString* stationID :
+           {&kStation_Idle, &kStation_Repeat, &kStation_AppSuspend, &kStation_AppResume, &kStation_AboutDialog,
+            &kStation_DirectoryChange, &kStation_PanicSave, &kStation_StatusBar, &kStation_ColorPicker,
+            &kStation_LocateClip}) {
+        StationRegistry::RegisterStation(*stationID, nullptr);
+      }
+    } else if (!kivcore::threads::CurrentThreadIsMainThread()) {
+      countedOffMainThread = static_cast<std::size_t>(sInitializeCount) + 1;
     }
+    ++sInitializeCount;
   }
-  ++sInitializeCount;
+  // Reported once the lock is let go, since the host's error handler runs.
+  if (countedOffMainThread != 0) {
+    Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kInitializeOffMainThread, TARN_CALL_SITE(),
+                                             "Tarn::Messaging::Initialize", kNoStation, countedOffMainThread);
+  }
 }
 
 void Terminate() {

@@ -201,12 +201,19 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
   EXPECT_EQ(errors.Count(), 7u);
   Tarn::Diagnostics::SetSilentFailureReports(SilentFailureReports::kOn);
 
+  // A worker's Initialize only counts; the main thread stays where it was.
+  station_test::RunOnWorker([] { Tarn::Messaging::Initialize(); });
+  EXPECT_TRUE(HasKey(errors.Reports(), 7, "InitializeOffMainThread", "only counted (2 now)"));
+  Tarn::Messaging::Terminate();
+  Utils::BroadcastMessage(station, messaging_test::PingMessage());
+  EXPECT_EQ(listener.Calls(), 1);
+
   Utils::RetainStation(station);
   Tarn::Messaging::Terminate();
-  EXPECT_TRUE(HasKey(errors.Reports(), 7, "RetainedAtTerminate",
+  EXPECT_TRUE(HasKey(errors.Reports(), 8, "RetainedAtTerminate",
                      "1 station(s) still retained, the first \"" + std::string(station.c_str()) + "\" 1 time(s)"));
-  EXPECT_TRUE(HasKey(errors.Reports(), 8, "ListenersAtTerminate", "1 station(s) with listeners still attached"));
-  EXPECT_EQ(errors.Count(), 9u);
+  EXPECT_TRUE(HasKey(errors.Reports(), 9, "ListenersAtTerminate", "1 station(s) with listeners still attached"));
+  EXPECT_EQ(errors.Count(), 10u);
 }
 
 }  // namespace

@@ -99,7 +99,7 @@ TEST(MessagingLifecycleTest, TerminateGivesBackEverySmallBlock) {
 // in the registry's pending list until exit, and goes while the registry is
 // still alive, without a diagnostic. A lookup made after the registry's own
 // static destruction finds nothing and says why, instead of reading the
-// destroyed map.
+// destroyed map. A forgotten Terminate with a post still queued is reported.
 TEST(StaticDestructionTest, StationsAtExitGoWhileTheRegistryLivesAndLateLookupsFindNothing) {
   auto run = [](const char* inMode, std::string& outOutput) {
     FILE* const probe = ::popen((std::string("\"") + TARN_STATIC_DESTRUCTION_PROBE + "\" " + inMode + " 2>&1").c_str(), "r");
@@ -108,8 +108,13 @@ TEST(StaticDestructionTest, StationsAtExitGoWhileTheRegistryLivesAndLateLookupsF
     while (std::fgets(buffer, sizeof buffer, probe) != nullptr) outOutput += buffer;
     return ::pclose(probe);
   };
-  std::string queued, late;
-  int status = run("queued", queued);
+  std::string queued, late, unterminated;
+  int status = run("unterminated", unterminated);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  EXPECT_NE(unterminated.find("Tarn::Messaging::Terminate was not made before the process exited: 1 "),
+            std::string::npos)
+      << unterminated;
+  status = run("queued", queued);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
   EXPECT_EQ(queued, "queued station deleted\n");
   status = run("late", late);

@@ -3,7 +3,9 @@
 // outside. Mode "queued" disposes of a station while no main thread is
 // registered, so that it waits in the registry's pending list until exit; it
 // must be deleted while the registry is still alive, silently, and says so on
-// standard output. Mode "late" is described below.
+// standard output. Mode "unterminated" exits with a post still queued and
+// the library still initialized, which must be reported at exit. Mode "late"
+// is described below.
 //
 // Exit status 0 when the mode ran, 1 for an unknown mode, 2 when the
 // registry did not behave as the mode needs.
@@ -56,6 +58,12 @@ int main(int argc, char** argv) {
     // No main thread is registered, so the disposal only queues the station.
     Tarn::StationRegistry::DisposeStation(id);
     if (Tarn::StationRegistry::FindStation(id) != nullptr) return 2;
+    return 0;
+  }
+  if (std::strcmp(argv[1], "unterminated") == 0) {
+    Tarn::Messaging::Initialize();
+    Tarn::Diagnostics::SetSilentFailureReports(Tarn::Diagnostics::SilentFailureReports::kOn);
+    Tarn::StationUtils::PostMessageToUIThread(Tarn::kStation_StatusBar, Tarn::ApplicationIdleMessage(), true);
     return 0;
   }
   if (std::strcmp(argv[1], "late") == 0) {

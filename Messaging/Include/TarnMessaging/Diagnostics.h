@@ -15,7 +15,14 @@
 ///   (".../BeforeInitialize");
 /// - stations still retained, or with listeners still attached, when the
 ///   last Terminate deletes them (".../RetainedAtTerminate",
-///   ".../ListenersAtTerminate").
+///   ".../ListenersAtTerminate");
+/// - Tarn::Messaging::Initialize called again on another thread than the main
+///   thread, which only counts and does not make that thread the main
+///   thread (".../InitializeOffMainThread");
+/// - a process that exits with the library still initialized and posted calls
+///   still queued, which are never delivered: a forgotten Terminate, or a
+///   loop that stopped too soon (".../QueuedAtExit", made during the
+///   process's static destruction with no call site of the host's).
 ///
 /// @code{.cpp}
 ///   Tarn::Diagnostics::SetSilentFailureReports(Tarn::Diagnostics::SilentFailureReports::kOn);
