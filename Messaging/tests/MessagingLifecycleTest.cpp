@@ -1,5 +1,6 @@
 // Bringing the library down from inside a broadcast, and the station
 // registry at process exit.
+#include "DiagnosticsTestSupport.h"
 #include "StationTestSupport.h"
 
 #include <kivcore/InitializerRegistry.h>
@@ -68,6 +69,67 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   Utils::BroadcastMessage(Tarn::kStation_Idle, NumberMessage(2));
   Registry::DisposeStation(Tarn::kStation_Idle);
   EXPECT_EQ(Registry::FindStation(Tarn::kStation_Idle), nullptr) << "the new station is held by a retain it never had";
+  Tarn::Messaging::Terminate();
+}
+
+// A station that a running call holds outlives the last Terminate made on
+// another thread meanwhile, and goes as the call lets it go: a worker's call
+// while the main thread terminates and initializes again; a main-thread
+// broadcast by ID while a worker terminates before the broadcast has begun.
+// Terminate also keeps the room it made for the stations it retires while
+// the host's error handler, reporting leftovers, uses up the spare room.
+TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCall) {
+  messaging_test::Watchdog watchdog;
+  Tarn::Messaging::Initialize();
+  messaging_test::Latch inCall, restarted;
+  const messaging_test::ErrorRecorder contractErrors;
+  const auto previous = kivcore::debug::SetContractDialogHandler([&](const char*, const char*, const char*, int) {
+    inCall.CountDown();
+    EXPECT_TRUE(restarted.WaitFor());
+    return false;
+  });
+  messaging_test::ThreadGroup worker;
+  worker.Start([] { Utils::AddListener(Tarn::kStation_StatusBar, std::weak_ptr<Tarn::Listener>()); });
+  EXPECT_TRUE(inCall.WaitFor());
+  Tarn::Messaging::Terminate();
+  Tarn::Messaging::Initialize();
+  restarted.CountDown();
+  worker.JoinAll();
+  kivcore::debug::SetContractDialogHandler(previous);
+
+  struct SlowStation : CountedStation {
+    using CountedStation::CountedStation;
+    void BroadcastMessage(const Tarn::Message& inMessage) override {
+      RunOnWorker([] { Registry::Terminate(); });
+      CountedStation::BroadcastMessage(inMessage);
+    }
+  };
+  StationLog::Reset();
+  const ImmutableString slow = Registry::UniqueStationID();
+  Registry::RegisterStation(slow, [](const ImmutableString& inID) -> Tarn::Station* { return new SlowStation(inID); });
+  RecordingListener heard("heard");
+  Utils::AddListener(slow, &heard);
+  Utils::BroadcastMessage(slow, NumberMessage(1));
+  EXPECT_EQ(heard.Calls(), 1);
+  EXPECT_EQ(StationLog::Destructions(), 1) << "the station outlived the call that held it";
+
+  const messaging_test::SilentFailureReportsSetting reports(Tarn::Diagnostics::SilentFailureReports::kOn);
+  const auto handler = kivcore::config::SetErrorHandler([](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.find("ListenersAtTerminate") == std::string::npos) return;
+    Registry::DisposeStation(Registry::RegisterUniqueStation());  // the pending list gives back its spare room
+    kivcore::utility::SmallBlockAllocator::SetFailAfter(0);
+  });
+  const ImmutableString busy = Registry::UniqueStationID();
+  Registry::RegisterStation(busy, &CountingFactory);
+  RecordingListener quit("quit");
+  quit.SetAction([&](const Tarn::Message&) {
+    const messaging_test::SmallBlockFailureGuard restore(-1);  // to never again, however Terminate ends
+    Registry::Terminate();
+  });
+  Utils::AddListener(busy, &quit);
+  Utils::BroadcastMessage(busy, NumberMessage(2));
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(StationLog::Destructions(), 2) << "the station Terminate retired was lost";
   Tarn::Messaging::Terminate();
 }
 
