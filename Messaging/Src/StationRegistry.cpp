@@ -123,18 +123,29 @@ enum class Sweep {
   kEverything // at static destruction: every station, busy or not
 };
 
+// Deletes a station the registry no longer reaches, letting the registry's
+// lock go (one level of it) meanwhile: the station's detach may wait for a
+// delivery to it on another thread (the main thread may have moved), and
+// that delivery's end looks for retired stations under the lock. The lock
+// must be held.
+void DeleteUnlocked(Station* inStation) noexcept {
+  sStationRegistryMutex.Unlock();
+  StationRetirement::Delete(inStation);
+  sStationRegistryMutex.Lock(nullptr);
+}
+
 // Deletes the stations of the list that Sweep names and no broadcast holds,
 // in the order they were queued; a busy one stays, retired, for the end of
-// that broadcast. The registry's lock must be held. A station destructor may
-// dispose of another station and re-enter here: each call claims the
-// stations it will delete before deleting any, and a nested call deletes
-// only stations queued after that, so none is deleted twice and none is lost.
+// that broadcast. The registry's lock must be held; it is let go while each
+// station is deleted. A station destructor may dispose of another station
+// and re-enter here, and another thread may sweep meanwhile: each call
+// claims the stations it will delete, under a number no running call has,
+// before deleting any, and deletes only its own claims, so none is deleted
+// twice and none is lost.
 void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
-  static std::uint32_t sSweepDepth = 0;  // guarded by the registry's lock
-  const std::uint32_t sweep = ++sSweepDepth;
-  struct Leave {
-    ~Leave() { --sSweepDepth; }
-  } leave;
+  static std::uint32_t sLastSweep = 0;  // guarded by the registry's lock
+  if (++sLastSweep == 0) ++sLastSweep;  // 0 means unclaimed
+  const std::uint32_t sweep = sLastSweep;
   for (PendingStation& pending : ioList) {
     if (pending.mClaim != 0 || (inSweep != Sweep::kEverything && pending.mCallHolds != 0)) continue;
     if (inSweep != Sweep::kEverything && StationRetirement::IsBroadcasting(*pending.mStation)) {
@@ -148,7 +159,7 @@ void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
     if (doomed == ioList.end()) break;
     Station* const station = doomed->mStation;
     ioList.erase(doomed);
-    StationRetirement::Delete(station);
+    DeleteUnlocked(station);
   }
   sHasRetired.store(std::any_of(ioList.begin(), ioList.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
   // An empty list keeps no storage, so that a drained registry holds no
@@ -365,7 +376,7 @@ void DisposeStation(const ImmutableString& inStationID) {
   record.mStation = nullptr;
   map->erase(found);
   if (deleteNow) {
-    StationRetirement::Delete(station);
+    DeleteUnlocked(station);
   } else if (station != nullptr && onMainThread) {
     Retire(station);
   } else if (station != nullptr) {

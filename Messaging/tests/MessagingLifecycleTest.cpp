@@ -3,6 +3,8 @@
 #include "DiagnosticsTestSupport.h"
 #include "StationTestSupport.h"
 
+#include <TarnMessaging/Tracing.h>
+
 #include <kivcore/InitializerRegistry.h>
 #include <kivcore/SmallBlockAllocator.h>
 
@@ -131,6 +133,59 @@ TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCa
   kivcore::config::SetErrorHandler(handler);
   EXPECT_EQ(StationLog::Destructions(), 2) << "the station Terminate retired was lost";
   Tarn::Messaging::Terminate();
+}
+
+// A handler's Terminate retires the station it hears from; the main thread
+// then moves, and the new one is about to relay through that station (a
+// listener of a broadcaster) when the old broadcast ends and deletes it. The
+// deletion waits for the relay, which ends by looking for retired stations:
+// a deletion made under the registry's lock waited for ever.
+TEST(MessagingLifecycleTest, AStationDeletedAfterTheMainThreadMovedWaitsWithoutTheRegistryLock) {
+  messaging_test::Watchdog watchdog;
+  Tarn::Messaging::Initialize();
+  const ImmutableString id = Registry::RegisterUniqueStation();
+  Tarn::Station* const station = Registry::FindStation(id);
+  Tarn::Broadcaster broadcaster;
+  broadcaster.AddListener(station);
+  messaging_test::Latch aboutToRelay, deleting;
+  struct Gate : Tarn::Tracing::DeliveryTracer {
+    Gate(const void* inStation, messaging_test::Latch& ioReached, messaging_test::Latch& ioGo)
+        : mStation(inStation), mReached(ioReached), mGo(ioGo) {}
+    void DeliveryBegins(const Tarn::Tracing::Delivery& inDelivery) override {
+      if (inDelivery.mListener != mStation) return;
+      mReached.CountDown();
+      EXPECT_TRUE(mGo.WaitFor());
+    }
+    void DeliveryEnded(const Tarn::Tracing::Delivery&, std::chrono::nanoseconds) override {}
+    const void* mStation;
+    messaging_test::Latch& mReached;
+    messaging_test::Latch& mGo;
+  } gate(static_cast<Tarn::Listener*>(station), aboutToRelay, deleting);
+  const auto handler = kivcore::config::SetErrorHandler([&](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.rfind(Tarn::Tracing::kRemovalWaitKey, 0) == 0) deleting.CountDown();
+  });
+  const auto threshold = Tarn::Tracing::SetRemovalWaitReport(std::chrono::milliseconds(1));
+  Tarn::Tracing::SetDeliveryTracer(&gate);
+  RecordingListener quit("quit");
+  messaging_test::ThreadGroup mover;
+  quit.SetAction([&](const Tarn::Message&) {
+    if (quit.Calls() != 1) return;
+    Tarn::Messaging::Terminate();
+    mover.Start([&] {
+      Tarn::Messaging::Initialize();
+      broadcaster.BroadcastMessage(NumberMessage(2));
+      Tarn::Messaging::Terminate();
+    });
+    EXPECT_TRUE(aboutToRelay.WaitFor());
+  });
+  station->AddListener(&quit);
+  station->BroadcastMessage(NumberMessage(1));
+  mover.JoinAll();
+  Tarn::Tracing::SetDeliveryTracer(nullptr);
+  Tarn::Tracing::SetRemovalWaitReport(threshold);
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(quit.Calls(), 2);
+  EXPECT_FALSE(broadcaster.HasListeners());
 }
 
 // A host that brings its libraries up through the initializer registry
