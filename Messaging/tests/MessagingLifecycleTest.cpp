@@ -1,6 +1,9 @@
 // Bringing the library down from inside a broadcast, and the station
 // registry at process exit.
+#include "DiagnosticsTestSupport.h"
 #include "StationTestSupport.h"
+
+#include <TarnMessaging/Tracing.h>
 
 #include <kivcore/InitializerRegistry.h>
 #include <kivcore/SmallBlockAllocator.h>
@@ -22,26 +25,62 @@ namespace Utils = Tarn::StationUtils;
 using messaging_test::CallLog;
 using messaging_test::RecordingListener;
 
-// A "quit" listener ends the library while the station it hears from is
-// broadcasting: the station once went at once (use after free), and a later
+// A "quit" subscription ends the library while the station it hears from is
+// broadcasting: the station once went at once (use after free), a later
 // handler removing itself, its thread no longer the main thread, waited for
-// its own delivery for ever.
+// its own delivery for ever, and the quit handler, resetting its own
+// subscription, was freed under itself. Another thread then becomes the main
+// thread and is about to relay through the station (a listener of a
+// broadcaster) as the broadcast ends and deletes it: the deletion waits for
+// the relay, whose end looks for retired stations; made under the
+// registry's lock, it waited for ever.
 TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLibraryComeBack) {
   messaging_test::Watchdog watchdog;
   StationLog::Reset();
   Tarn::Messaging::Initialize();
+  static messaging_test::Latch sAboutToRelay, sDeleting;
+  struct GatedStation : CountedStation {
+    using CountedStation::CountedStation;
+    void ListenToMessage(const Tarn::Message& inMessage) override {
+      sAboutToRelay.CountDown();
+      EXPECT_TRUE(sDeleting.WaitFor());
+      CountedStation::ListenToMessage(inMessage);
+    }
+  };
   const ImmutableString id = Registry::UniqueStationID();
-  Registry::RegisterStation(id, &CountingFactory);
+  Registry::RegisterStation(id, [](const ImmutableString& inID) -> Tarn::Station* { return new GatedStation(inID); });
+  Tarn::Station* const station = Registry::FindStation(id);
+  Tarn::Broadcaster broadcaster;
+  broadcaster.AddListener(station);
+  const auto handler = kivcore::config::SetErrorHandler([](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.rfind(Tarn::Tracing::kRemovalWaitKey, 0) == 0) sDeleting.CountDown();
+  });
+  const auto threshold = Tarn::Tracing::SetRemovalWaitReport(std::chrono::milliseconds(1));
   CallLog log;
-  RecordingListener oldest("oldest", &log), leaving("leaving", &log), quit("quit", &log);
-  quit.SetAction([&](const Tarn::Message&) { Tarn::Messaging::Terminate(); });
-  leaving.SetAction([&](const Tarn::Message&) { Utils::RemoveListener(id, &leaving); });
+  RecordingListener oldest("oldest", &log), leaving("leaving", &log);
+  leaving.SetAction([&](const Tarn::Message&) { station->RemoveListener(&leaving, true); });
   oldest.SetAction([&](const Tarn::Message&) {
     EXPECT_EQ(StationLog::Destructions(), 0) << "the station went under its own broadcast";
   });
-  for (RecordingListener* listener : {&oldest, &leaving, &quit}) Utils::AddListener(id, listener);
-  Utils::BroadcastMessage(id, NumberMessage(1));
-  EXPECT_EQ(log.Entries(), (std::vector<std::string>{"quit:1", "leaving:1", "oldest:1"}));
+  for (RecordingListener* listener : {&oldest, &leaving}) Utils::AddListener(id, listener);
+  messaging_test::ThreadGroup mover;
+  Tarn::Registration quit;
+  quit = Tarn::Subscribe<NumberMessage>(id, [&, name = std::string("quit")](const NumberMessage& inMessage) {
+    Tarn::Messaging::Terminate();
+    quit.Reset();
+    log.Record(name + ":" + std::to_string(inMessage.mValue));
+    mover.Start([&] {
+      Tarn::Messaging::Initialize();
+      broadcaster.BroadcastMessage(NumberMessage(2));
+      Tarn::Messaging::Terminate();
+    });
+    EXPECT_TRUE(sAboutToRelay.WaitFor());
+  });
+  station->BroadcastMessage(NumberMessage(1));
+  mover.JoinAll();
+  Tarn::Tracing::SetRemovalWaitReport(threshold);
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(log.Entries(), (std::vector<std::string>{"quit:1", "leaving:1", "oldest:1", "oldest:2"}));
   EXPECT_EQ(StationLog::Destructions(), 1) << "the station outlived its broadcast";
   EXPECT_FALSE(kivcore::threads::CurrentThreadIsMainThread());
 
@@ -64,11 +103,49 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   Tarn::Messaging::Terminate();
 }
 
-// A host that brings its libraries up through the initializer registry
-// brings this one up and down with them.
-TEST(MessagingLifecycleTest, TheInitializerRegistryBringsTheLibraryUpAndDown) {
+// A station that a running call holds outlives the last Terminate made on
+// another thread meanwhile, and goes as the call lets it go: here a
+// main-thread broadcast by ID while a worker terminates before the broadcast
+// has begun (a worker's call while the main thread terminates once freed the
+// station the same way). Terminate also keeps the room it made for the
+// stations it retires while the host's error handler, reporting leftovers,
+// uses up the spare room. The library comes up and goes down with the host's
+// initializer registry.
+TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCall) {
+  StationLog::Reset();
   ASSERT_TRUE(kivcore::config::InitializerRegistry::InitializeAll(kivcore::proplist::PropList()));
-  EXPECT_TRUE(kivcore::threads::CurrentThreadIsMainThread());
+  struct SlowStation : CountedStation {
+    using CountedStation::CountedStation;
+    void BroadcastMessage(const Tarn::Message& inMessage) override {
+      RunOnWorker([] { Registry::Terminate(); });
+      CountedStation::BroadcastMessage(inMessage);
+    }
+  };
+  const ImmutableString slow = Registry::UniqueStationID();
+  Registry::RegisterStation(slow, [](const ImmutableString& inID) -> Tarn::Station* { return new SlowStation(inID); });
+  RecordingListener heard("heard");
+  Utils::AddListener(slow, &heard);
+  Utils::BroadcastMessage(slow, NumberMessage(1));
+  EXPECT_EQ(heard.Calls(), 1);
+  EXPECT_EQ(StationLog::Destructions(), 1) << "the station outlived the call that held it";
+
+  const messaging_test::SilentFailureReportsSetting reports(Tarn::Diagnostics::SilentFailureReports::kOn);
+  const auto handler = kivcore::config::SetErrorHandler([](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.find("ListenersAtTerminate") == std::string::npos) return;
+    Registry::DisposeStation(Registry::RegisterUniqueStation());  // the pending list gives back its spare room
+    kivcore::utility::SmallBlockAllocator::SetFailAfter(0);
+  });
+  const ImmutableString busy = Registry::UniqueStationID();
+  Registry::RegisterStation(busy, &CountingFactory);
+  RecordingListener quit("quit");
+  quit.SetAction([&](const Tarn::Message&) {
+    const messaging_test::SmallBlockFailureGuard restore(-1);  // to never again, however Terminate ends
+    Registry::Terminate();
+  });
+  Utils::AddListener(busy, &quit);
+  Utils::BroadcastMessage(busy, NumberMessage(2));
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(StationLog::Destructions(), 2) << "the station Terminate retired was lost";
   kivcore::config::InitializerRegistry::TerminateAll();
   EXPECT_FALSE(kivcore::threads::CurrentThreadIsMainThread());
 }
