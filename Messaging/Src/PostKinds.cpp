@@ -274,11 +274,45 @@ namespace {
 struct IdlePosts {
   std::mutex mMutex;
   std::vector<PostedCall> mWaiting;  // in the order posted; guarded by mMutex
+  // The posts a run that threw did not reach, from mPutBackNext on: they
+  // come before mWaiting. Guarded by mMutex.
+  std::vector<PostedCall> mPutBack;
+  std::size_t mPutBackNext = 0;
 };
 
 IdlePosts& Idle() {
   static IdlePosts* posts = new IdlePosts;
   return *posts;
+}
+
+// The posts one RunIdlePosts took, and how far it got. The vector stays in
+// place while the run lives: a nested run only advances mNext.
+struct IdleRun {
+  std::vector<PostedCall> mPosts;
+  std::size_t mNext = 0;
+  bool mStopped = false;  // a post threw: the rest waits for the next idle broadcast
+};
+
+// The innermost idle run on this thread (the main thread). An idle broadcast
+// from a handler of one of its posts finishes it first: its posts were made
+// before any the nested broadcast could take.
+thread_local IdleRun* tIdleRun = nullptr;
+
+void RunRest(IdleRun& ioRun) {
+  ioRun.mStopped = false;
+  std::size_t running = 0;
+  try {
+    while (!ioRun.mStopped && ioRun.mNext < ioRun.mPosts.size()) {
+      running = ioRun.mNext++;
+      ioRun.mPosts[running]();
+      ioRun.mPosts[running].clear();
+    }
+  } catch (...) {
+    // The copy's destructor is the host's code: not under our lock later.
+    ioRun.mPosts[running].clear();
+    ioRun.mStopped = true;
+    throw;
+  }
 }
 
 }  // namespace
@@ -293,34 +327,56 @@ void StationUtils::PostMessageAtIdleTime(const ImmutableString& inStationID, con
 
 void Detail::RunIdlePosts() {
   IdlePosts& posts = Idle();
-  std::vector<PostedCall> batch;
+  if (tIdleRun != nullptr) RunRest(*tIdleRun);
+  IdleRun run;
   {
     std::lock_guard<std::mutex> lock(posts.mMutex);
-    batch.swap(posts.mWaiting);
+    if (posts.mPutBackNext < posts.mPutBack.size()) {
+      // Posts put back come first. When the newer ones cannot join them for
+      // want of storage, this throws with both as they were (the delivered
+      // posts dropped first hold nothing).
+      if (!posts.mWaiting.empty()) {
+        posts.mPutBack.erase(posts.mPutBack.begin(), posts.mPutBack.begin() + static_cast<std::ptrdiff_t>(posts.mPutBackNext));
+        posts.mPutBackNext = 0;
+        posts.mPutBack.insert(posts.mPutBack.end(), std::make_move_iterator(posts.mWaiting.begin()),
+                              std::make_move_iterator(posts.mWaiting.end()));
+        posts.mWaiting.clear();
+      }
+      run.mPosts.swap(posts.mPutBack);
+      run.mNext = std::exchange(posts.mPutBackNext, 0);
+    } else {
+      run.mPosts.swap(posts.mWaiting);
+    }
     sIdlePostsWaiting.store(false, std::memory_order_relaxed);
   }
-  std::size_t next = 0;
-  try {
-    while (next < batch.size()) {
-      PostedCall& call = batch[next++];
-      call();
-      call.clear();
+  // When a post threw, hands the rest back whole, allocating nothing: no run
+  // took posts since this one did, since a nested run first finishes this
+  // one's posts and takes nothing when they throw.
+  struct Finish {
+    IdlePosts& mIdle;
+    IdleRun& mRun;
+    IdleRun* mOuter;
+    ~Finish() {
+      tIdleRun = mOuter;
+      if (!mRun.mStopped || mRun.mNext == mRun.mPosts.size()) return;
+      std::lock_guard<std::mutex> lock(mIdle.mMutex);
+      mIdle.mPutBack.swap(mRun.mPosts);
+      mIdle.mPutBackNext = mRun.mNext;
+      sIdlePostsWaiting.store(true, std::memory_order_relaxed);
     }
-  } catch (...) {
-    // They were posted before anything that waits now.
-    std::lock_guard<std::mutex> lock(posts.mMutex);
-    posts.mWaiting.insert(posts.mWaiting.begin(), std::make_move_iterator(batch.begin() + static_cast<std::ptrdiff_t>(next)),
-                          std::make_move_iterator(batch.end()));
-    if (!posts.mWaiting.empty()) sIdlePostsWaiting.store(true, std::memory_order_relaxed);
-    throw;
-  }
+  } finish{posts, run, tIdleRun};
+  tIdleRun = &run;
+  RunRest(run);
 }
 
 void Detail::DropIdlePosts() noexcept {
   IdlePosts& posts = Idle();
   std::vector<PostedCall> dropped;
+  std::vector<PostedCall> putBack;
   std::lock_guard<std::mutex> lock(posts.mMutex);
   dropped.swap(posts.mWaiting);
+  putBack.swap(posts.mPutBack);
+  posts.mPutBackNext = 0;
   sIdlePostsWaiting.store(false, std::memory_order_relaxed);
 }
 

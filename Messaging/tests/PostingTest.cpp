@@ -20,6 +20,7 @@
 #include <new>
 #include <stdexcept>
 #include <thread>
+#include <utility>
 
 namespace {
 // Allocations left before the heap fails; negative: never fails.
@@ -174,6 +175,22 @@ TEST(PostingTest, ACallThatThrowsWithStorageOutLeavesThePostsBehindItQueued) {
   Tarn::StationUtils::PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(1));
   FlushPostedMessagesOnUIThread();
   EXPECT_EQ(listener.Calls(), 1001) << "the coalesced key stayed blocked";
+  // Idle-time posts behind one whose station's factory throws: the same.
+  const kivcore::utility::ImmutableString failing = Tarn::StationRegistry::UniqueStationID();
+  Tarn::StationRegistry::RegisterStation(failing, [](const kivcore::utility::ImmutableString& inID) -> Tarn::Station* {
+    static bool sFailed = false;
+    if (std::exchange(sFailed, true)) return new Tarn::Station(inID);
+    const std::runtime_error error("factory");
+    gHeapAllocationsLeft.store(0);
+    throw error;
+  });
+  for (const auto& station : {failing, Tarn::kStation_StatusBar})
+    Tarn::StationUtils::PostMessageAtIdleTime(station, NumberMessage(1001));
+  EXPECT_THROW(Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, PingMessage()), std::runtime_error);
+  gHeapAllocationsLeft.store(-1);
+  Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, PingMessage());
+  EXPECT_EQ(log.Entries().back(), "l:1001");
+  Tarn::StationRegistry::DisposeStation(failing);
   Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
   Tarn::Messaging::Terminate();
 }
