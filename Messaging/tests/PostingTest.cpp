@@ -16,19 +16,28 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdlib>
+#include <functional>
 #include <new>
 #include <stdexcept>
 #include <thread>
 #include <utility>
 
 namespace {
-// Allocations left before the heap fails; negative: never fails.
+// Allocations left before the heap fails, on every thread or on this one
+// alone; negative: never fails. A thread's failure first runs its hook.
 std::atomic<long long> gHeapAllocationsLeft{-1};
+thread_local long long tHeapAllocationsLeft = -1;
+thread_local std::function<void()>* tBeforeFailing = nullptr;
 
 void* Allocate(std::size_t inSize) {
   if (gHeapAllocationsLeft.load(std::memory_order_relaxed) >= 0 && gHeapAllocationsLeft.fetch_sub(1) <= 0)
     throw std::bad_alloc();
+  if (tHeapAllocationsLeft >= 0 && tHeapAllocationsLeft-- == 0) {
+    if (std::function<void()>* const hook = std::exchange(tBeforeFailing, nullptr)) (*hook)();
+    throw std::bad_alloc();
+  }
   if (void* block = std::malloc(inSize == 0 ? 1 : inSize)) return block;
   throw std::bad_alloc();
 }
@@ -191,6 +200,53 @@ TEST(PostingTest, ACallThatThrowsWithStorageOutLeavesThePostsBehindItQueued) {
   Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, PingMessage());
   EXPECT_EQ(log.Entries().back(), "l:1001");
   Tarn::StationRegistry::DisposeStation(failing);
+  Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
+  Tarn::Messaging::Terminate();
+}
+
+// Worker A's coalesced post fails to queue its call while worker B posts
+// with the same key: B's post, which returns normally, is delivered, and A's,
+// which throws, is not. A once erased the entry holding B's copy, and
+// nothing was delivered.
+TEST(PostingTest, ACoalescedPostThatFailsToQueueLosesNoOtherPost) {
+  MainThreadGuard mainThread;
+  Tarn::Messaging::Initialize();
+  CallLog log;
+  RecordingListener listener("l", &log);
+  Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &listener);
+  using Tarn::StationUtils::PostCoalescedMessageToUIThread;
+  PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(0));  // its store is made once
+  FlushPostedMessagesOnUIThread();
+  std::thread([] {
+    // Fills the queue to its capacity: the next call queued needs storage.
+    for (bool full = false; !full;) {
+      tHeapAllocationsLeft = 0;
+      try {
+        PostMessageToUIThread(Tarn::kStation_StatusBar, PingMessage(), true);
+      } catch (const std::bad_alloc&) {
+        full = true;
+      }
+    }
+    std::thread b;
+    std::atomic<bool> returned{false};
+    std::function<void()> postOnB = [&] {
+      b = std::thread([&] {
+        PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(2));
+        returned = true;
+      });
+      // Fixed, B's post needs the queue's lock, which A holds meanwhile: the
+      // wait then ends at its limit.
+      WaitUntil([&] { return returned.load(); }, std::chrono::milliseconds(100));
+    };
+    tBeforeFailing = &postOnB;
+    tHeapAllocationsLeft = 1;  // the entry's node is had, the queue's growth fails
+    EXPECT_THROW(PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(1)), std::bad_alloc);
+    tHeapAllocationsLeft = -1;
+    b.join();
+  }).join();
+  FlushPostedMessagesOnUIThread();
+  ASSERT_FALSE(log.Entries().empty());
+  EXPECT_EQ(log.Entries().back(), "l:2");
   Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
   Tarn::Messaging::Terminate();
 }
