@@ -7,7 +7,10 @@
 #include "PostKinds.h"
 #include "StationRetirement.h"
 
+#include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
+
+#include <exception>
 
 namespace Tarn {
 
@@ -39,8 +42,14 @@ Station::~Station() {
   DetachFromBroadcasters();
   // The registry removes a station's record before deleting it, so this
   // lookup normally finds nothing; it also makes a registry that is already
-  // gone at process exit say so.
-  StationRegistry::FindStation(mStationID);
+  // gone at process exit say so. For an ID registered anew it makes that
+  // record's station, and the factory may throw (std::bad_alloc included):
+  // a destructor cannot let that out, so the error manager gets it and the
+  // destruction goes on.
+  kivcore::config::ErrorManager::Get(false)->GuardedCall([this] {
+    StationRegistry::FindStation(mStationID);
+    return 1;
+  });
 }
 
 void Station::BroadcastCounted(const Message& inMessage) {
@@ -61,9 +70,18 @@ void Station::BroadcastCounted(const Message& inMessage) {
   } leave{this, frame.mOuter};
   // Idle-time posts go out with an idle broadcast that its listeners hear,
   // just before them; inside the count, so that the station outlives them.
-  if (Detail::sIdlePostsWaiting.load(std::memory_order_relaxed) && mStationID == kStation_Idle && IsBroadcasting())
-    Detail::RunIdlePosts();
+  // One that throws (its station's factory, say) does not cost the idle
+  // listeners their message: the exception leaves once they have heard it.
+  std::exception_ptr idleFailure;
+  if (Detail::sIdlePostsWaiting.load(std::memory_order_relaxed) && mStationID == kStation_Idle && IsBroadcasting()) {
+    try {
+      Detail::RunIdlePosts();
+    } catch (...) {
+      idleFailure = std::current_exception();
+    }
+  }
   Broadcaster::BroadcastMessage(inMessage);
+  if (idleFailure) std::rethrow_exception(idleFailure);
 }
 
 bool Station::IsRelaying(const Message& inMessage) const noexcept {
