@@ -51,6 +51,14 @@ void ReportContractViolation(const std::string& inCondition, const char* inFile,
 // registry's lock; defined with the registry.
 bool IsStationRegistered(const kivcore::utility::ImmutableString& inStationID);
 
+// Reports inOperation on an ID that no station is registered under, when
+// reports are on (a factory that gave no station is the factory's business;
+// the empty ID names no station on purpose). Looks the ID up only then, so
+// that a post's check costs one relaxed load while reports are off. Never
+// throws.
+void ReportIfUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
+                          const char* inOperation) noexcept;
+
 }  // namespace Tarn::Diagnostics::Detail
 
 namespace Tarn::StationRegistry {

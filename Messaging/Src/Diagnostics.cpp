@@ -157,6 +157,17 @@ void ReportSilentFailure(Failure inFailure, const void* inCallSite, const char* 
   }
 }
 
+void ReportIfUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
+                          const char* inOperation) noexcept {
+  if (!ReportsOn() || inStationID.empty()) return;
+  try {
+    if (IsStationRegistered(inStationID)) return;
+  } catch (...) {
+    return;
+  }
+  ReportSilentFailure(Failure::kUnregisteredStation, inCallSite, inOperation, inStationID);
+}
+
 void ReportContractViolation(const std::string& inCondition, const char* inFile, const char* inFunction, int inLine) {
   if (::kivcore::debug::BreakAfterContractDialog(inCondition.c_str(), inFile, inFunction, inLine) &&
       ::kivcore::debug::IsDebuggerAttached()) {

@@ -25,18 +25,8 @@ bool IsAlive(const WeakPtr& inListener) {
   return inListener.lock() != nullptr;
 }
 
-// Reports a call that found no station, when the ID is not registered (a
-// factory that gave no station is the factory's business). The empty ID names
-// no station on purpose. Only failure paths come here.
 void ReportNoStation(const ImmutableString& inStationID, const void* inCallSite, const char* inOperation) noexcept {
-  if (!Diagnostics::Detail::ReportsOn() || inStationID.empty()) return;
-  try {
-    if (Diagnostics::Detail::IsStationRegistered(inStationID)) return;
-  } catch (...) {
-    return;
-  }
-  Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kUnregisteredStation, inCallSite, inOperation,
-                                           inStationID);
+  Diagnostics::Detail::ReportIfUnregistered(inStationID, inCallSite, inOperation);
 }
 
 void RemoveAt(const ImmutableString& inStationID, Listener* inListener, const void* inCallSite) {
@@ -158,6 +148,8 @@ void SwitchStation(const ImmutableString& inFromStationID, const ImmutableString
 }
 
 void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage, bool inForceAsync) {
+  if (Diagnostics::Detail::ReportsOn())
+    ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::PostMessageToUIThread");
   if (!inForceAsync && kivcore::threads::CurrentThreadIsMainThread()) {
     BroadcastMessage(inStationID, inMessage);
     return;

@@ -3,6 +3,7 @@
 #include <TarnMessaging/Subscription.h>
 
 #include "BroadcasterCore.h"
+#include "DiagnosticReports.h"
 #include "StationRetainer.h"
 
 #include <kivcore/MainThread.h>
@@ -64,9 +65,12 @@ Registration AttachSafe(Broadcaster& ioBroadcaster, const ISafeListenerRef& inLi
 }
 
 template <class Attacher>
-Registration AttachToStation(const ImmutableString& inStationID, Attacher inAttach) {
+Registration AttachToStation(const ImmutableString& inStationID, const void* inCallSite, Attacher inAttach) {
   StationRetainer station(inStationID);
-  if (station.get() == nullptr) return Registration();
+  if (station.get() == nullptr) {
+    Diagnostics::Detail::ReportIfUnregistered(inStationID, inCallSite, "Tarn::Attach");
+    return Registration();
+  }
   return inAttach(*station.get());
 }
 
@@ -115,7 +119,11 @@ Registration Registration::Own(Broadcaster& ioBroadcaster, SubscriptionDetail::O
 Registration Registration::Own(const ImmutableString& inStationID, SubscriptionDetail::OwnedListener* inListener) {
   Registration result(inListener);
   StationRetainer station(inStationID);
-  if (station.get() == nullptr) return Registration();  // result disposes of the listener
+  if (station.get() == nullptr) {
+    // The call site is in the host's Subscribe, which is inline.
+    Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::Subscribe");
+    return Registration();  // result disposes of the listener
+  }
   station.get()->AddListener(inListener);
   return result;
 }
@@ -138,23 +146,25 @@ Registration Attach(Broadcaster& ioBroadcaster, const ISafeListenerRef& inListen
 }
 
 Registration Attach(const ImmutableString& inStationID, Listener* inListener) {
-  return AttachToStation(inStationID, [&](Broadcaster& ioStation) { return AttachPlain(ioStation, inListener); });
+  return AttachToStation(inStationID, TARN_CALL_SITE(),
+                         [&](Broadcaster& ioStation) { return AttachPlain(ioStation, inListener); });
 }
 
 Registration Attach(const ImmutableString& inStationID, const boost::weak_ptr<Listener>& inListener) {
-  return AttachToStation(inStationID, [&](Broadcaster& ioStation) {
+  return AttachToStation(inStationID, TARN_CALL_SITE(), [&](Broadcaster& ioStation) {
     return AttachWeak(ioStation, inListener, &ListenerEntry::mBoostWeakListener);
   });
 }
 
 Registration Attach(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener) {
-  return AttachToStation(inStationID, [&](Broadcaster& ioStation) {
+  return AttachToStation(inStationID, TARN_CALL_SITE(), [&](Broadcaster& ioStation) {
     return AttachWeak(ioStation, inListener, &ListenerEntry::mStdWeakListener);
   });
 }
 
 Registration Attach(const ImmutableString& inStationID, const ISafeListenerRef& inListener) {
-  return AttachToStation(inStationID, [&](Broadcaster& ioStation) { return AttachSafe(ioStation, inListener); });
+  return AttachToStation(inStationID, TARN_CALL_SITE(),
+                         [&](Broadcaster& ioStation) { return AttachSafe(ioStation, inListener); });
 }
 
 // ---------------------------------------------------------------------------

@@ -9,10 +9,16 @@
 ///
 /// - a broadcast made off the main thread, which is dropped (key
 ///   ".../BroadcastOffMainThread");
-/// - an operation of StationUtils on an ID that no station is registered
-///   under, which does nothing (".../UnregisteredStation"), and in particular
-///   one on a well-known station before Tarn::Messaging::Initialize
-///   (".../BeforeInitialize");
+/// - a call by station ID on an ID that no station is registered under
+///   (".../UnregisteredStation"), and in particular one on a well-known
+///   station before Tarn::Messaging::Initialize (".../BeforeInitialize"). The
+///   calls that report it: Tarn::Subscribe and Tarn::Attach (which return an
+///   empty Registration); StationUtils' AddListener, RemoveListener,
+///   BroadcastMessage, RetainStation, StartBroadcasting, StopBroadcasting and
+///   SwitchStation (which do nothing); and every kind of post,
+///   PostMessageToUIThread (both forms), PostCoalescedMessageToUIThread (both
+///   forms) and PostMessageAtIdleTime, whose copy is still queued and is
+///   dropped when it finds no station at its delivery;
 /// - stations still retained, or with listeners still attached, when the
 ///   last Terminate deletes them (".../RetainedAtTerminate",
 ///   ".../ListenersAtTerminate");

@@ -14,9 +14,10 @@
 /// Each function that touches a station retains it from the registry for the
 /// length of the call and releases it afterwards. An ID that is not
 /// registered makes every function a no-op (HasListeners: false); with
-/// silent-failure reports on (Diagnostics.h), AddListener, RemoveListener,
-/// BroadcastMessage, RetainStation, StartBroadcasting, StopBroadcasting and
-/// SwitchStation report it once per call site.
+/// silent-failure reports on (Diagnostics.h), every function but
+/// HasListeners, ReleaseStation and FlushPostedMessagesOnUIThread reports it
+/// once per call site; a post checks the ID when it is made (its copy is
+/// still queued, and dropped if no station is registered at its delivery).
 ///
 /// Threading: every function may be called from any thread. BroadcastMessage
 /// delivers only on the main thread; elsewhere it does nothing (it does not
