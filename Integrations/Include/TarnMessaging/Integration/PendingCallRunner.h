@@ -22,8 +22,10 @@
 /// taken (by FlushPostedMessagesOnUIThread, say) returns at once.
 ///
 /// Replacement and destruction: the wakeup handler is tagged with the
-/// runner, and Uninstall removes only its own, so an integration built before
-/// the one it replaces is destroyed keeps every wakeup. Installing a handler
+/// runner, and the newest installed runner gets the wakeups. Uninstall removes
+/// only its own: destroying the newest hands the wakeups back to the newest
+/// one left (woken at once for calls already queued), destroying an older
+/// one changes nothing for the newest. Installing a handler
 /// while calls are queued wakes the new loop for them. Uninstall runs the
 /// calls still queued on the main thread until the queue is empty, follow-ups
 /// posted by those calls included, for at most kDrainPasses runs; calls a
@@ -100,9 +102,9 @@ public:
   /// Installs the wakeup handler on the main thread's adaptor and, when calls
   /// are already queued, schedules a run for them.
   /// Precondition: a main thread is registered (Tarn::Messaging::Initialize
-  /// has run); otherwise throws std::logic_error and installs nothing. The
-  /// adaptor holds one wakeup handler for the whole process: this replaces
-  /// any handler installed before.
+  /// has run); otherwise throws std::logic_error and installs nothing. This
+  /// runner takes the wakeups over from any installed before, until it is
+  /// uninstalled.
   void Install() {
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
