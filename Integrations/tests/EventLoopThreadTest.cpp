@@ -7,6 +7,7 @@
 
 #include <kivcore/Error.h>
 
+#include <atomic>
 #include <chrono>
 #include <stdexcept>
 #include <thread>
@@ -79,32 +80,48 @@ struct IdleHeard {
       });
 };
 
-using Loops = ::testing::Types<AsioLoop
-#if TARN_HAVE_GLIB_INTEGRATION
-                               , GLibLoop
-#endif
-#if TARN_HAVE_QT_INTEGRATION
-                               , QtLoop
-#endif
-                               >;
+using Loops = decltype(TypesOf(AllLoops()));
 TYPED_TEST_SUITE(EventLoopTest, Loops);
 
-// `loop = make_unique(...)` builds the new integration before the old one
-// goes; the old one's removal must not take the new one's wakeups with it.
-TYPED_TEST(EventLoopTest, PostsArriveOnceInOrderOnTheMainThreadAfterTheIntegrationIsReplaced) {
-  constexpr int kPosts = 1000;
-  TypeParam first;
-  auto integration = first.Make();
-  integration = this->mLoop.Make();
-  std::thread producer([this] {
-    for (int i = 0; i < kPosts; ++i) Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, i), false);
+// Two integrations of any kinds, the second built while the first runs, and
+// either one destroyed while a worker posts: the survivor gets the wakeups,
+// delivers every post once and in order, and its idle source goes on.
+TYPED_TEST(EventLoopTest, TheSurvivorOfTwoIntegrationsOfAnyKindsDeliversAndGoesIdle) {
+  static constexpr int kPosts = 200;
+  AllLoops::ForEach([this](auto inKind) {
+    for (const bool newerGoesFirst : {true, false}) {
+      typename decltype(inKind)::Type other;
+      auto older = QuickIdle(this->mLoop.Make());
+      auto newer = QuickIdle(other.Make());
+      this->mHeard.mTotal = this->mHeard.mNext = 0;
+      // Half the posts come before the destruction, half after it.
+      std::atomic<int> posted{0};
+      std::atomic<bool> gone{false};
+      std::thread producer([&] {
+        for (; posted < kPosts; ++posted) {
+          if (posted == kPosts / 2) {
+            EXPECT_TRUE(tarn_test::WaitUntil([&] { return gone.load(); }));
+          }
+          Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, posted), false);
+        }
+      });
+      EXPECT_TRUE(PollUntil(other, [&] { return posted == kPosts / 2; }));
+      auto survive = [&](auto& ioLoop, auto& ioSurvivor, auto& ioGone) {
+        ioGone.reset();
+        gone = true;
+        const std::uint64_t idleBefore = ioSurvivor->IdleBroadcasts();
+        EXPECT_TRUE(PollUntil(ioLoop, [&] { return this->mHeard.mTotal == kPosts && ioSurvivor->IdleBroadcasts() > idleBefore; }))
+            << this->mHeard.mTotal << " delivered, " << ioSurvivor->IdleBroadcasts() - idleBefore << " idle; newer gone first: " << newerGoesFirst;
+      };
+      if (newerGoesFirst) survive(this->mLoop, older, newer);
+      else survive(other, newer, older);
+      producer.join();
+      this->mLoop.Poll();
+      other.Poll();
+      EXPECT_EQ(kPosts, this->mHeard.mTotal) << "nothing twice, also through the other loop";
+      EXPECT_TRUE(this->mHeard.mInOrder);
+    }
   });
-  EXPECT_TRUE(PollUntil(this->mLoop, [this] { return this->mHeard.mTotal == kPosts; })) << this->mHeard.mTotal << " delivered";
-  EXPECT_LE(1u, integration->ScheduledRuns());
-  producer.join();
-  first.Poll();
-  EXPECT_EQ(kPosts, this->mHeard.mTotal) << "nothing twice, also through the old loop";
-  EXPECT_TRUE(this->mHeard.mInOrder);
 }
 
 // A handler posting a follow-up while the destructor drains: the follow-up is
@@ -159,8 +176,8 @@ TYPED_TEST(EventLoopTest, APendingCallMayDestroyTheIntegrationWhileALaterOneThro
 // A worker posts in bursts with pauses for a few idle intervals: with the
 // integration's defaults, idle broadcasts come often enough for an
 // IdleCountdownTimer to fire without help, no more often than the interval
-// allows, and no post is lost. Switched off, none comes;
-// switched on while a handler keeps one message queued for several
+// allows, and no post is lost. Switched off or at the longest interval, none
+// comes; switched on while a handler keeps one message queued for several
 // intervals, none comes before the handler stops.
 TYPED_TEST(EventLoopTest, IdleBroadcastsComeOnlyWhenNothingIsQueuedAndStopWhenSwitchedOff) {
   using namespace std::chrono;
@@ -192,6 +209,9 @@ TYPED_TEST(EventLoopTest, IdleBroadcastsComeOnlyWhenNothingIsQueuedAndStopWhenSw
   const int before = idle.mTotal;
   PollUntil(this->mLoop, [] { return false; }, 10 * kInterval);
   EXPECT_EQ(before, idle.mTotal) << "switched off";
+  integration->SetIdleInterval(milliseconds::max());
+  PollUntil(this->mLoop, [] { return false; }, 10 * kInterval);
+  EXPECT_EQ(before, idle.mTotal) << "the longest interval must not overflow into none";
   const auto until = steady_clock::now() + milliseconds(15);
   this->mHeard.mAction = [&](const Numbered& inMessage) {
     if (steady_clock::now() < until)

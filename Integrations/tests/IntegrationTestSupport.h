@@ -90,6 +90,30 @@ struct QtLoop {
 };
 #endif
 
+// Every loop built here, for a typed suite (TypesOf) or a walk over them
+// inside one test (ForEach, which passes a Kind<Loop>).
+template <class Loop>
+struct Kind {
+  using Type = Loop;
+};
+template <class... Loop>
+struct LoopList {
+  template <class Action>
+  static void ForEach(Action inAction) {
+    (inAction(Kind<Loop>()), ...);
+  }
+};
+template <class... Loop>
+::testing::Types<Loop...> TypesOf(LoopList<Loop...>);
+using AllLoops = LoopList<AsioLoop
+#if TARN_HAVE_GLIB_INTEGRATION
+                          , GLibLoop
+#endif
+#if TARN_HAVE_QT_INTEGRATION
+                          , QtLoop
+#endif
+                          >;
+
 // Polls inLoop until inDone() or inTimeout passes; returns inDone().
 template <class Loop, class Predicate>
 bool PollUntil(Loop& inLoop, Predicate inDone, std::chrono::milliseconds inTimeout = tarn_test::kDeadline) {
