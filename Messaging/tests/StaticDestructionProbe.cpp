@@ -3,7 +3,7 @@
 // outside. Mode "queued" disposes of a station while no main thread is
 // registered, so that it waits in the registry's pending list until exit; it
 // must be deleted while the registry is still alive, silently, and says so on
-// standard output. Mode "late" is described below.
+// standard output. Modes "late" and "violation" are described below.
 //
 // Exit status 0 when the mode ran, 1 for an unknown mode, 2 when the
 // registry did not behave as the mode needs.
@@ -45,6 +45,17 @@ struct LateUser {
     std::printf("late lookup %s\n", found ? "found a station" : "found nothing");
   }
 } sLateUser;
+// Mode "violation" makes the last Terminate from a static object's
+// destructor, after a contract dialog that threw, with a station still
+// listened to. By then this thread's thread_local objects with destructors
+// are gone; the leftover report goes through ThrowError all the same, and
+// must name no violation.
+struct LateTerminate {
+  ~LateTerminate() { Tarn::Messaging::Terminate(); }
+};
+struct Quiet : Tarn::Listener {
+  void ListenToMessage(const Tarn::Message&) override {}
+};
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -61,6 +72,21 @@ int main(int argc, char** argv) {
   if (std::strcmp(argv[1], "late") == 0) {
     sLateUser.mStationID = Tarn::StationRegistry::RegisterUniqueStation();
     sLateUser.mArmed = true;
+    return 0;
+  }
+  if (std::strcmp(argv[1], "violation") == 0) {
+    Tarn::Diagnostics::SetSilentFailureReports(Tarn::Diagnostics::SilentFailureReports::kOn);
+    Tarn::Messaging::Initialize();
+    static Quiet listener;
+    static LateTerminate late;  // destroyed before the registry, made on the line below
+    Tarn::StationUtils::AddListener(Tarn::StationRegistry::RegisterUniqueStation(), &listener);
+    kivcore::debug::SetContractDialogHandler([](const char*, const char*, const char*, int) -> bool { throw 0; });
+    try {
+      Tarn::StationUtils::AddListener(Tarn::kStation_Idle, static_cast<Tarn::Listener*>(nullptr));
+    } catch (int) {
+      std::printf("the dialog threw\n");
+      std::fflush(stdout);
+    }
     return 0;
   }
   return 1;

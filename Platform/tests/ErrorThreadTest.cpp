@@ -27,7 +27,8 @@ std::string Report(const char* inKey) {
 
 // The display text follows the first '='. A failed contract check is named
 // by the next error on its thread and never again, whether the default
-// handler reports it or a host's handler takes it or throws. Each Set
+// handler reports it or a host's handler takes it or throws; a check whose
+// dialog throws is named by none. Each Set
 // returns the previous handler; an empty one restores the default.
 TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoes) {
   EXPECT_FALSE(kivcore::debug::IsDebuggerAttached()) << "the suite runs without a debugger";
@@ -46,6 +47,8 @@ TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoe
   config::SetErrorHandler([](const config::ErrorReport&) { throw std::logic_error("host refuses"); });
   debug::BreakAfterContractDialog("q", "h.cpp", "H", 5);
   EXPECT_THROW(Report("$$$/K"), std::logic_error);
+  debug::SetContractDialogHandler([](const char*, const char*, const char*, int) -> bool { throw std::logic_error("no"); });
+  EXPECT_THROW(debug::BreakAfterContractDialog("r", "i.cpp", "I", 6), std::logic_error);
   EXPECT_TRUE(config::SetErrorHandler(nullptr) && debug::SetContractDialogHandler(nullptr));
   EXPECT_EQ("$$$/K -> $$$/K", Report("$$$/K"));
 }
