@@ -1,3 +1,4 @@
+#include <kivcore/Error.h>
 #include <kivcore/InitializerRegistry.h>
 
 #include <gtest/gtest.h>
@@ -125,6 +126,33 @@ TEST(InitializerRegistry, ACallerWaitsForTheInitRunningOnAnotherThread) {
   second.join();
   InitializerRegistry::TerminateAll();
   EXPECT_EQ((std::vector<std::string>{"init Slow", "term Slow"}), sLog);
+}
+
+// An init that hands work to a loader thread calling InitializeAll, and waits
+// for it: the loader's call gives up after the wait limit with a report,
+// instead of both waiting for ever.
+TEST(InitializerRegistry, ALoaderThreadWaitedForByTheRunningInitGivesUpWithAReport) {
+  sLog.clear();
+  const auto previousLimit = InitializerRegistry::SetRunWaitLimit(std::chrono::milliseconds(20));
+  std::string reported;
+  const auto previousHandler = ErrorManager::SetExceptionHandler([&reported](std::exception_ptr inError) {
+    try {
+      std::rethrow_exception(inError);
+    } catch (const std::exception& e) {
+      reported = e.what();
+    }
+  });
+  auto answer = std::make_shared<std::promise<bool>>();
+  const auto waiter = Entry("Waiter", nullptr, [answer] {
+    std::thread([answer] { answer->set_value(InitializerRegistry::InitializeAll(PropList())); }).detach();
+    return answer->get_future().wait_for(std::chrono::seconds(20)) == std::future_status::ready;
+  });
+  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList())) << "deadlocked";
+  ErrorManager::SetExceptionHandler(previousHandler);
+  InitializerRegistry::SetRunWaitLimit(previousLimit);
+  EXPECT_NE(reported.find("InitializeAll gave up after waiting 20 ms"), std::string::npos) << reported;
+  InitializerRegistry::TerminateAll();
+  EXPECT_EQ((std::vector<std::string>{"init Waiter", "term Waiter"}), sLog);
 }
 
 }  // namespace
