@@ -246,4 +246,42 @@ TYPED_TEST(EventLoopTest, AnIdleListenerMayNestTheLoopAndDestroyTheIntegration) 
   EXPECT_EQ(0, idle.mWrong);
 }
 
+// Destroying an integration off the main thread is outside the contract,
+// and reported as such.
+TEST(EventLoopMisuse, AnIntegrationDestroyedOnAWorkerIsReported) {
+  Tarn::Messaging::Initialize();
+  int reports = 0;
+  auto previous = kivcore::config::SetErrorHandler([&reports](const kivcore::config::ErrorReport&) { ++reports; });
+  AsioLoop loop;
+  auto integration = loop.Make();
+  std::thread([&integration] { integration.reset(); }).join();
+  kivcore::config::SetErrorHandler(previous);
+  EXPECT_EQ(1, reports);
+  Tarn::Messaging::Terminate();
+}
+
+#if TARN_HAVE_GLIB_INTEGRATION
+// A context nobody iterates while the main thread flushes batch after batch:
+// one run source waits in it, not one per batch. GLib numbers a context's
+// sources in order, so two markers count what came between them.
+TEST(EventLoopMisuse, AContextNobodyIteratesHoldsOneRunSourceHoweverManyBatches) {
+  Tarn::Messaging::Initialize();
+  GLibLoop loop;
+  auto integration = loop.Make();
+  auto marker = [&loop] {
+    GSource* const source = g_idle_source_new();
+    const guint id = g_source_attach(source, loop.mContext);
+    return g_source_unref(source), id;
+  };
+  const guint before = marker();
+  for (int batch = 0; batch < 10; ++batch) {
+    kivcore::threads::AsyncCallFromMainThread([] {}, 0);
+    Tarn::StationUtils::FlushPostedMessagesOnUIThread();
+  }
+  EXPECT_EQ(before + 2, marker());
+  integration.reset();
+  Tarn::Messaging::Terminate();
+}
+#endif
+
 }  // namespace

@@ -134,14 +134,8 @@ TEST(InitializerRegistry, ACallerWaitsForTheInitRunningOnAnotherThread) {
 TEST(InitializerRegistry, ALoaderThreadWaitedForByTheRunningInitGivesUpWithAReport) {
   sLog.clear();
   const auto previousLimit = InitializerRegistry::SetRunWaitLimit(std::chrono::milliseconds(20));
-  std::string reported;
-  const auto previousHandler = ErrorManager::SetExceptionHandler([&reported](std::exception_ptr inError) {
-    try {
-      std::rethrow_exception(inError);
-    } catch (const std::exception& e) {
-      reported = e.what();
-    }
-  });
+  int reports = 0;
+  const auto previousHandler = ErrorManager::SetExceptionHandler([&reports](std::exception_ptr) { ++reports; });
   auto answer = std::make_shared<std::promise<bool>>();
   const auto waiter = Entry("Waiter", nullptr, [answer] {
     std::thread([answer] { answer->set_value(InitializerRegistry::InitializeAll(PropList())); }).detach();
@@ -150,7 +144,7 @@ TEST(InitializerRegistry, ALoaderThreadWaitedForByTheRunningInitGivesUpWithARepo
   EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList())) << "deadlocked";
   ErrorManager::SetExceptionHandler(previousHandler);
   InitializerRegistry::SetRunWaitLimit(previousLimit);
-  EXPECT_NE(reported.find("InitializeAll gave up after waiting 20 ms"), std::string::npos) << reported;
+  EXPECT_EQ(1, reports);
   InitializerRegistry::TerminateAll();
   EXPECT_EQ((std::vector<std::string>{"init Waiter", "term Waiter"}), sLog);
 }

@@ -156,6 +156,10 @@ private:
 
     void PostRun() override {
       std::lock_guard<std::mutex> lock(mSourcesMutex);
+      // A source not yet dispatched runs this batch too: it takes the whole
+      // queue. Without this, a context nobody iterates while the main thread
+      // flushes would gather one source per batch.
+      if (!mSources.empty()) return;
       // The steps that can throw come before the source exists.
       mSources.reserve(mSources.size() + 1);
       auto reference = std::make_unique<SourceReference>();

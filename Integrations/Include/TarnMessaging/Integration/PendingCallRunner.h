@@ -54,6 +54,7 @@
 #include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationUtils.h>
 
+#include <kivcore/Debug.h>
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
@@ -62,6 +63,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <cstdio>
 #include <memory>
 #include <mutex>
 #include <stdexcept>
@@ -131,10 +133,15 @@ public:
   /// calls go to the error manager. A run still queued in the host loop does
   /// nothing afterwards. Calls are run only on the main thread; after the last
   /// Tarn::Messaging::Terminate there is no adaptor left, and the handler,
-  /// unreachable, stays inert.
+  /// unreachable, stays inert. Called off the main thread while one is
+  /// registered (outside the contract), it shows the contract dialog.
   void Uninstall() noexcept {
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
+    // Elsewhere the idle check is disarmed while the main thread's handlers
+    // may use it, and the final drain is skipped: the host is told, and the
+    // rest goes on as well as it can.
+    if (adaptor && !kivcore::threads::CurrentThreadIsMainThread()) ReportOffMainThread();
     if (adaptor) adaptor->RemoveWakeupHandler(this);
     DisarmIdleCheck();
     {
@@ -236,6 +243,21 @@ protected:
   virtual void DisarmIdleCheck() noexcept {}
 
 private:
+  // The contract check's report: the dialog, then the error. A destructor
+  // has no caller to throw to, so what the error handler throws is printed.
+  static void ReportOffMainThread() noexcept {
+    try {
+      kivcore::debug::BreakAfterContractDialog("kivcore::threads::CurrentThreadIsMainThread()", __FILE__,
+                                               "Tarn::Integration::PendingCallRunner::Uninstall", __LINE__);
+      const kivcore::config::ReplacementValue none;
+      kivcore::config::ThrowError(0, "$$$/kivcore/utility/Error/Contract/InputContractViolation=An input contract "
+                                  "violation has occurred!", 105u, 25, true, none, none, none, none);
+    } catch (const std::exception& inError) {
+      std::fprintf(stderr, "Tarn::Integration: %s\n", inError.what());
+    } catch (...) {
+    }
+  }
+
   // Armed first, so that an exception leaving the broadcast, or a listener
   // that destroys the integration, leaves the source in a known state.
   int ArmAndBroadcast() {
