@@ -23,6 +23,7 @@
 #include <chrono>
 #include <memory>
 #include <thread>
+#include <tuple>
 
 namespace integration_test {
 
@@ -90,8 +91,8 @@ struct QtLoop {
 };
 #endif
 
-// Every loop built here, for a typed suite (TypesOf) or a walk over them
-// inside one test (ForEach, which passes a Kind<Loop>).
+// Every loop built here, for a typed suite (TypesOf), one of each (TupleOf)
+// or a walk over them inside one test (ForEach, which passes a Kind<Loop>).
 template <class Loop>
 struct Kind {
   using Type = Loop;
@@ -105,6 +106,8 @@ struct LoopList {
 };
 template <class... Loop>
 ::testing::Types<Loop...> TypesOf(LoopList<Loop...>);
+template <class... Loop>
+std::tuple<Loop...> TupleOf(LoopList<Loop...>);
 using AllLoops = LoopList<AsioLoop
 #if TARN_HAVE_GLIB_INTEGRATION
                           , GLibLoop
