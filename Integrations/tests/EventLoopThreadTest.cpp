@@ -11,6 +11,7 @@
 #include <chrono>
 #include <stdexcept>
 #include <thread>
+#include <tuple>
 #include <type_traits>
 
 #if TARN_HAVE_QT_INTEGRATION && defined(__SANITIZE_THREAD__)
@@ -88,24 +89,22 @@ TYPED_TEST_SUITE(EventLoopTest, Loops);
 // delivers every post once and in order, and its idle source goes on.
 TYPED_TEST(EventLoopTest, TheSurvivorOfTwoIntegrationsOfAnyKindsDeliversAndGoesIdle) {
   static constexpr int kPosts = 200;
-  AllLoops::ForEach([this](auto inKind) {
+  decltype(TupleOf(AllLoops())) others;
+  auto replace = [this](auto& ioOther) {
     for (const bool newerGoesFirst : {true, false}) {
-      typename decltype(inKind)::Type other;
       auto older = QuickIdle(this->mLoop.Make());
-      auto newer = QuickIdle(other.Make());
+      auto newer = QuickIdle(ioOther.Make());
       this->mHeard.mTotal = this->mHeard.mNext = 0;
       // Half the posts come before the destruction, half after it.
       std::atomic<int> posted{0};
       std::atomic<bool> gone{false};
       std::thread producer([&] {
         for (; posted < kPosts; ++posted) {
-          if (posted == kPosts / 2) {
-            EXPECT_TRUE(tarn_test::WaitUntil([&] { return gone.load(); }));
-          }
+          if (posted == kPosts / 2 && !tarn_test::WaitUntil([&] { return gone.load(); })) ADD_FAILURE() << "never destroyed";
           Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, posted), false);
         }
       });
-      EXPECT_TRUE(PollUntil(other, [&] { return posted == kPosts / 2; }));
+      EXPECT_TRUE(PollUntil(ioOther, [&] { return posted == kPosts / 2; }));
       auto survive = [&](auto& ioLoop, auto& ioSurvivor, auto& ioGone) {
         ioGone.reset();
         gone = true;
@@ -114,14 +113,15 @@ TYPED_TEST(EventLoopTest, TheSurvivorOfTwoIntegrationsOfAnyKindsDeliversAndGoesI
             << this->mHeard.mTotal << " delivered, " << ioSurvivor->IdleBroadcasts() - idleBefore << " idle; newer gone first: " << newerGoesFirst;
       };
       if (newerGoesFirst) survive(this->mLoop, older, newer);
-      else survive(other, newer, older);
+      else survive(ioOther, newer, older);
       producer.join();
       this->mLoop.Poll();
-      other.Poll();
+      ioOther.Poll();
       EXPECT_EQ(kPosts, this->mHeard.mTotal) << "nothing twice, also through the other loop";
       EXPECT_TRUE(this->mHeard.mInOrder);
     }
-  });
+  };
+  std::apply([&replace](auto&... inOther) { (replace(inOther), ...); }, others);
 }
 
 // A handler posting a follow-up while the destructor drains: the follow-up is

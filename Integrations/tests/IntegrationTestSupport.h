@@ -91,19 +91,10 @@ struct QtLoop {
 };
 #endif
 
-// Every loop built here, for a typed suite (TypesOf), one of each (TupleOf)
-// or a walk over them inside one test (ForEach, which passes a Kind<Loop>).
-template <class Loop>
-struct Kind {
-  using Type = Loop;
-};
+// Every loop built here, for a typed suite (TypesOf) or one of each kind
+// (TupleOf).
 template <class... Loop>
-struct LoopList {
-  template <class Action>
-  static void ForEach(Action inAction) {
-    (inAction(Kind<Loop>()), ...);
-  }
-};
+struct LoopList {};
 template <class... Loop>
 ::testing::Types<Loop...> TypesOf(LoopList<Loop...>);
 template <class... Loop>
