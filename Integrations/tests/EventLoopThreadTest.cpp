@@ -100,7 +100,7 @@ TYPED_TEST(EventLoopTest, TheSurvivorOfTwoIntegrationsOfAnyKindsDeliversAndGoesI
       std::atomic<bool> gone{false};
       std::thread producer([&] {
         for (; posted < kPosts; ++posted) {
-          if (posted == kPosts / 2 && !tarn_test::WaitUntil([&] { return gone.load(); })) ADD_FAILURE() << "never destroyed";
+          if (posted == kPosts / 2 && !tarn_test::WaitUntil([&] { return gone.load(); })) ADD_FAILURE();
           Tarn::StationUtils::PostMessageToUIThread(this->mStation, Numbered(0, posted), false);
         }
       });
@@ -109,8 +109,9 @@ TYPED_TEST(EventLoopTest, TheSurvivorOfTwoIntegrationsOfAnyKindsDeliversAndGoesI
         ioGone.reset();
         gone = true;
         const std::uint64_t idleBefore = ioSurvivor->IdleBroadcasts();
-        EXPECT_TRUE(PollUntil(ioLoop, [&] { return this->mHeard.mTotal == kPosts && ioSurvivor->IdleBroadcasts() > idleBefore; }))
-            << this->mHeard.mTotal << " delivered, " << ioSurvivor->IdleBroadcasts() - idleBefore << " idle; newer gone first: " << newerGoesFirst;
+        auto idle = [&] { return ioSurvivor->IdleBroadcasts() - idleBefore; };
+        EXPECT_TRUE(PollUntil(ioLoop, [&] { return this->mHeard.mTotal == kPosts && idle() > 0; }))
+            << this->mHeard.mTotal << " delivered, " << idle() << " idle; newer gone first: " << newerGoesFirst;
       };
       if (newerGoesFirst) survive(this->mLoop, older, newer);
       else survive(ioOther, newer, older);

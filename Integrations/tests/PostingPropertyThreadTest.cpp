@@ -45,7 +45,8 @@ struct Scenario {
   std::shared_ptr<void> MakeIntegration() {
     std::shared_ptr<void> made;
     int skip = Pick(std::tuple_size<decltype(mLoops)>::value);
-    std::apply([&](auto&... inLoop) { static_cast<void>(((skip-- == 0 && (made = QuickIdle(inLoop.Make()))) || ...)); }, mLoops);
+    auto make = [&](auto& ioLoop) { return skip-- == 0 && (made = QuickIdle(ioLoop.Make())); };
+    std::apply([&](auto&... inLoop) { static_cast<void>((make(inLoop) || ...)); }, mLoops);
     return made;
   }
   // Either order: the new integration built before the old one goes, or after.

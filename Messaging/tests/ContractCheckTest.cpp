@@ -18,7 +18,6 @@
 #include <csignal>
 #include <optional>
 #include <set>
-#include <thread>
 
 using kivcore::utility::ImmutableString;
 using kivcore::utility::SmallBlockAllocator;
@@ -144,7 +143,13 @@ const std::vector<Site> kSites = {
     {"u.Flush(worker)", [](Scene& s) {
        Utils::PostMessageToUIThread(s.mStation, messaging_test::PingMessage(), true);
        std::exception_ptr thrown;
-       std::thread([&thrown] { try { Utils::FlushPostedMessagesOnUIThread(); } catch (...) { thrown = std::current_exception(); } }).join();
+       station_test::RunOnWorker([&thrown] {
+         try {
+           Utils::FlushPostedMessagesOnUIThread();
+         } catch (...) {
+           thrown = std::current_exception();
+         }
+       });
        const int heard = s.mStays.Calls();
        Utils::FlushPostedMessagesOnUIThread();
        EXPECT_EQ(s.mStays.Calls(), heard + 1) << "the post was lost";

@@ -47,8 +47,8 @@ TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoe
   config::SetErrorHandler([](const config::ErrorReport&) { throw std::logic_error("host refuses"); });
   debug::BreakAfterContractDialog("q", "h.cpp", "H", 5);
   EXPECT_THROW(Report("$$$/K"), std::logic_error);
-  debug::SetContractDialogHandler([](const char*, const char*, const char*, int) -> bool { throw std::logic_error("no"); });
-  EXPECT_THROW(debug::BreakAfterContractDialog("r", "i.cpp", "I", 6), std::logic_error);
+  debug::SetContractDialogHandler([](const char*, const char*, const char*, int) -> bool { throw 0; });
+  EXPECT_THROW(debug::BreakAfterContractDialog("r", "i.cpp", "I", 6), int);
   EXPECT_TRUE(config::SetErrorHandler(nullptr) && debug::SetContractDialogHandler(nullptr));
   EXPECT_EQ("$$$/K -> $$$/K", Report("$$$/K"));
 }

@@ -155,7 +155,7 @@ TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThe
       finished.fetch_add(1);
     });
   std::size_t most = 0;
-  while (finished < 2) most = std::max(most, SmallBlockAllocator::GetStatistics().blocksInUse);  // the threads never wait
+  while (finished < 2) most = std::max(most, SmallBlockAllocator::GetStatistics().blocksInUse);  // they never wait
   pair.JoinAll();
   for (auto& slot : slots) SmallBlockAllocator::Dispose(slot.load(), 32);
   EXPECT_LT(most, before.blocksInUse + 64) << "a count below zero wrapped";

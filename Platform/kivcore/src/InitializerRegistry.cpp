@@ -239,7 +239,8 @@ std::chrono::milliseconds InitializerRegistry::SetRunWaitLimit(std::chrono::mill
   std::lock_guard<std::mutex> lock(registry.mutex);
   const std::chrono::milliseconds previous = registry.waitLimit;
   // Longer limits would overflow the clock's arithmetic in the wait.
-  registry.waitLimit = std::clamp<std::chrono::milliseconds>(inLimit, std::chrono::milliseconds(0), std::chrono::hours(24 * 365));
+  registry.waitLimit = std::clamp<std::chrono::milliseconds>(inLimit, std::chrono::milliseconds(0),
+                                                             std::chrono::hours(24 * 365));
   return previous;
 }
 

@@ -134,8 +134,9 @@ private:
       const std::uint64_t generation = ++mIdleGeneration;
       // Clamped to what the clock can hold, as GLib and Qt clamp to their
       // timers' range: a longer delay would overflow and fire at once.
-      const auto now = std::chrono::steady_clock::now();
-      const auto room = std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::time_point::max() - now);
+      using std::chrono::steady_clock;
+      const steady_clock::time_point now = steady_clock::now();
+      const auto room = std::chrono::duration_cast<std::chrono::milliseconds>(steady_clock::time_point::max() - now);
       mIdleTimer->expires_at(now + std::min(inDelay, room));
       std::shared_ptr<Runner> self = std::static_pointer_cast<Runner>(shared_from_this());
       auto executor = mIdleTimer->get_executor();
