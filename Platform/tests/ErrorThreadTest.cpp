@@ -2,6 +2,7 @@
 
 #include <kivcore/Debug.h>
 #include <kivcore/Error.h>
+#include <kivcore/Guid.h>
 
 #include <gtest/gtest.h>
 
@@ -9,6 +10,7 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <thread>
 
 using namespace kivcore;
 
@@ -86,6 +88,23 @@ TEST(ErrorReportingThreads, SwappedHandlersSeeEachReportOnceAndFailedChecksStayO
   EXPECT_EQ(4 * kRounds, handled.load());
   EXPECT_EQ(4 * kRounds, dialogs.load());
   EXPECT_EQ("main's, Main::Check, t.cpp:3", debug::TakeLastContractViolation());
+}
+
+// A thread-exit destructor that runs after the thread made its first
+// identifier still makes valid, distinct ones.
+TEST(GuidThreads, ALateThreadExitDestructorMakesValidDistinctIdentifiers) {
+  static std::string made[2];
+  struct Late {
+    ~Late() {
+      for (std::string& text : made) text = utility::Guid::CreateUnique().AsUTF8String();
+    }
+  };
+  std::thread([] {
+    static thread_local Late late;  // constructed first, so destroyed after the generator
+    utility::Guid::CreateUnique();
+  }).join();
+  EXPECT_NE(made[0], made[1]);
+  EXPECT_EQ('4', made[0].at(15)) << made[0];  // version 4, random
 }
 
 }  // namespace
