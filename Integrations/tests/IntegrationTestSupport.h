@@ -23,6 +23,7 @@
 #include <chrono>
 #include <memory>
 #include <thread>
+#include <tuple>
 
 namespace integration_test {
 
@@ -89,6 +90,23 @@ struct QtLoop {
   void Poll() { QCoreApplication::processEvents(); }
 };
 #endif
+
+// Every loop built here, for a typed suite (TypesOf) or one of each kind
+// (TupleOf).
+template <class... Loop>
+struct LoopList {};
+template <class... Loop>
+::testing::Types<Loop...> TypesOf(LoopList<Loop...>);
+template <class... Loop>
+std::tuple<Loop...> TupleOf(LoopList<Loop...>);
+using AllLoops = LoopList<AsioLoop
+#if TARN_HAVE_GLIB_INTEGRATION
+                          , GLibLoop
+#endif
+#if TARN_HAVE_QT_INTEGRATION
+                          , QtLoop
+#endif
+                          >;
 
 // Polls inLoop until inDone() or inTimeout passes; returns inDone().
 template <class Loop, class Predicate>

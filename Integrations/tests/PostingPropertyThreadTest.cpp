@@ -15,6 +15,7 @@
 #include <memory>
 #include <numeric>
 #include <random>
+#include <tuple>
 #include <vector>
 
 namespace {
@@ -36,24 +37,17 @@ struct Scenario {
   int mPosted[2] = {0, 0};  // by handlers so far: queued, at once
   bool mTerminating = false;
   std::atomic<int> mSettled{0};  // posts heard or dropped, for the producers' pacing
-  AsioLoop mAsio;
-#if TARN_HAVE_GLIB_INTEGRATION
-  GLibLoop mGLib;
-#endif
-#if TARN_HAVE_QT_INTEGRATION
-  QtLoop mQt;
-#endif
+  decltype(TupleOf(AllLoops())) mLoops;
   std::shared_ptr<void> mIntegration;
 
   int Pick(int inBound) { return std::uniform_int_distribution<int>(0, inBound - 1)(mRandom); }
+  // Of a kind picked at random.
   std::shared_ptr<void> MakeIntegration() {
-#if TARN_HAVE_GLIB_INTEGRATION
-    if (Pick(3) == 0) return QuickIdle(mGLib.Make());
-#endif
-#if TARN_HAVE_QT_INTEGRATION
-    if (Pick(2) == 0) return QuickIdle(mQt.Make());
-#endif
-    return QuickIdle(mAsio.Make());
+    std::shared_ptr<void> made;
+    int skip = Pick(std::tuple_size<decltype(mLoops)>::value);
+    auto make = [&](auto& ioLoop) { return skip-- == 0 && (made = QuickIdle(ioLoop.Make())); };
+    std::apply([&](auto&... inLoop) { static_cast<void>((make(inLoop) || ...)); }, mLoops);
+    return made;
   }
   // Either order: the new integration built before the old one goes, or after.
   void SwapIntegration() {
@@ -61,13 +55,7 @@ struct Scenario {
     mIntegration = MakeIntegration();
   }
   void Poll() {
-    mAsio.Poll();
-#if TARN_HAVE_GLIB_INTEGRATION
-    mGLib.Poll();
-#endif
-#if TARN_HAVE_QT_INTEGRATION
-    mQt.Poll();
-#endif
+    std::apply([](auto&... inLoop) { (inLoop.Poll(), ...); }, mLoops);
   }
 };
 Scenario* sRun = nullptr;

@@ -162,7 +162,12 @@ void PostMessageToUIThread(const ImmutableString& inStationID, const Message& in
 void FlushPostedMessagesOnUIThread() {
   const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
       kivcore::threads::GetRegisteredMainThread();
-  if (adaptor) adaptor->RunPendingCalls();
+  if (!adaptor) return;
+  // Anywhere else the posts' broadcasts would be dropped unheard: they stay
+  // queued for the main thread.
+  const bool onMainThread = kivcore::threads::CurrentThreadIsMainThread();
+  TARN_CONTRACT_CHECK(onMainThread, "Tarn::StationUtils::FlushPostedMessagesOnUIThread");
+  if (onMainThread) adaptor->RunPendingCalls();
 }
 
 }  // namespace StationUtils

@@ -139,6 +139,23 @@ const std::vector<Site> kSites = {
      {{"!inFromStationID.empty()", kUSwitch}, {"!inToStationID.empty()", kUSwitch}, {kNull, kUSwitch}}},
     {"u.Switch(from no ID)", [](Scene& s) { Utils::SwitchStation(Tarn::kNoStation, s.mStation, &s.mMover); },
      {{"!inFromStationID.empty()", kUSwitch}}, true},
+    // Off the main thread the post's broadcast would be dropped: it must stay queued.
+    {"u.Flush(worker)", [](Scene& s) {
+       Utils::PostMessageToUIThread(s.mStation, messaging_test::PingMessage(), true);
+       std::exception_ptr thrown;
+       station_test::RunOnWorker([&thrown] {
+         try {
+           Utils::FlushPostedMessagesOnUIThread();
+         } catch (...) {
+           thrown = std::current_exception();
+         }
+       });
+       const int heard = s.mStays.Calls();
+       Utils::FlushPostedMessagesOnUIThread();
+       EXPECT_EQ(s.mStays.Calls(), heard + 1) << "the post was lost";
+       if (thrown) std::rethrow_exception(thrown);
+     },
+     {{"onMainThread", "Tarn::StationUtils::FlushPostedMessagesOnUIThread"}}},
 };
 
 class ContractCheckSites : public station_test::RegistryTest {};
@@ -193,7 +210,7 @@ TEST_F(ContractCheckSites, EachReportsItselfAndLeavesNothingBrokenWhetherTheRepo
       EXPECT_EQ(scene.mUnweakable.mCount, 0);
     }
   }
-  EXPECT_EQ(linesSeen.size(), 17u);  // sixteen calls reach seventeen sites
+  EXPECT_EQ(linesSeen.size(), 18u);  // seventeen calls reach eighteen sites
   // Every StationUtils call released the station it retained.
   Tarn::StationRegistry::DisposeStation(scene.mStation);
   EXPECT_EQ(station_test::StationLog::Destructions(), 1);

@@ -177,6 +177,8 @@ TEST(MessagingLifecycleTest, TerminateGivesBackEverySmallBlock) {
 // still alive, without a diagnostic. A lookup made after the registry's own
 // static destruction finds nothing and says why, instead of reading the
 // destroyed map. A forgotten Terminate with a post still queued is reported.
+// The last Terminate made by a static object's destructor reports what it
+// leaves behind, naming no violation whose dialog threw.
 TEST(StaticDestructionTest, StationsAtExitGoWhileTheRegistryLivesAndLateLookupsFindNothing) {
   auto run = [](const char* inMode, std::string& outOutput) {
     FILE* const probe = ::popen((std::string("\"") + TARN_STATIC_DESTRUCTION_PROBE + "\" " + inMode + " 2>&1").c_str(), "r");
@@ -199,6 +201,12 @@ TEST(StaticDestructionTest, StationsAtExitGoWhileTheRegistryLivesAndLateLookupsF
   EXPECT_NE(late.find("SERIOUS ERROR!  StationRegistry has already been destructed.\nlate lookup found nothing\n"),
             std::string::npos)
       << late;
+  std::string violation;
+  status = run("violation", violation);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status << violation;
+  EXPECT_EQ(0u, violation.find("the dialog threw\nTarnMessaging: ")) << violation;
+  EXPECT_NE(violation.find("still retained"), std::string::npos) << violation;
+  EXPECT_EQ(violation.find("inListener"), std::string::npos) << "a thrown-away violation named: " << violation;
 }
 
 }  // namespace

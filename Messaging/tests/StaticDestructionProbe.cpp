@@ -4,8 +4,8 @@
 // registered, so that it waits in the registry's pending list until exit; it
 // must be deleted while the registry is still alive, silently, and says so on
 // standard output. Mode "unterminated" exits with a post still queued and
-// the library still initialized, which must be reported at exit. Mode "late"
-// is described below.
+// the library still initialized, which must be reported at exit. Modes
+// "late" and "violation" are described below.
 //
 // Exit status 0 when the mode ran, 1 for an unknown mode, 2 when the
 // registry did not behave as the mode needs.
@@ -47,6 +47,14 @@ struct LateUser {
     std::printf("late lookup %s\n", found ? "found a station" : "found nothing");
   }
 } sLateUser;
+// Mode "violation" makes the last Terminate from a static object's
+// destructor, after a contract dialog that threw, with a station still
+// retained. By then this thread's thread_local objects with destructors
+// are gone; the leftover report goes through ThrowError all the same, and
+// must name no violation.
+struct LateTerminate {
+  ~LateTerminate() { Tarn::Messaging::Terminate(); }
+};
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -69,6 +77,20 @@ int main(int argc, char** argv) {
   if (std::strcmp(argv[1], "late") == 0) {
     sLateUser.mStationID = Tarn::StationRegistry::RegisterUniqueStation();
     sLateUser.mArmed = true;
+    return 0;
+  }
+  if (std::strcmp(argv[1], "violation") == 0) {
+    Tarn::Diagnostics::SetSilentFailureReports(Tarn::Diagnostics::SilentFailureReports::kOn);
+    Tarn::Messaging::Initialize();
+    static LateTerminate late;  // destroyed before the registry, made on the line below
+    Tarn::StationUtils::RetainStation(Tarn::StationRegistry::RegisterUniqueStation());
+    kivcore::debug::SetContractDialogHandler([](const char*, const char*, const char*, int) -> bool { throw 0; });
+    try {
+      Tarn::StationUtils::AddListener(Tarn::kStation_Idle, static_cast<Tarn::Listener*>(nullptr));
+    } catch (int) {
+      std::printf("the dialog threw\n");
+      std::fflush(stdout);
+    }
     return 0;
   }
   return 1;

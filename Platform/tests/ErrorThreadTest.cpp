@@ -2,6 +2,7 @@
 
 #include <kivcore/Debug.h>
 #include <kivcore/Error.h>
+#include <kivcore/Guid.h>
 
 #include <gtest/gtest.h>
 
@@ -9,6 +10,7 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <thread>
 
 using namespace kivcore;
 
@@ -27,7 +29,8 @@ std::string Report(const char* inKey) {
 
 // The display text follows the first '='. A failed contract check is named
 // by the next error on its thread and never again, whether the default
-// handler reports it or a host's handler takes it or throws. Each Set
+// handler reports it or a host's handler takes it or throws; a check whose
+// dialog throws is named by none. Each Set
 // returns the previous handler; an empty one restores the default.
 TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoes) {
   EXPECT_FALSE(kivcore::debug::IsDebuggerAttached()) << "the suite runs without a debugger";
@@ -46,6 +49,8 @@ TEST(ErrorReporting, EachErrorReportsTheLastFailedCheckOnceWhateverItsHandlerDoe
   config::SetErrorHandler([](const config::ErrorReport&) { throw std::logic_error("host refuses"); });
   debug::BreakAfterContractDialog("q", "h.cpp", "H", 5);
   EXPECT_THROW(Report("$$$/K"), std::logic_error);
+  debug::SetContractDialogHandler([](const char*, const char*, const char*, int) -> bool { throw 0; });
+  EXPECT_THROW(debug::BreakAfterContractDialog("r", "i.cpp", "I", 6), int);
   EXPECT_TRUE(config::SetErrorHandler(nullptr) && debug::SetContractDialogHandler(nullptr));
   EXPECT_EQ("$$$/K -> $$$/K", Report("$$$/K"));
 }
@@ -83,6 +88,23 @@ TEST(ErrorReportingThreads, SwappedHandlersSeeEachReportOnceAndFailedChecksStayO
   EXPECT_EQ(4 * kRounds, handled.load());
   EXPECT_EQ(4 * kRounds, dialogs.load());
   EXPECT_EQ("main's, Main::Check, t.cpp:3", debug::TakeLastContractViolation());
+}
+
+// A thread-exit destructor that runs after the thread made its first
+// identifier still makes valid, distinct ones.
+TEST(GuidThreads, ALateThreadExitDestructorMakesValidDistinctIdentifiers) {
+  static std::string made[2];
+  struct Late {
+    ~Late() {
+      for (std::string& text : made) text = utility::Guid::CreateUnique().AsUTF8String();
+    }
+  };
+  std::thread([] {
+    static thread_local Late late;  // constructed first, so destroyed after the generator
+    utility::Guid::CreateUnique();
+  }).join();
+  EXPECT_NE(made[0], made[1]);
+  EXPECT_EQ('4', made[0].at(15)) << made[0];  // version 4, random
 }
 
 }  // namespace

@@ -1,3 +1,4 @@
+#include <kivcore/Error.h>
 #include <kivcore/InitializerRegistry.h>
 
 #include <gtest/gtest.h>
@@ -101,13 +102,15 @@ TEST(InitializerRegistry, FailuresStopTheRunAndOnlyWhatWasInitializedIsTerminate
 }
 
 // A second InitializeAll made while another thread runs an init waits for it
-// to finish, rather than answering before the library is up.
-TEST(InitializerRegistry, ACallerWaitsForTheInitRunningOnAnotherThread) {
+// to finish, rather than answering before the library is up. But an init
+// that hands work to a loader thread calling InitializeAll, and waits for it,
+// gets an answer after the wait limit, with a report, not a deadlock.
+TEST(InitializerRegistry, ACallerWaitsForTheInitRunningOnAnotherThreadUpToTheLimit) {
   sLog.clear();
   std::promise<void> entered, release;
   const std::shared_future<void> go = release.get_future().share();
   std::atomic<bool> finished{false};
-  const auto slow = Entry("Slow", nullptr, [&] {
+  auto slow = Entry("Slow", nullptr, [&] {
     entered.set_value();
     go.wait();
     finished = true;
@@ -123,8 +126,22 @@ TEST(InitializerRegistry, ACallerWaitsForTheInitRunningOnAnotherThread) {
   release.set_value();
   first.join();
   second.join();
+  slow.reset();
+
+  const auto previousLimit = InitializerRegistry::SetRunWaitLimit(std::chrono::milliseconds(20));
+  int reports = 0;
+  const auto previousHandler = ErrorManager::SetExceptionHandler([&reports](std::exception_ptr) { ++reports; });
+  auto answer = std::make_shared<std::promise<bool>>();
+  const auto waiter = Entry("Waiter", nullptr, [answer] {
+    std::thread([answer] { answer->set_value(InitializerRegistry::InitializeAll(PropList())); }).detach();
+    return answer->get_future().wait_for(std::chrono::seconds(20)) == std::future_status::ready;
+  });
+  EXPECT_TRUE(InitializerRegistry::InitializeAll(PropList())) << "deadlocked";
+  ErrorManager::SetExceptionHandler(previousHandler);
+  InitializerRegistry::SetRunWaitLimit(previousLimit);
+  EXPECT_EQ(1, reports);
   InitializerRegistry::TerminateAll();
-  EXPECT_EQ((std::vector<std::string>{"init Slow", "term Slow"}), sLog);
+  EXPECT_EQ((std::vector<std::string>{"init Slow", "init Waiter", "term Waiter"}), sLog);
 }
 
 }  // namespace

@@ -84,10 +84,11 @@ TEST_F(MainThreadTest, AThrowingCallLeavesTheRestInFrontAndWakesTheLoopForThem) 
 }
 
 // A post is queued before its wakeup runs: a wakeup that fails must not make
-// the post look failed (a poster retrying would deliver twice). And of two
-// integrations, the newer one built before the older one goes, the older
-// one's removal must leave the newer one's handler alone.
-TEST_F(MainThreadTest, WakeupsFailWithoutFailingThePostAndAreRemovedOnlyByTheirOwner) {
+// the post look failed (a poster retrying would deliver twice). Of two
+// integrations, the newest holds the wakeups whichever goes first: the newer
+// one's removal hands them back to the older one, still running, and the
+// older one's removal leaves the newer one's alone.
+TEST_F(MainThreadTest, WakeupsFailWithoutFailingThePostAndGoToTheNewestLiveOwner) {
   auto adaptor = RegisterCurrentThreadAsMainThread();
   int exceptions = 0, older = 0, newer = 0;
   auto previous = kivcore::config::ErrorManager::SetExceptionHandler([&exceptions](std::exception_ptr) { ++exceptions; });
@@ -99,10 +100,15 @@ TEST_F(MainThreadTest, WakeupsFailWithoutFailingThePostAndAreRemovedOnlyByTheirO
   kivcore::config::ErrorManager::SetExceptionHandler(previous);
   adaptor->SetWakeupHandler([&newer] { ++newer; }, &newer);
   EXPECT_EQ(1, newer) << "installed while calls were queued";
-  EXPECT_FALSE(adaptor->RemoveWakeupHandler(&older));
+  EXPECT_TRUE(adaptor->RemoveWakeupHandler(&newer));
+  EXPECT_EQ(3, older) << "handed back while calls were queued";
   adaptor->RunPendingCalls();
+  adaptor->SetWakeupHandler([&newer] { ++newer; }, &newer);
+  EXPECT_TRUE(adaptor->RemoveWakeupHandler(&older));
+  EXPECT_FALSE(adaptor->RemoveWakeupHandler(&older));
   Queue("c");
   EXPECT_EQ(2, newer);
+  EXPECT_EQ(3, older);
   EXPECT_TRUE(adaptor->RemoveWakeupHandler(&newer));
   adaptor->RunPendingCalls();
   EXPECT_FALSE(adaptor->WaitForPendingCalls(0));
@@ -113,7 +119,7 @@ TEST_F(MainThreadTest, WakeupsFailWithoutFailingThePostAndAreRemovedOnlyByTheirO
   EXPECT_TRUE(adaptor->WaitForPendingCalls(-1));
   late.join();
   EXPECT_EQ(2, newer);
-  EXPECT_EQ(2, older);
+  EXPECT_EQ(3, older);
   adaptor->RunPendingCalls();
   EXPECT_EQ("abcd", mLog);
 }

@@ -140,6 +140,25 @@ TEST(SmallBlockAllocatorThreads, ThreadsNeverShareABlockAndTheirCountsOutliveThe
   for (const Stamped& s : leftOver[0]) EXPECT_TRUE(DisposeIntact(s));
   EXPECT_EQ(0, damaged.load());
   ExpectCounts(before, 0, 0, made);
+
+  // Two threads free each other's blocks while the counts are read: a read
+  // may see a disposal and not its allocation, yet never a count below zero.
+  std::atomic<void*> slots[2] = {};
+  std::atomic<int> finished{0};
+  platform_test::ThreadGroup pair;
+  for (int t = 0; t < 2; ++t)
+    pair.Start([&, t] {
+      for (int i = 0; i < 100000; ++i) {
+        if (void* mine = slots[t].exchange(SmallBlockAllocator::Allocate(32))) SmallBlockAllocator::Dispose(mine, 32);
+        if (void* other = slots[1 - t].exchange(nullptr)) SmallBlockAllocator::Dispose(other, 32);
+      }
+      finished.fetch_add(1);
+    });
+  std::size_t most = 0;
+  while (finished < 2) most = std::max(most, SmallBlockAllocator::GetStatistics().blocksInUse);  // they never wait
+  pair.JoinAll();
+  for (auto& slot : slots) SmallBlockAllocator::Dispose(slot.load(), 32);
+  EXPECT_LT(most, before.blocksInUse + 64) << "a count below zero wrapped";
 }
 
 std::atomic<void*> sLateBlock{nullptr};

@@ -144,9 +144,11 @@ TARN_MESSAGING_API void PostMessageToUIThread(const ImmutableString& inStationID
 /// std::bad_alloc when storage is out; nothing is kept then.
 TARN_MESSAGING_API void PostMessageAtIdleTime(const ImmutableString& inStationID, const Message& inMessage);
 
-/// Runs every pending call of the main thread now; meant for the main thread.
-/// From inside a handler of a posted message, first runs the posts the outer
-/// run has not reached. Does nothing while no main thread is registered.
+/// Runs every pending call of the main thread now. From inside a handler of
+/// a posted message, first runs the posts the outer run has not reached. Does
+/// nothing while no main thread is registered.
+/// Precondition: called on the main thread; otherwise a contract violation,
+/// and nothing runs: the posts stay queued for the main thread.
 TARN_MESSAGING_API void FlushPostedMessagesOnUIThread();
 
 }  // namespace StationUtils

@@ -4,6 +4,7 @@
 #include "ContractViolation.h"
 
 #include <csignal>
+#include <cstddef>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -29,14 +30,25 @@ DialogState& State() {
 }
 
 // The last violation seen on this thread, until ThrowError or
-// TakeLastContractViolation takes it.
+// TakeLastContractViolation takes it. Plain characters, so that it has no
+// destructor: the main thread's thread_local objects with destructors are
+// destroyed before static objects are, whose destructors may still report
+// (the last Terminate made from one). Longer texts are cut.
 struct RecordedViolation {
-  detail::ContractViolation violation;
-  bool recorded = false;
+  char condition[512];
+  char function[256];
+  char file[512];
+  int line;
+  bool recorded;
 };
 thread_local RecordedViolation tLast;
 
-const char* OrEmpty(const char* inText) noexcept { return inText != nullptr ? inText : ""; }
+template <std::size_t kSize>
+void CopyCut(char (&outText)[kSize], const char* inText) noexcept {
+  const std::size_t length = inText != nullptr ? strnlen(inText, kSize - 1) : 0;
+  std::memcpy(outText, inText != nullptr ? inText : "", length);
+  outText[length] = '\0';
+}
 
 }  // namespace
 
@@ -53,10 +65,10 @@ ContractDialogHandler SetContractDialogHandler(ContractDialogHandler inHandler) 
 
 bool BreakAfterContractDialog(const char* inCondition, const char* inFile, const char* inFunction, int inLine) {
   RecordedViolation& last = tLast;
-  last.violation.condition.assign(OrEmpty(inCondition));
-  last.violation.function.assign(OrEmpty(inFunction));
-  last.violation.file.assign(OrEmpty(inFile));
-  last.violation.line = inLine;
+  CopyCut(last.condition, inCondition);
+  CopyCut(last.function, inFunction);
+  CopyCut(last.file, inFile);
+  last.line = inLine;
   last.recorded = true;
 
   HandlerPtr handler;
@@ -65,7 +77,14 @@ bool BreakAfterContractDialog(const char* inCondition, const char* inFile, const
     std::lock_guard<std::mutex> lock(state.mutex);
     handler = state.handler;
   }
-  return handler ? (*handler)(inCondition, inFile, inFunction, inLine) : false;
+  try {
+    return handler ? (*handler)(inCondition, inFile, inFunction, inLine) : false;
+  } catch (...) {
+    // No ThrowError follows to take it, and a later, unrelated error must
+    // not name it.
+    last.recorded = false;
+    throw;
+  }
 }
 
 bool IsDebuggerAttached() {
@@ -100,7 +119,10 @@ bool detail::TakeContractViolation(ContractViolation& outViolation) {
   RecordedViolation& last = tLast;
   if (!last.recorded) return false;
   last.recorded = false;
-  outViolation = std::move(last.violation);
+  outViolation.condition = last.condition;
+  outViolation.function = last.function;
+  outViolation.file = last.file;
+  outViolation.line = last.line;
   return true;
 }
 

@@ -6,12 +6,22 @@
 #include <boost/uuid/uuid.hpp>
 
 #include <algorithm>
+#include <type_traits>
 
 namespace kivcore::utility {
 
 Guid Guid::CreateUnique() {
-  static thread_local boost::uuids::random_generator generator;
-  const boost::uuids::uuid id = generator();
+  using Generator = boost::uuids::random_generator;
+  boost::uuids::uuid id;
+  // Kept per thread only while it has no destructor (the operating system's
+  // generator): a later thread_local or thread-specific-data destructor may
+  // still make identifiers, after a destructor would have run.
+  if constexpr (std::is_trivially_destructible<Generator>::value) {
+    static thread_local Generator generator;
+    id = generator();
+  } else {
+    id = Generator()();
+  }
   Guid guid;
   std::copy(id.begin(), id.end(), guid.mBytes.begin());
   return guid;

@@ -1,17 +1,21 @@
 // The initializer registry: registrars enrol entries at load time, the host
 // runs them with InitializeAll and TerminateAll.
 //
-// Two locks. gRunMutex serialises InitializeAll and TerminateAll against
-// each other and is held while init and terminate functions run; it is
-// recursive so that such a function may itself call InitializeAll. The
-// registry's data mutex guards the entry list and is never held while a
-// function runs, so a function may construct or destroy registrars (a
-// library loaded or unloaded during start-up).
+// One mutex guards the entry list and the run: which thread is running
+// InitializeAll or TerminateAll, and how deeply nested. It is never held
+// while an init or terminate function runs, so a function may construct or
+// destroy registrars (a library loaded or unloaded during start-up) and call
+// InitializeAll again on its own thread. A call on another thread waits for
+// the run to end, for at most the wait limit.
+#include <kivcore/Error.h>
 #include <kivcore/InitializerRegistry.h>
 
 #include <algorithm>
+#include <condition_variable>
 #include <exception>
 #include <mutex>
+#include <stdexcept>
+#include <thread>
 #include <vector>
 
 namespace kivcore::config {
@@ -36,7 +40,10 @@ struct Registry {
   std::vector<Entry> entries;  // registration order; guarded by mutex
   unsigned long nextId = 1;    // guarded by mutex
   unsigned long nextInitOrder = 1;  // guarded by mutex
-  std::recursive_mutex runMutex;
+  std::thread::id runner;           // the thread running InitializeAll or TerminateAll; guarded by mutex
+  int runDepth = 0;                 // its calls under way, nested ones included; guarded by mutex
+  std::condition_variable runEnded;
+  std::chrono::milliseconds waitLimit = InitializerRegistry::kDefaultRunWaitLimit;  // guarded by mutex
 };
 
 // Never destroyed: registrars of other modules are destroyed at their unload,
@@ -87,6 +94,46 @@ Entry* FindById(Registry& ioRegistry, unsigned long inId) {
   return nullptr;
 }
 
+// Makes the calling thread the runner for its lifetime, once a run on
+// another thread has ended. A wait past the limit is reported to the error
+// manager and Entered() is false: an init function waiting for this thread
+// would otherwise never finish, nor this call.
+class RunScope {
+public:
+  RunScope(Registry& ioRegistry, const char* inOperation) : mRegistry(ioRegistry) {
+    std::unique_lock<std::mutex> lock(ioRegistry.mutex);
+    const std::thread::id self = std::this_thread::get_id();
+    const std::chrono::milliseconds limit = ioRegistry.waitLimit;
+    mEntered = ioRegistry.runner == self ||
+               ioRegistry.runEnded.wait_for(lock, limit, [&ioRegistry] { return ioRegistry.runDepth == 0; });
+    if (mEntered) {
+      ioRegistry.runner = self;
+      ++ioRegistry.runDepth;
+      return;
+    }
+    lock.unlock();
+    const std::string what = std::string("kivcore::config::InitializerRegistry::") + inOperation +
+                             " gave up after waiting " + std::to_string(limit.count()) +
+                             " ms for the run under way on another thread (an init or terminate function waiting "
+                             "for this thread?)";
+    ErrorManager::Get(false)->GuardedCall([&what]() -> int { throw std::runtime_error(what); });
+  }
+  ~RunScope() {
+    if (!mEntered) return;
+    std::lock_guard<std::mutex> lock(mRegistry.mutex);
+    if (--mRegistry.runDepth != 0) return;
+    mRegistry.runner = std::thread::id();
+    mRegistry.runEnded.notify_all();
+  }
+  RunScope(const RunScope&) = delete;
+  RunScope& operator=(const RunScope&) = delete;
+  bool Entered() const noexcept { return mEntered; }
+
+private:
+  Registry& mRegistry;
+  bool mEntered = false;
+};
+
 }  // namespace
 
 InitializerRegistrar::InitializerRegistrar(const char* inName, EInitializerContextFlags inFlags,
@@ -116,7 +163,8 @@ InitializerRegistrar::~InitializerRegistrar() {
 
 bool InitializerRegistry::InitializeAll(const proplist::PropList& inProperties) {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::recursive_mutex> run(registry.runMutex);
+  const RunScope run(registry, "InitializeAll");
+  if (!run.Entered()) return false;
   for (;;) {
     unsigned long id = 0;
     InitializerFunction init;
@@ -159,7 +207,8 @@ bool InitializerRegistry::InitializeAll(const proplist::PropList& inProperties) 
 
 void InitializerRegistry::TerminateAll() {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::recursive_mutex> run(registry.runMutex);
+  const RunScope run(registry, "TerminateAll");
+  if (!run.Entered()) return;
   std::exception_ptr firstFailure;
   for (;;) {
     TerminatorFunction terminate;
@@ -183,6 +232,16 @@ void InitializerRegistry::TerminateAll() {
     }
   }
   if (firstFailure) std::rethrow_exception(firstFailure);
+}
+
+std::chrono::milliseconds InitializerRegistry::SetRunWaitLimit(std::chrono::milliseconds inLimit) {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  const std::chrono::milliseconds previous = registry.waitLimit;
+  // Longer limits would overflow the clock's arithmetic in the wait.
+  registry.waitLimit = std::clamp<std::chrono::milliseconds>(inLimit, std::chrono::milliseconds(0),
+                                                             std::chrono::hours(24 * 365));
+  return previous;
 }
 
 bool InitializerRegistry::IsRegistered(const std::string& inName, unsigned int* outFlags) {

@@ -47,6 +47,12 @@ namespace {
 using Call = boost::function<void()>;
 using WakeupHandler = std::shared_ptr<const std::function<void()>>;
 
+// An installed wakeup handler and the tag it was installed with.
+struct WakeupOwner {
+  const void* owner;
+  WakeupHandler handler;
+};
+
 // pthread id of the registered main thread; 0 when none is. Constant-
 // initialized and trivially destructible, so the query works at any time.
 std::atomic<unsigned long> gMainThreadId{0};
@@ -68,8 +74,10 @@ struct MainThreadState {
   std::vector<Call> spare;             // owned by the outermost RunPendingCalls while spareInUse
   bool spareInUse = false;             // guarded by mutex
   int waiters = 0;                     // threads in WaitForPendingCalls; guarded by mutex
-  WakeupHandler wakeup;                // guarded by mutex
-  const void* wakeupOwner = nullptr;   // the tag wakeup was installed with; guarded by mutex
+  // The installed handlers, oldest first; the last one is called. When it is
+  // removed the newest remaining one takes over, so that an older integration
+  // still running is woken again. Guarded by mutex.
+  std::vector<WakeupOwner> wakeups;
   bool wakeupArmed = false;            // the queue's wakeup was called since its last take; guarded by mutex
   std::uint64_t armings = 0;           // times wakeupArmed was set; guarded by mutex
   boost::weak_ptr<AsyncEventLoopAdaptor> adaptor;  // the live adaptor, if any; guarded by mutex
@@ -92,10 +100,10 @@ std::size_t Waiting(const MainThreadState& inState) noexcept {
 // Arms the queue's wakeup if it needs one; returns the handler to call (after
 // the lock is released), or null. state.mutex held.
 WakeupHandler ArmWakeup(MainThreadState& ioState, std::uint64_t& outArming) {
-  if (ioState.wakeupArmed || !ioState.wakeup || Waiting(ioState) == 0) return nullptr;
+  if (ioState.wakeupArmed || ioState.wakeups.empty() || Waiting(ioState) == 0) return nullptr;
   ioState.wakeupArmed = true;
   outArming = ++ioState.armings;
-  return ioState.wakeup;
+  return ioState.wakeups.back().handler;
 }
 
 // Calls an armed wakeup handler, outside the lock. Its failure is not the
@@ -111,6 +119,39 @@ void CallWakeup(MainThreadState& ioState, const WakeupHandler& inHandler, std::u
   if (called != 0) return;
   std::lock_guard<std::mutex> lock(ioState.mutex);
   if (ioState.armings == inArming) ioState.wakeupArmed = false;
+}
+
+// Removes inOwner's handler, if any, and puts inHandler (unless empty) on top.
+// When the handler on top changes, calls already queued were announced to the
+// previous one, if to anyone, and the new one must hear of them. Returns
+// whether inOwner had a handler.
+bool ReplaceWakeupHandler(MainThreadState& ioState, const void* inOwner, WakeupHandler inHandler) {
+  WakeupHandler removed;
+  WakeupHandler wakeup;
+  std::uint64_t arming = 0;
+  bool found = false;
+  {
+    std::lock_guard<std::mutex> lock(ioState.mutex);
+    std::vector<WakeupOwner>& owners = ioState.wakeups;
+    // The one step that can fail (std::bad_alloc) comes before any change.
+    if (inHandler) owners.reserve(owners.size() + 1);
+    const WakeupHandler top = owners.empty() ? nullptr : owners.back().handler;
+    for (auto it = owners.begin(); it != owners.end(); ++it) {
+      if (it->owner != inOwner) continue;
+      removed = std::move(it->handler);
+      owners.erase(it);
+      found = true;
+      break;
+    }
+    if (inHandler) owners.push_back(WakeupOwner{inOwner, std::move(inHandler)});
+    if ((owners.empty() ? nullptr : owners.back().handler) != top) {
+      ioState.wakeupArmed = false;
+      wakeup = ArmWakeup(ioState, arming);
+    }
+  }
+  CallWakeup(ioState, wakeup, arming);
+  // The removed handler is destroyed here, outside the lock.
+  return found;
 }
 
 // The innermost run on this thread. A run nested in it (a call that runs
@@ -281,33 +322,11 @@ void AsyncEventLoopAdaptor::SetWakeupHandler(std::function<void()> inHandler) {
 void AsyncEventLoopAdaptor::SetWakeupHandler(std::function<void()> inHandler, const void* inOwner) {
   WakeupHandler handler;
   if (inHandler) handler = std::make_shared<const std::function<void()>>(std::move(inHandler));
-  MainThreadState& state = State();
-  WakeupHandler wakeup;
-  std::uint64_t arming = 0;
-  {
-    std::lock_guard<std::mutex> lock(state.mutex);
-    state.wakeup.swap(handler);
-    state.wakeupOwner = inOwner;
-    // Calls already queued were announced to the previous handler, if to
-    // anyone; the new one must hear of them.
-    state.wakeupArmed = false;
-    wakeup = ArmWakeup(state, arming);
-  }
-  CallWakeup(state, wakeup, arming);
-  // The previous handler is destroyed here, outside the lock.
+  (void)ReplaceWakeupHandler(State(), inOwner, std::move(handler));
 }
 
 bool AsyncEventLoopAdaptor::RemoveWakeupHandler(const void* inOwner) {
-  MainThreadState& state = State();
-  WakeupHandler handler;
-  {
-    std::lock_guard<std::mutex> lock(state.mutex);
-    if (!state.wakeup || state.wakeupOwner != inOwner) return false;
-    state.wakeup.swap(handler);
-    state.wakeupOwner = nullptr;
-    state.wakeupArmed = false;
-  }
-  return true;
+  return ReplaceWakeupHandler(State(), inOwner, nullptr);
 }
 
 std::size_t AsyncEventLoopAdaptor::PendingCallCount() const {

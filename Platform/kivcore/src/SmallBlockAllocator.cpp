@@ -428,7 +428,11 @@ SmallBlockAllocator::Statistics SmallBlockAllocator::GetStatistics() {
     disposals += t->disposals.load(std::memory_order_relaxed);
     bytes += t->bytes.load(std::memory_order_relaxed);
   }
-  return Statistics{static_cast<std::size_t>(allocations - disposals), static_cast<std::size_t>(bytes), allocations};
+  // Each record is read while its thread may go on counting, so a disposal
+  // can be seen without the allocation another thread made of its block:
+  // the figures are clamped at zero rather than wrapped.
+  return Statistics{allocations > disposals ? static_cast<std::size_t>(allocations - disposals) : 0,
+                    bytes > 0 ? static_cast<std::size_t>(bytes) : 0, allocations};
 }
 
 void SmallBlockAllocator::SetFailAfter(long long inCount) {

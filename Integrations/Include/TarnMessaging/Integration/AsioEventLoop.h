@@ -39,12 +39,13 @@
 /// Ownership: the object refers to the io_context and does not own it; the
 /// io_context must outlive the object.
 ///
-/// Replacement and destruction: the main thread's queue has one wakeup
-/// handler for the whole process, and the newest integration (of any kind)
-/// holds it. Building a new one before the old one is destroyed
-/// (`loop = std::make_unique<AsioEventLoop>(other)`) moves every later wakeup
-/// to the new one, which is woken at once for calls already queued; the old
-/// one's destructor leaves the new one's handler in place. The destructor runs
+/// Replacement and destruction: the newest live integration (of any kind)
+/// gets the main thread's wakeups. Building a new one before the old one is
+/// destroyed (`loop = std::make_unique<AsioEventLoop>(other)`) moves every
+/// later wakeup to the new one, which is woken at once for calls already
+/// queued; the old one's destructor leaves the new one's handler in place,
+/// and the new one's destructor, if it goes first, hands the wakeups back to
+/// the old one. The destructor runs
 /// on the calling (main) thread every call still queued, and the follow-ups
 /// those calls post, until the queue is empty; a handler that keeps re-posting
 /// is cut off after PendingCallRunner::kDrainPasses runs, and what it posted
@@ -60,6 +61,7 @@
 #include <boost/asio/post.hpp>
 #include <boost/asio/steady_timer.hpp>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdint>
 #include <memory>
@@ -74,7 +76,8 @@ namespace Tarn::Integration {
 /// Construct and destroy on the main thread after Tarn::Messaging::Initialize
 /// and before the last Tarn::Messaging::Terminate; run the io_context on the
 /// main thread only. The io_context is not owned and must outlive this
-/// object. A newer integration takes the wakeups over from this one.
+/// object. A newer integration takes the wakeups over from this one while it
+/// lives.
 class AsioEventLoop {
 public:
   /// Installs the wakeup handler and, when calls are already pending, posts
@@ -129,7 +132,12 @@ private:
     void ArmIdleCheck(std::chrono::milliseconds inDelay) override {
       if (!mIdleTimer) return;
       const std::uint64_t generation = ++mIdleGeneration;
-      mIdleTimer->expires_after(inDelay);
+      // Clamped to what the clock can hold, as GLib and Qt clamp to their
+      // timers' range: a longer delay would overflow and fire at once.
+      using std::chrono::steady_clock;
+      const steady_clock::time_point now = steady_clock::now();
+      const auto room = std::chrono::duration_cast<std::chrono::milliseconds>(steady_clock::time_point::max() - now);
+      mIdleTimer->expires_at(now + std::min(inDelay, room));
       std::shared_ptr<Runner> self = std::static_pointer_cast<Runner>(shared_from_this());
       auto executor = mIdleTimer->get_executor();
       mIdleTimer->async_wait([self, generation, executor](const boost::system::error_code& inError) {

@@ -46,11 +46,12 @@
 /// the object's internals, so a pending call may destroy the GLibEventLoop
 /// while its source is dispatching.
 ///
-/// Replacement and destruction: the main thread's queue has one wakeup
-/// handler for the whole process, and the newest integration (of any kind)
-/// holds it. Building a new one before the old one is destroyed moves every
-/// later wakeup to the new one, which is woken at once for calls already
-/// queued; the old one's destructor leaves the new one's handler in place. The
+/// Replacement and destruction: the newest live integration (of any kind)
+/// gets the main thread's wakeups. Building a new one before the old one is
+/// destroyed moves every later wakeup to the new one, which is woken at once
+/// for calls already queued; the old one's destructor leaves the new one's
+/// handler in place, and the new one's destructor, if it goes first, hands
+/// the wakeups back to the old one. The
 /// destructor destroys the sources it attached that have not run yet, then
 /// runs on the calling (main) thread every call still queued, and the
 /// follow-ups those calls post, until the queue is empty; a handler that keeps
@@ -82,7 +83,7 @@ namespace Tarn::Integration {
 /// Construct and destroy on the main thread after Tarn::Messaging::Initialize
 /// and before the last Tarn::Messaging::Terminate; iterate the context on the
 /// main thread only. Holds a reference on the context while it lives. A newer
-/// integration takes the wakeups over from this one.
+/// integration takes the wakeups over from this one while it lives.
 class GLibEventLoop {
 public:
   /// Installs the wakeup handler for inContext (null: the global default
@@ -155,6 +156,10 @@ private:
 
     void PostRun() override {
       std::lock_guard<std::mutex> lock(mSourcesMutex);
+      // A source not yet dispatched runs this batch too: it takes the whole
+      // queue. Without this, a context nobody iterates while the main thread
+      // flushes would gather one source per batch.
+      if (!mSources.empty()) return;
       // The steps that can throw come before the source exists.
       mSources.reserve(mSources.size() + 1);
       auto reference = std::make_unique<SourceReference>();

@@ -22,8 +22,10 @@
 /// taken (by FlushPostedMessagesOnUIThread, say) returns at once.
 ///
 /// Replacement and destruction: the wakeup handler is tagged with the
-/// runner, and Uninstall removes only its own, so an integration built before
-/// the one it replaces is destroyed keeps every wakeup. Installing a handler
+/// runner, and the newest installed runner gets the wakeups. Uninstall removes
+/// only its own: destroying the newest hands the wakeups back to the newest
+/// one left (woken at once for calls already queued), destroying an older
+/// one changes nothing for the newest. Installing a handler
 /// while calls are queued wakes the new loop for them. Uninstall runs the
 /// calls still queued on the main thread until the queue is empty, follow-ups
 /// posted by those calls included, for at most kDrainPasses runs; calls a
@@ -52,6 +54,7 @@
 #include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationUtils.h>
 
+#include <kivcore/Debug.h>
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
@@ -60,6 +63,7 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <cstdio>
 #include <memory>
 #include <mutex>
 #include <stdexcept>
@@ -100,9 +104,9 @@ public:
   /// Installs the wakeup handler on the main thread's adaptor and, when calls
   /// are already queued, schedules a run for them.
   /// Precondition: a main thread is registered (Tarn::Messaging::Initialize
-  /// has run); otherwise throws std::logic_error and installs nothing. The
-  /// adaptor holds one wakeup handler for the whole process: this replaces
-  /// any handler installed before.
+  /// has run); otherwise throws std::logic_error and installs nothing. This
+  /// runner takes the wakeups over from any installed before, until it is
+  /// uninstalled.
   void Install() {
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
@@ -129,10 +133,15 @@ public:
   /// calls go to the error manager. A run still queued in the host loop does
   /// nothing afterwards. Calls are run only on the main thread; after the last
   /// Tarn::Messaging::Terminate there is no adaptor left, and the handler,
-  /// unreachable, stays inert.
+  /// unreachable, stays inert. Called off the main thread while one is
+  /// registered (outside the contract), it shows the contract dialog.
   void Uninstall() noexcept {
     const boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor =
         kivcore::threads::GetRegisteredMainThread();
+    // Elsewhere the idle check is disarmed while the main thread's handlers
+    // may use it, and the final drain is skipped: the host is told, and the
+    // rest goes on as well as it can.
+    if (adaptor && !kivcore::threads::CurrentThreadIsMainThread()) ReportOffMainThread();
     if (adaptor) adaptor->RemoveWakeupHandler(this);
     DisarmIdleCheck();
     {
@@ -234,6 +243,21 @@ protected:
   virtual void DisarmIdleCheck() noexcept {}
 
 private:
+  // The contract check's report: the dialog, then the error. A destructor
+  // has no caller to throw to, so what the error handler throws is printed.
+  static void ReportOffMainThread() noexcept {
+    try {
+      kivcore::debug::BreakAfterContractDialog("kivcore::threads::CurrentThreadIsMainThread()", __FILE__,
+                                               "Tarn::Integration::PendingCallRunner::Uninstall", __LINE__);
+      const kivcore::config::ReplacementValue none;
+      kivcore::config::ThrowError(0, "$$$/kivcore/utility/Error/Contract/InputContractViolation=An input contract "
+                                  "violation has occurred!", 105u, 25, true, none, none, none, none);
+    } catch (const std::exception& inError) {
+      std::fprintf(stderr, "Tarn::Integration: %s\n", inError.what());
+    } catch (...) {
+    }
+  }
+
   // Armed first, so that an exception leaving the broadcast, or a listener
   // that destroys the integration, leaves the source in a known state.
   int ArmAndBroadcast() {

@@ -48,9 +48,9 @@
 /// receiver then deletes itself once the handler is done, as deleteLater
 /// would.
 ///
-/// Replacement and destruction: as for the other integrations, the newest one
-/// holds the process's one wakeup handler. The destructor drops the events
-/// and the timer of its receiver, then runs on the calling (main) thread every
+/// Replacement and destruction: as for the other integrations, the newest live
+/// one gets the wakeups. The destructor drops the events and the timer of its
+/// receiver, then runs on the calling (main) thread every
 /// call still queued, and the follow-ups those calls post, until the queue is
 /// empty or PendingCallRunner::kDrainPasses runs have passed. Nothing posted
 /// before the destructor returns is lost, and nothing is delivered twice.
@@ -80,7 +80,7 @@ namespace Tarn::Integration {
 /// Construct and destroy on the QCoreApplication's thread, which is the main
 /// thread, after Tarn::Messaging::Initialize and before the last
 /// Tarn::Messaging::Terminate. A newer integration takes the wakeups over
-/// from this one.
+/// from this one while it lives.
 class QtEventLoop {
 public:
   /// Installs the wakeup handler and, when calls are already pending, posts

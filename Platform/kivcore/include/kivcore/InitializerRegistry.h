@@ -13,14 +13,22 @@
 ///   kivcore::config::InitializerRegistry::TerminateAll();
 /// @endcode
 ///
-/// Threading: registration, InitializeAll and TerminateAll are serialised by
-/// one lock; the init and terminate functions run with it released.
+/// Threading: registration and the runs are serialised by one lock, which is
+/// released while init and terminate functions run. One thread at a time
+/// runs InitializeAll or TerminateAll; an init or terminate function may call
+/// them again on its own thread. A call on another thread waits for the run
+/// under way to end, so that it does not answer before the libraries are up;
+/// when that takes longer than the run-wait limit (SetRunWaitLimit), the
+/// wait is reported to the error manager and the call gives up. So an init
+/// function that hands work to a thread calling InitializeAll, and waits for
+/// it, gets false from that thread after the limit instead of a deadlock.
 #pragma once
 
 #include <kivcore/Export.h>
 #include <kivcore/PropList.h>
 
 #include <array>
+#include <chrono>
 #include <functional>
 #include <string>
 
@@ -62,10 +70,17 @@ public:
   /// Stops at the first that returns false or throws, and returns false then;
   /// false too when initializers depend on one another in a cycle. An init
   /// function may call it: entries waiting for an init still running are left
-  /// to the call that runs it, and do not count as a failure.
+  /// to the call that runs it, and do not count as a failure. False also when
+  /// its wait for a run on another thread passed the limit.
   static bool InitializeAll(const proplist::PropList& inProperties);
   /// Runs the terminate function of every initialized entry, in reverse order.
+  /// Runs none when its wait for a run on another thread passed the limit.
   static void TerminateAll();
+  /// How long a call waits for a run on another thread before giving up.
+  static constexpr std::chrono::milliseconds kDefaultRunWaitLimit{10000};
+  /// Sets that limit, clamped to between zero and a year; returns the
+  /// previous one.
+  static std::chrono::milliseconds SetRunWaitLimit(std::chrono::milliseconds inLimit);
   /// Whether an initializer of this name is registered, and its flags.
   static bool IsRegistered(const std::string& inName, unsigned int* outFlags = nullptr);
 };

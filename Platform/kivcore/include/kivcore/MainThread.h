@@ -64,20 +64,24 @@ public:
   /// without limit.
   bool WaitForPendingCalls(int inTimeoutMilliseconds);
 
-  /// Installs the process's one wakeup handler, replacing any other: called
-  /// on the queuing thread when a call is queued into an empty batch (see
-  /// Wakeups above), so that a host event loop can schedule RunPendingCalls.
-  /// Called at once, on this thread, when calls are already queued. inOwner
-  /// tags the handler for RemoveWakeupHandler. An empty handler removes it.
+  /// Installs a wakeup handler on top of those installed before: the newest
+  /// one is called when a call is queued into an empty batch (see Wakeups
+  /// above), on the queuing thread, so that a host event loop can schedule
+  /// RunPendingCalls. Called at once, on this thread, when calls are already
+  /// queued. inOwner tags the handler: a handler installed before with the
+  /// same tag is removed, and an empty handler only removes it.
   /// @{
   void SetWakeupHandler(std::function<void()> inHandler);
   void SetWakeupHandler(std::function<void()> inHandler, const void* inOwner);
   /// @}
 
-  /// Removes the wakeup handler only if it is the one installed with
-  /// inOwner, so that an integration going away leaves alone the handler of
-  /// one that replaced it. Returns whether it removed it. A handler call
-  /// already under way on another thread may still finish after this returns.
+  /// Removes the wakeup handler installed with inOwner, wherever it is among
+  /// the installed ones. Removing the newest hands the wakeups back to the
+  /// newest one left, which is called at once when calls are queued: an
+  /// integration going away leaves an older one still running woken, and one
+  /// that replaced it alone. Returns whether inOwner had a handler. A handler
+  /// call already under way on another thread may still finish after this
+  /// returns.
   bool RemoveWakeupHandler(const void* inOwner);
 
   /// Number of calls queued and not yet taken by RunPendingCalls.

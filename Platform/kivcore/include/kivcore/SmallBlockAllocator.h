@@ -51,7 +51,8 @@ public:
     std::uint64_t allocations;   ///< successful Allocate calls since load
   };
   /// Process-wide figures, summed over every thread; exact when no other
-  /// thread allocates meanwhile.
+  /// thread allocates meanwhile, and otherwise off by the blocks allocated
+  /// or disposed of during the call, never below zero.
   static Statistics GetStatistics();
 
   /// Fault injection: the next inCount allocations succeed, then every
