@@ -5,7 +5,9 @@
 // cache, with no lock and no atomic read-modify-write. An empty thread list
 // is refilled with a batch from the class's shared pool; a list that grows
 // past two batches hands one batch back. The pool carves new blocks from
-// chunks taken from malloc, which are never returned. Larger requests go to
+// chunks taken from the heap, aligned to their size so that a block's chunk
+// is its address rounded down; ReleaseFreeChunks returns the chunks whose
+// every block is back in the pool (after a burst). Larger requests go to
 // malloc and free.
 //
 // Everything global here is trivially destructible and constant-initialized,
@@ -37,9 +39,14 @@
 #include <algorithm>
 #include <array>
 #include <atomic>
+#include <cstdint>
 #include <cstdlib>
 #include <mutex>
 #include <new>
+#include <unordered_map>
+#include <vector>
+
+#include <malloc.h>
 
 #include <pthread.h>
 
@@ -101,7 +108,7 @@ Block* PopFromPool(Pool& ioPool, std::size_t inBlockSize) noexcept {
     return block;
   }
   if (ioPool.carveNext == nullptr || static_cast<std::size_t>(ioPool.carveEnd - ioPool.carveNext) < inBlockSize) {
-    auto* chunk = static_cast<Chunk*>(std::malloc(kChunkSize));
+    auto* chunk = static_cast<Chunk*>(std::aligned_alloc(kChunkSize, kChunkSize));
     if (chunk == nullptr) return nullptr;
     chunk->previous = ioPool.chunks;
     ioPool.chunks = chunk;
@@ -429,6 +436,48 @@ SmallBlockAllocator::Statistics SmallBlockAllocator::GetStatistics() {
     bytes += t->bytes.load(std::memory_order_relaxed);
   }
   return Statistics{static_cast<std::size_t>(allocations - disposals), static_cast<std::size_t>(bytes), allocations};
+}
+
+void SmallBlockAllocator::ReleaseFreeChunks() noexcept {
+  if (kBypassPools) return;
+  bool released = false;
+  for (std::size_t c = 0; c < kClassCount; ++c) {
+    Pool& pool = gPools[c];
+    const std::size_t blockSize = ClassBlockSize(c);
+    const std::size_t perChunk = (kChunkSize - kChunkHeader) / blockSize;
+    std::vector<Chunk*> gone;
+    try {
+      std::lock_guard<std::mutex> lock(pool.mutex);
+      // The newest chunk is still being carved: it stays.
+      if (pool.freeList == nullptr || pool.chunks == nullptr || pool.chunks->previous == nullptr) continue;
+      std::unordered_map<std::uintptr_t, std::size_t> freeBlocks;
+      for (const Block* block = pool.freeList; block != nullptr; block = block->next)
+        ++freeBlocks[reinterpret_cast<std::uintptr_t>(block) & ~(kChunkSize - 1)];
+      for (Chunk** link = &pool.chunks->previous; *link != nullptr;) {
+        const auto found = freeBlocks.find(reinterpret_cast<std::uintptr_t>(*link));
+        if (found == freeBlocks.end() || found->second != perChunk) {
+          link = &(*link)->previous;
+          continue;
+        }
+        found->second = 0;  // marks the chunk's blocks for unlinking
+        gone.push_back(*link);
+        *link = (*link)->previous;
+      }
+      if (gone.empty()) continue;
+      for (Block** link = &pool.freeList; *link != nullptr;) {
+        const auto found = freeBlocks.find(reinterpret_cast<std::uintptr_t>(*link) & ~(kChunkSize - 1));
+        if (found->second == 0) *link = (*link)->next;
+        else link = &(*link)->next;
+      }
+    } catch (...) {
+      // No storage for the tallies: the chunks stay, unchanged.
+      continue;
+    }
+    for (Chunk* chunk : gone) std::free(chunk);
+    released = true;
+  }
+  // Freed chunks amid the heap go back to the system only when trimmed.
+  if (released) ::malloc_trim(0);
 }
 
 void SmallBlockAllocator::SetFailAfter(long long inCount) {
