@@ -7,8 +7,7 @@
 // lock and runs the taken calls with the lock released. The two vectors trade
 // places on every run and keep their capacity, so a steady stream of calls
 // allocates nothing beyond the copies of the calls themselves; a run that
-// leaves the queue drained gives back capacity beyond kKeptCallStorage, so a
-// burst does not keep its storage.
+// drains a burst gives the burst's storage back, so that it is not kept.
 //
 // Invariants, each kept within one hold of the lock:
 // - while a wakeup handler is installed, a non-empty queue has had exactly one
@@ -25,6 +24,7 @@
 
 #include <pthread.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
@@ -62,6 +62,9 @@ struct MainThreadState {
   // it reports; guarded by mutex.
   std::size_t highWaterMark = kDefaultPendingCallHighWaterMark;
   bool highWaterArmed = true;
+  // Calls taken by recent runs, each run counting half the one before it:
+  // storage a steady stream needs is kept; guarded by mutex.
+  std::size_t recentlyTaken = 0;
   boost::weak_ptr<AsyncEventLoopAdaptor> adaptor;  // the live adaptor, if any; guarded by mutex
 };
 
@@ -214,12 +217,16 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
       const std::size_t taken = run.calls.size();
       run.calls.clear();
       if (!usingSpare) return;
-      // A run that leaves the queue drained after a burst gives the burst's
-      // storage back rather than keep it as the spare.
+      // A run that leaves the queue drained after a burst (far more calls
+      // than recent runs took) gives the burst's storage back rather than
+      // keep it as the spare.
       std::vector<Call> released;
       {
         std::lock_guard<std::mutex> lock(state.mutex);
-        if (run.calls.capacity() > kKeptCallStorage && state.queue.size() < taken / 4) released.swap(run.calls);
+        const std::size_t capacity = run.calls.capacity();
+        if (capacity / 4 > std::max(state.recentlyTaken, kKeptCallStorage) && state.queue.size() < taken / 4)
+          released.swap(run.calls);
+        state.recentlyTaken = (state.recentlyTaken + taken) / 2;
         state.spare.swap(run.calls);
         state.spareInUse = false;
       }

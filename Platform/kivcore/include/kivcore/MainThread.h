@@ -44,11 +44,12 @@
 /// queued call one comparison; the census walks the queue once, under the
 /// queue's lock, when the report is made.
 ///
-/// Storage: a run that leaves the queue drained (under a quarter of what the
-/// run took) gives back the queue's storage beyond kKeptCallStorage calls,
+/// Storage: a run that takes a burst (storage for more than four times what
+/// recent runs took, and than kKeptCallStorage calls) and leaves the queue
+/// drained (under a quarter of what it took) gives the burst's storage back,
 /// and the small-block chunks left wholly free (see
 /// SmallBlockAllocator::ReleaseFreeChunks), so a burst's memory goes back once
-/// the burst has been run.
+/// the burst has been run. A steady stream keeps the storage it needs.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -120,7 +121,7 @@ KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> GetRegisteredMainThread();
 constexpr std::size_t kDefaultPendingCallHighWaterMark = std::size_t{1} << 20;
 /// The key of the high-water report; the text follows the '='.
 constexpr const char* kPendingCallHighWaterKey = "$$$/kivcore/MainThread/PendingCallHighWater=";
-/// Queue storage a run keeps for the next ones, in calls.
+/// Queue storage, in calls, that a run keeps for the next ones in any case.
 constexpr std::size_t kKeptCallStorage = 4096;
 
 /// Sets the number of queued calls past which the queue is reported (0: never)
