@@ -97,8 +97,7 @@ std::atomic<PendingCallCensus> gCensus{nullptr};
 }
 
 // Reports a queue past its high-water mark; outside every lock of the queue.
-void ReportHighWater(const std::string& inText) noexcept {
-  if (inText.empty()) return;
+[[gnu::cold]] void ReportHighWater(const std::string& inText) noexcept {
   try {
     const std::string key = kPendingCallHighWaterKey + inText;
     config::ErrorManager::Get(false)->GuardedCall([&key] {
@@ -352,7 +351,7 @@ bool AsyncCallFromMainThread(boost::function<void()>&& inCall, unsigned int /*in
     }
   }
   CallWakeup(state, wakeup, arming);
-  ReportHighWater(highWater);
+  if (!highWater.empty()) ReportHighWater(highWater);
   return true;
 }
 
