@@ -36,10 +36,10 @@
 /// Queue and storage: posts wait in the main thread's queue of calls
 /// (kivcore/MainThread.h), which has no bound: each keeps its copy of the
 /// message until the main thread runs it. Workers that post while the main
-/// thread runs nothing hold memory for every post (4 million posts of a small
-/// message: about 550 MiB). A queue longer than its high-water mark
-/// (kivcore::threads::SetPendingCallHighWaterMark; 1,048,576 calls unless
-/// set) is reported once per burst through kivcore's ThrowError, with the key
+/// thread runs nothing hold memory for every post (4 million posts of a
+/// small message: 370 to 550 MiB, by its size). A queue longer than its
+/// high-water mark (kivcore::threads::SetPendingCallHighWaterMark; 1,048,576
+/// calls unless set) is reported once per burst through kivcore's ThrowError, with the key
 /// kivcore::threads::kPendingCallHighWaterKey followed by the count and the
 /// posts queued by station and message type, on the posting thread that
 /// passed the mark. Once the main thread has run a burst, the queue's storage

@@ -32,7 +32,7 @@
 /// Bound: none. A call queued while the main thread does not run its calls
 /// (a host loop that has stopped calling RunPendingCalls, or no main thread
 /// registered) stays queued, with everything it holds, until a run takes it;
-/// a million queued posts of a small message take well over 100 MiB. When a
+/// a million queued posts of a small message take 90 MiB or more. When a
 /// queued call makes the queue longer than the high-water mark (see
 /// SetPendingCallHighWaterMark), the queue is reported once, through
 /// ThrowError with the key kPendingCallHighWaterKey followed by a text that
