@@ -39,11 +39,11 @@
 /// thread runs nothing hold memory for every post (4 million posts of a
 /// small message: 370 to 550 MiB, by its size). A queue longer than its
 /// high-water mark (kivcore::threads::SetPendingCallHighWaterMark; 1,048,576
-/// calls unless set) is reported once per burst through kivcore's ThrowError, with the key
-/// kivcore::threads::kPendingCallHighWaterKey followed by the count and the
-/// posts queued by station and message type, on the posting thread that
-/// passed the mark. Once the main thread has run a burst, the queue's storage
-/// and the small blocks of the copies go back.
+/// calls unless set) is reported once per burst through kivcore's
+/// ThrowError, with the key kivcore::threads::kPendingCallHighWaterKey
+/// followed by the count and the posts queued by station and message type,
+/// on the posting thread that passed the mark. Once the main thread has run a
+/// burst, the queue's storage and the small blocks of the copies go back.
 ///
 /// Between lives: a post made while the library is down (after the last
 /// Tarn::Messaging::Terminate, before the next Initialize) is queued all the
