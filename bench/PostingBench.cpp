@@ -12,6 +12,10 @@
 //                        time from just before the post call to the start of
 //                        the handler, p50 and p99
 //   Alloc/Post/<case>    allocations per post, 10,000 posts delivered
+//   Burst/Tarn           two producers post 4,000,000 messages while the
+//                        main thread runs nothing, then it runs them all:
+//                        resident memory before, at the peak and once they
+//                        have run (MiB), and the high-water reports made
 //
 // Every message carries its producer and sequence number; after each run a
 // check proves that each was delivered exactly once.
@@ -22,10 +26,12 @@
 // to the second, for every peer alike.
 #include "BenchSupport.h"
 
+#include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
 #include <pthread.h>
 #include <sched.h>
+#include <unistd.h>
 
 #include <boost/asio/io_context.hpp>
 #include <boost/asio/post.hpp>
@@ -40,6 +46,7 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <cstdio>
 #include <deque>
 #include <functional>
 #include <mutex>
@@ -55,6 +62,7 @@ constexpr int kPostsPerProducer = 50000;
 constexpr int kLatencyPosts = 5000;
 constexpr auto kLatencyInterval = std::chrono::microseconds(100);  // 10,000 posts a second
 constexpr int kAllocPosts = 10000;
+constexpr int kBurstPosts = 4000000;
 // A run that takes longer than this has lost a message: it fails instead of
 // hanging.
 constexpr auto kRunLimit = std::chrono::seconds(30);
@@ -374,6 +382,50 @@ void AllocAsioPost(benchmark::State& ioState) {
       });
 }
 
+// The process's resident set, in MiB.
+double ResidentMiB() {
+  long pages = 0, resident = 0;
+  if (FILE* const statm = std::fopen("/proc/self/statm", "r")) {
+    if (std::fscanf(statm, "%ld %ld", &pages, &resident) != 2) resident = 0;
+    std::fclose(statm);
+  }
+  return static_cast<double>(resident) * static_cast<double>(sysconf(_SC_PAGESIZE)) / (1024.0 * 1024.0);
+}
+
+void Burst(benchmark::State& ioState) {
+  if (!VerifyMainThread(ioState)) return;
+  Tally tally;
+  TarnTallyListener listener(&tally);
+  Tarn::StationUtils::AddListener(BenchStationID(), &listener);
+  std::atomic<int> reports{0};
+  const std::string key = kivcore::threads::kPendingCallHighWaterKey;
+  const auto handler = kivcore::config::SetErrorHandler([&](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.compare(0, key.size(), key) == 0) ++reports;
+  });
+  for (auto _ : ioState) {
+    const double before = ResidentMiB();
+    std::thread producers[2];
+    for (std::thread& producer : producers) {
+      producer = std::thread([] {
+        for (int i = 0; i < kBurstPosts / 2; ++i)
+          Tarn::StationUtils::PostMessageToUIThread(BenchStationID(), PairMessage(kA, kB), false);
+      });
+    }
+    for (std::thread& producer : producers) producer.join();
+    const double peak = ResidentMiB();
+    Tarn::StationUtils::FlushPostedMessagesOnUIThread();
+    ioState.counters["rss_before_mib"] = before;
+    ioState.counters["rss_peak_mib"] = peak;
+    ioState.counters["rss_after_mib"] = ResidentMiB();
+    ioState.counters["small_blocks_in_use"] =
+        static_cast<double>(kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse);
+  }
+  kivcore::config::SetErrorHandler(handler);
+  Tarn::StationUtils::RemoveListener(BenchStationID(), &listener);
+  ioState.counters["high_water_reports"] = reports.load();
+  Verify(ioState, tally.mCalls == kBurstPosts, "a post of the burst was not delivered exactly once");
+}
+
 const bool sRegistered = [] {
   const std::pair<const char*, RunFunction> peers[] = {{"Tarn", &RunTarn},
                                                        {"Asio", &RunAsio},
@@ -401,6 +453,7 @@ const bool sRegistered = [] {
   once("Alloc/Post/TarnDeferredMain", [](benchmark::State& ioState) { AllocTarnPost(ioState, false, true); });
   once("Alloc/Post/TarnDeferredWorker", [](benchmark::State& ioState) { AllocTarnPost(ioState, true, false); });
   once("Alloc/Post/AsioWorker", &AllocAsioPost);
+  once("Burst/Tarn", &Burst);
   return true;
 }();
 

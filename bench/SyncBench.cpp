@@ -3,6 +3,8 @@
 //                          so the rate is deliveries per second
 //   Attach/<peer>/N        one handler attached and detached again while N
 //                          others stay attached; items are pairs
+//   DetachOldest/<peer>/N  N handlers attached, then detached oldest first;
+//                          items are detaches, timed alone
 //   Alloc/Delivery/<peer>  general-heap and small-block allocations per
 //                          delivery (1,000 broadcasts to 100 handlers after
 //                          a warm-up broadcast)
@@ -202,6 +204,27 @@ void Attach(benchmark::State& ioState) {
 }
 
 template <class Peer>
+void DetachOldest(benchmark::State& ioState) {
+  if (!VerifyMainThread(ioState)) return;
+  const auto count = static_cast<std::size_t>(ioState.range(0));
+  bool silent = true;
+  for (auto _ : ioState) {
+    ioState.PauseTiming();
+    {
+      Rig<Peer> rig(count);
+      ioState.ResumeTiming();
+      for (auto& handler : rig.mHandlers) rig.mPeer.Disconnect(handler);
+      ioState.PauseTiming();
+      rig.mPeer.Emit();
+      silent = silent && AllCalled(rig.mTallies, 0);
+    }
+    ioState.ResumeTiming();
+  }
+  if (Verify(ioState, silent, "a broadcast after the detaches reached a detached handler"))
+    ioState.SetItemsProcessed(static_cast<std::int64_t>(ioState.iterations() * count));
+}
+
+template <class Peer>
 void AllocDelivery(benchmark::State& ioState) {
   if (!VerifyMainThread(ioState)) return;
   Rig<Peer> rig(kAllocListeners);
@@ -253,6 +276,12 @@ void Register(const std::string& inName) {
         ->Arg(10)
         ->Arg(1000)
         ->MinTime(0.1);
+  if constexpr (kWithAttach)
+    benchmark::RegisterBenchmark(("DetachOldest/" + inName).c_str(), &DetachOldest<Peer>)
+        ->Arg(1000)
+        ->Arg(10000)
+        ->Arg(100000)
+        ->Iterations(1);
   if constexpr (kWithAllocs) {
     benchmark::RegisterBenchmark(("Alloc/Delivery/" + inName).c_str(), &AllocDelivery<Peer>)
         ->Iterations(1)

@@ -30,6 +30,10 @@ DELIVERY = [("Floor", "raw loop of virtual calls (floor)"),
 ATTACH = [("Signals2", "boost::signals2 connect + disconnect"), ("Sigc", "libsigc++ 3 connect + disconnect"),
           ("QtFunctor", "Qt 5 connect + disconnect, functor"), ("QtSlot", "Qt 5 connect + disconnect, slot"),
           ("TarnPlain", "Tarn AddListener + RemoveListener (Listener*)")]
+DETACH = [("Signals2", "boost::signals2 disconnect"), ("Sigc", "libsigc++ 3 disconnect"),
+          ("QtFunctor", "Qt 5 disconnect, functor"), ("QtSlot", "Qt 5 disconnect, slot"),
+          ("TarnPlain", "Tarn RemoveListener (Listener*)"), ("TarnTyped", "Tarn Registration::Reset (Subscribe)")]
+DETACH_SIZES = [1000, 10000, 100000]
 POSTING = [("Tarn", "Tarn PostMessageToUIThread + flush"), ("Asio", "boost::asio post + run"),
            ("MutexQueue", "std::mutex + std::deque + std::condition_variable"),
            ("Qt", "Qt 5 invokeMethod, Qt::QueuedConnection")]
@@ -130,6 +134,14 @@ def report(res, posting_runs):
                        fmt(ratio(res.ns(f"Attach/{k}/1000"), res.ns(f"Attach/{k}/10")))]
                       for k, label in ATTACH if res.has(f"Attach/{k}/10")]))
 
+    detaching = [(k, label) for k, label in DETACH if res.has(f"DetachOldest/{k}/1000")]
+    if detaching:
+        out.append("### N listeners detached oldest first: ns per detach\n")
+        out.append(table(["ns per detach"] + [f"N={n:,}" for n in DETACH_SIZES] + ["N=100,000 / N=1,000"],
+                         [[label] + [fmt_ns(res.ns(f"DetachOldest/{k}/{n}")) for n in DETACH_SIZES]
+                          + [fmt(ratio(res.ns(f"DetachOldest/{k}/100000"), res.ns(f"DetachOldest/{k}/1000")))]
+                          for k, label in detaching]))
+
     out.append("### Posting from worker threads to the main thread\n")
     rate = lambda r, k, p: r.get(f"Posting/{k}/{p}", "items_per_second")
     out.append(table(["posts per second (millions)", "P=1", "P=2", "P=1 / asio", "P=2 / asio"],
@@ -155,6 +167,13 @@ def report(res, posting_runs):
                          [[label, fmt(get(k, "posts_per_second") and get(k, "posts_per_second") / 1e6),
                            fmt(get(k, "main_thread_ms"), 1), fmt(get(k, "deliveries"), 0)]
                           for k, label in coalescing if res.has(f"Coalescing/{k}")]))
+
+    if res.has("Burst/Tarn"):
+        out.append("### 4,000,000 posts from 2 workers while the main thread runs nothing\n")
+        burst = lambda f: res.get("Burst/Tarn", f)
+        out.append(table(["resident memory (MiB)", "before", "at the peak", "once run", "high-water reports"],
+                         [["Tarn PostMessageToUIThread", fmt(burst("rss_before_mib"), 1), fmt(burst("rss_peak_mib"), 1),
+                           fmt(burst("rss_after_mib"), 1), fmt(burst("high_water_reports"), 0)]]))
 
     out.append("### Allocations\n")
     out.append(table(["per delivery (N=100)", "general-heap allocations", "small blocks"],

@@ -234,8 +234,28 @@ bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
   }
   // Running broadcasts serve only entries older than where they started, so
   // the newcomer waits for the next broadcast.
-  ++mNextSerial;
+  mNextSerial += 2;
   return true;
+}
+
+void BroadcasterCore::EraseAt(std::size_t inPosition) noexcept {
+  // Running broadcasts hold serials, not positions: neither erasing nor
+  // compacting moves anything they depend on. Both free storage and allocate
+  // none.
+  constexpr std::size_t kEraseSpan = 8;      // entries an erase may move
+  constexpr std::size_t kCompactFloor = 16;  // marked entries always allowed
+  if (mEntries.size() - inPosition <= kEraseSpan) {
+    mEntries.erase(mEntries.begin() + static_cast<std::ptrdiff_t>(inPosition));
+    return;
+  }
+  StoredEntry& stored = mEntries[inPosition];
+  stored.mEntry = ListenerEntry();
+  stored.mSerial |= kRemovedMark;
+  if (++mRemovedCount <= kCompactFloor || mRemovedCount * 2 <= mEntries.size()) return;
+  mEntries.erase(std::remove_if(mEntries.begin(), mEntries.end(),
+                                [](const StoredEntry& inStored) { return (inStored.mSerial & kRemovedMark) != 0; }),
+                 mEntries.end());
+  mRemovedCount = 0;
 }
 
 BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait,
@@ -261,9 +281,9 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
     found = mIndex.find(inListener);
   }
   if (found != mIndex.end()) {
-    // Running broadcasts hold serials, not positions: erasing moves nothing
-    // they depend on. Erasing frees storage and allocates none.
-    mEntries.erase(mEntries.begin() + static_cast<std::ptrdiff_t>(PositionOf(found->second)));
+    // Running broadcasts hold serials, not positions: erasing or marking
+    // moves nothing they depend on, and allocates nothing.
+    EraseAt(PositionOf(found->second));
     mIndex.erase(found);
   }
   if (inUnlink != nullptr) inUnlink->RemoveBroadcaster(mSelf);
@@ -392,7 +412,7 @@ bool BroadcasterCore::Contains(const ListenerEntry& inEntry) {
 
 bool BroadcasterCore::IsEmpty() {
   Locked lock(mMutex, "Broadcaster::HasListener");
-  return mEntries.empty();
+  return mEntries.size() == mRemovedCount;
 }
 
 void BroadcasterCore::Close() noexcept {
@@ -409,6 +429,7 @@ void BroadcasterCore::Close() noexcept {
     }
     mEntries.clear();
     mIndex.clear();
+    mRemovedCount = 0;
     mOwner = nullptr;
   }
 #ifndef NDEBUG
@@ -425,7 +446,7 @@ void BroadcasterCore::Close() noexcept {
 std::size_t BroadcasterCore::CountListeners(Broadcaster& inBroadcaster) {
   BroadcasterCore& core = *inBroadcaster.mCore;
   Locked lock(core.mMutex, "Broadcaster::CountListeners");
-  return core.mEntries.size();
+  return core.mEntries.size() - core.mRemovedCount;
 }
 
 namespace {
@@ -575,13 +596,19 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
           (position < count && mEntries[position].mSerial < frame.mNextBelow)) {
         position = PositionOf(frame.mNextBelow);
       }
-      if (position == 0) {
+      // Entries marked removed are passed over under the same hold.
+      const StoredEntry* next = nullptr;
+      while (position > 0) {
+        next = &mEntries[--position];
+        if ((next->mSerial & kRemovedMark) == 0) break;
+        next = nullptr;
+      }
+      if (next == nullptr) {
         Unlink(frame);
         scope.mLinked = false;
         mMutex.Unlock();
         return;
       }
-      const StoredEntry* const next = &mEntries[--position];
       frame.mPosition = position;
       frame.mNextBelow = next->mSerial;
       if (next->mEntry.mListener != nullptr && currentIsPlain) {

@@ -20,6 +20,13 @@
 // handler, and a removal that would wait for a delivery whose thread waits,
 // through any chain of removals, for a delivery on the remover's own stack
 // is reported as misuse and returns at once instead.
+//
+// Erasing from the middle of the vector would move every newer entry, which
+// makes detaching listeners oldest first quadratic. An entry near the newest
+// end is erased; any other is emptied and marked removed in place (its serial
+// made odd, live serials being even), and the walks skip it. Once the marked
+// entries outnumber the live ones the vector is compacted in one pass, so a
+// removal costs a constant amount of moving on average, whatever the count.
 #pragma once
 
 #include <TarnMessaging/Broadcaster.h>
@@ -113,8 +120,10 @@ private:
   using Alloc = kivcore::utility::SmallBlockAllocator::STLAllocator<T>;
   struct StoredEntry {
     ListenerEntry mEntry;
-    std::uint64_t mSerial;
+    std::uint64_t mSerial;  // even; odd once the entry is removed and emptied
   };
+  // The low bit of a removed entry's serial.
+  static constexpr std::uint64_t kRemovedMark = 1;
   using EntryVector = std::vector<StoredEntry, Alloc<StoredEntry>>;
   // Orders registrations by identity, agreeing with ListenerEntry's equality:
   // the plain pointer, then the safe listener's block, then the weak
@@ -126,6 +135,9 @@ private:
   using EntryIndex = std::map<ListenerEntry, std::uint64_t, IdentityOrder,
                               Alloc<std::pair<const ListenerEntry, std::uint64_t>>>;
 
+  // Takes out the entry at inPosition, by erasing or marking it. mMutex must
+  // be held; allocates nothing and throws nothing.
+  void EraseAt(std::size_t inPosition) noexcept;
   // The position in mEntries of an equal entry, or -1. mMutex must be held.
   std::ptrdiff_t Find(const ListenerEntry& inEntry) const noexcept;
   // The position of the entry with inSerial, or of the first newer one.
@@ -149,8 +161,9 @@ private:
   kivcore::threads::RecursiveMutex mMutex;
   Broadcaster* mOwner;                // guarded by mMutex; null once closed
   EntryVector mEntries;               // guarded by mMutex; oldest first, serials rising
-  EntryIndex mIndex;                  // guarded by mMutex; exactly the entries of mEntries
-  std::uint64_t mNextSerial = 1;      // guarded by mMutex
+  EntryIndex mIndex;                  // guarded by mMutex; exactly the unmarked entries of mEntries
+  std::size_t mRemovedCount = 0;      // guarded by mMutex; the marked entries of mEntries
+  std::uint64_t mNextSerial = 2;      // guarded by mMutex; even, rising by two
   Frame* mFrames = nullptr;           // guarded by mMutex
   WaiterList mGateMap;                // guarded by mMutex; removals still waiting
   // Removers sleep on these; a delivery that ends bumps the generation.

@@ -1,14 +1,17 @@
 #include <TarnMessaging/MessageImpl.h>
 #include <TarnMessaging/NullInterfaceException.h>
+#include <TarnMessaging/Tracing.h>
 
 #include "DiagnosticReports.h"
 
+#include <kivcore/MainThread.h>
 #include <kivcore/SmallBlockAllocator.h>
 
 #include <boost/function.hpp>
 
 #include <cxxabi.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cstdint>
 #include <cstdio>
@@ -19,6 +22,10 @@
 #include <new>
 #include <string>
 #include <thread>
+#include <typeindex>
+#include <typeinfo>
+#include <utility>
+#include <vector>
 
 namespace Tarn {
 
@@ -215,11 +222,60 @@ public:
 
   void operator()() const { StationUtils::BroadcastPostedCopy(mCopy->mStationID, *mCopy->mMessage); }
 
+  const PostedCopy& Copy() const noexcept { return *mCopy; }
+
 private:
   PostedCopy* mCopy;  // one of its owners; null only before Adopt
 };
 static_assert(boost::detail::function::function_allows_small_object_optimization<PostedCall>::value,
               "a posted call must fit inside boost::function");
+
+// The census of the main thread's queue for its high-water report: plain
+// posts by station and message type, the largest groups first. Runs under
+// the queue's lock, so it reads only what the posts hold.
+std::string DescribePostedCalls(const boost::function<void()>* inCalls, std::size_t inCount) {
+  struct Group {
+    ImmutableString mStationID;
+    std::type_index mType;
+    std::size_t mCount;
+  };
+  // Station IDs are interned: equal IDs share their text.
+  std::map<std::pair<const char*, std::type_index>, Group> groups;
+  std::size_t others = 0;
+  for (std::size_t i = 0; i < inCount; ++i) {
+    const PostedCall* const call = inCalls[i].target<PostedCall>();
+    if (call == nullptr) {
+      ++others;
+      continue;
+    }
+    const PostedCopy& copy = call->Copy();
+    const std::type_index type(typeid(*copy.mMessage));
+    const std::pair<const char*, std::type_index> key(copy.mStationID.c_str(), type);
+    auto entry = groups.find(key);
+    if (entry == groups.end()) entry = groups.emplace(key, Group{copy.mStationID, type, 0}).first;
+    ++entry->second.mCount;
+  }
+  std::vector<const Group*> largest;
+  for (const auto& entry : groups) largest.push_back(&entry.second);
+  std::sort(largest.begin(), largest.end(), [](const Group* inA, const Group* inB) { return inA->mCount > inB->mCount; });
+  constexpr std::size_t kNamed = 10;
+  std::string text = "Queued:";
+  for (std::size_t i = 0; i < largest.size() && i < kNamed; ++i) {
+    text += " " + std::to_string(largest[i]->mCount) + " posts of " + Tracing::ReadableTypeName(largest[i]->mType.name()) +
+            " to station \"" + largest[i]->mStationID.c_str() + "\";";
+  }
+  std::size_t rest = 0;
+  for (std::size_t i = kNamed; i < largest.size(); ++i) rest += largest[i]->mCount;
+  if (rest != 0) text += " " + std::to_string(rest) + " posts to " + std::to_string(largest.size() - kNamed) + " more groups;";
+  text += " " + std::to_string(others) + " other calls (cancellable, coalesced and the host's own).";
+  return text;
+}
+
+// The census is this library's for as long as it is loaded.
+struct CensusInstaller {
+  CensusInstaller() noexcept { kivcore::threads::SetPendingCallCensus(&DescribePostedCalls); }
+  ~CensusInstaller() { kivcore::threads::SetPendingCallCensus(nullptr); }
+} sCensusInstaller;
 
 }  // namespace
 

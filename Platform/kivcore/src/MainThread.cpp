@@ -6,7 +6,8 @@
 // to one vector; RunPendingCalls swaps it with a spare, empty vector under the
 // lock and runs the taken calls with the lock released. The two vectors trade
 // places on every run and keep their capacity, so a steady stream of calls
-// allocates nothing beyond the copies of the calls themselves.
+// allocates nothing beyond the copies of the calls themselves; a run that
+// drains a burst gives the burst's storage back, so that it is not kept.
 //
 // Invariants, each kept within one hold of the lock:
 // - while a wakeup handler is installed, a non-empty queue has had exactly one
@@ -24,19 +25,23 @@
 // needs storage it cannot have, it throws with both parts as they were.
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
+#include <kivcore/SmallBlockAllocator.h>
 
 #include <boost/weak_ptr.hpp>
 
 #include <pthread.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
 #include <exception>
 #include <iterator>
+#include <limits>
 #include <memory>
 #include <mutex>
+#include <string>
 #include <utility>
 #include <vector>
 
@@ -80,6 +85,13 @@ struct MainThreadState {
   std::vector<WakeupOwner> wakeups;
   bool wakeupArmed = false;            // the queue's wakeup was called since its last take; guarded by mutex
   std::uint64_t armings = 0;           // times wakeupArmed was set; guarded by mutex
+  // The high-water mark (the largest size for no mark) and whether passing
+  // it reports; guarded by mutex.
+  std::size_t highWaterMark = kDefaultPendingCallHighWaterMark;
+  bool highWaterArmed = true;
+  // Calls taken by recent runs, each run counting half the one before it:
+  // storage a steady stream needs is kept; guarded by mutex.
+  std::size_t recentlyTaken = 0;
   boost::weak_ptr<AsyncEventLoopAdaptor> adaptor;  // the live adaptor, if any; guarded by mutex
 };
 
@@ -95,6 +107,39 @@ unsigned long CurrentThreadId() noexcept { return static_cast<unsigned long>(pth
 // The number of calls queued, put-back ones included. state.mutex held.
 std::size_t Waiting(const MainThreadState& inState) noexcept {
   return inState.queue.size() + inState.putBack.calls.size() - inState.putBack.next + inState.heldBack;
+}
+
+std::atomic<PendingCallCensus> sCensus{nullptr};
+
+// The text of the high-water report on the queue as it is. state.mutex held;
+// out of line, since the post that calls it is the hot path.
+[[gnu::cold]] [[gnu::noinline]] std::string DescribeQueue(const MainThreadState& inState) noexcept {
+  std::string text;
+  try {
+    text = "The main thread's queue holds " + std::to_string(inState.queue.size()) +
+           " calls, past its high-water mark of " + std::to_string(inState.highWaterMark) +
+           ": the main thread is not running its calls (RunPendingCalls) as fast as they are queued, and every "
+           "queued call keeps its storage until it runs.";
+    if (const PendingCallCensus census = sCensus.load(std::memory_order_acquire))
+      text += " " + census(inState.queue.data(), inState.queue.size());
+  } catch (...) {
+    // Out of storage for the census: the count alone, or nothing.
+  }
+  return text;
+}
+
+// Reports a queue past its high-water mark; outside every lock of the queue.
+[[gnu::cold]] void ReportHighWater(const std::string& inText) noexcept {
+  try {
+    const std::string key = kPendingCallHighWaterKey + inText;
+    config::ErrorManager::Get(false)->GuardedCall([&key] {
+      const config::ReplacementValue none;
+      config::ThrowError(0, key.c_str(), 0u, 0, false, none, none, none, none);
+      return 0;
+    });
+  } catch (...) {
+    // No storage for the key: the queue matters more than its report.
+  }
 }
 
 // Arms the queue's wakeup if it needs one; returns the handler to call (after
@@ -277,6 +322,7 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
     }
     // The first call queued from now on wakes the host loop for the next run.
     state.wakeupArmed = false;
+    if (run.calls.size() <= state.highWaterMark / 2) state.highWaterArmed = true;
   }
 
   // On every way out, puts back the calls a throw left unrun, destroys the
@@ -289,12 +335,27 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
     bool usingSpare;
     ~Finish() {
       tCurrentRun = outer;
+      const std::size_t taken = run.calls.size();
       if (run.putBack) PutBack(state, run);
       run.calls.clear();
       if (!usingSpare) return;
-      std::lock_guard<std::mutex> lock(state.mutex);
-      state.spare.swap(run.calls);
-      state.spareInUse = false;
+      // A run that leaves the queue drained after a burst (far more calls
+      // than recent runs took) gives the burst's storage back rather than
+      // keep it as the spare.
+      std::vector<Call> released;
+      {
+        std::lock_guard<std::mutex> lock(state.mutex);
+        const std::size_t capacity = run.calls.capacity();
+        if (capacity / 4 > std::max(state.recentlyTaken, kKeptCallStorage) && state.queue.size() < taken / 4)
+          released.swap(run.calls);
+        state.recentlyTaken = (state.recentlyTaken + taken) / 2;
+        state.spare.swap(run.calls);
+        state.spareInUse = false;
+      }
+      // The small blocks of a large burst's calls are free by now as well.
+      const bool burst = released.capacity() >= 8 * kKeptCallStorage;
+      released = std::vector<Call>();
+      if (burst) utility::SmallBlockAllocator::ReleaseFreeChunks();
     }
   } finish{state, run, tCurrentRun, usingSpare};
   tCurrentRun = &run;
@@ -379,14 +440,34 @@ bool AsyncCallFromMainThread(boost::function<void()>&& inCall, unsigned int /*in
   MainThreadState& state = State();
   WakeupHandler wakeup;
   std::uint64_t arming = 0;
+  std::string highWater;
   {
     std::lock_guard<std::mutex> lock(state.mutex);
     state.queue.push_back(std::move(inCall));
     if (state.waiters > 0) state.callQueued.notify_all();
     wakeup = ArmWakeup(state, arming);
+    if (state.queue.size() > state.highWaterMark && state.highWaterArmed) {
+      state.highWaterArmed = false;
+      highWater = DescribeQueue(state);
+    }
   }
   CallWakeup(state, wakeup, arming);
+  if (!highWater.empty()) ReportHighWater(highWater);
   return true;
+}
+
+std::size_t SetPendingCallHighWaterMark(std::size_t inMark) noexcept {
+  constexpr std::size_t kNone = std::numeric_limits<std::size_t>::max();
+  MainThreadState& state = State();
+  std::lock_guard<std::mutex> lock(state.mutex);
+  const std::size_t previous = state.highWaterMark == kNone ? 0 : state.highWaterMark;
+  state.highWaterMark = inMark == 0 ? kNone : inMark;
+  state.highWaterArmed = true;
+  return previous;
+}
+
+PendingCallCensus SetPendingCallCensus(PendingCallCensus inCensus) noexcept {
+  return sCensus.exchange(inCensus, std::memory_order_acq_rel);
 }
 
 }  // namespace kivcore::threads

@@ -5,8 +5,9 @@
 // cache, with no lock and no atomic read-modify-write. An empty thread list
 // is refilled with a batch from the class's shared pool; a list that grows
 // past two batches hands one batch back. The pool carves new blocks from
-// chunks taken from malloc, which are never returned. Larger requests go to
-// malloc and free.
+// chunks taken from malloc; ReleaseFreeChunks returns the chunks whose every
+// block is back in the pool (after a burst). Larger requests go to malloc
+// and free.
 //
 // Everything global here is trivially destructible and constant-initialized,
 // so the allocator keeps working during static destruction. A thread that
@@ -37,9 +38,14 @@
 #include <algorithm>
 #include <array>
 #include <atomic>
+#include <cstdint>
 #include <cstdlib>
+#include <functional>
 #include <mutex>
 #include <new>
+#include <vector>
+
+#include <malloc.h>
 
 #include <pthread.h>
 
@@ -433,6 +439,66 @@ SmallBlockAllocator::Statistics SmallBlockAllocator::GetStatistics() {
   // the figures are clamped at zero rather than wrapped.
   return Statistics{allocations > disposals ? static_cast<std::size_t>(allocations - disposals) : 0,
                     bytes > 0 ? static_cast<std::size_t>(bytes) : 0, allocations};
+}
+
+void SmallBlockAllocator::ReleaseFreeChunks() noexcept {
+  if (kBypassPools) return;
+  bool released = false;
+  for (std::size_t c = 0; c < kClassCount; ++c) {
+    Pool& pool = gPools[c];
+    const std::size_t perChunk = (kChunkSize - kChunkHeader) / ClassBlockSize(c);
+    std::vector<char*> gone;
+    try {
+      std::lock_guard<std::mutex> lock(pool.mutex);
+      // The newest chunk is still being carved: it stays.
+      if (pool.freeList == nullptr || pool.chunks == nullptr || pool.chunks->previous == nullptr) continue;
+      std::vector<char*> starts;
+      for (Chunk* chunk = pool.chunks->previous; chunk != nullptr; chunk = chunk->previous)
+        starts.push_back(reinterpret_cast<char*>(chunk));
+      std::sort(starts.begin(), starts.end());
+      // The position in starts of the chunk holding inAddress, or -1. Blocks
+      // freed one after the other mostly share a chunk: the last one found
+      // is tried first.
+      std::size_t last = 0;
+      const auto chunkOf = [&starts, &last](const void* inAddress) -> std::ptrdiff_t {
+        const char* const address = static_cast<const char*>(inAddress);
+        if (address >= starts[last] && address < starts[last] + kChunkSize) return static_cast<std::ptrdiff_t>(last);
+        const auto after = std::upper_bound(starts.begin(), starts.end(), address,
+                                            [](const char* inA, const char* inB) { return std::less<const char*>()(inA, inB); });
+        if (after == starts.begin() || address >= *(after - 1) + kChunkSize) return -1;
+        last = static_cast<std::size_t>(after - 1 - starts.begin());
+        return static_cast<std::ptrdiff_t>(last);
+      };
+      std::vector<std::size_t> freeBlocks(starts.size(), 0);
+      for (const Block* block = pool.freeList; block != nullptr; block = block->next) {
+        const std::ptrdiff_t at = chunkOf(block);
+        if (at >= 0) ++freeBlocks[static_cast<std::size_t>(at)];
+      }
+      for (std::size_t i = 0; i < starts.size(); ++i) {
+        if (freeBlocks[i] == perChunk) gone.push_back(starts[i]);
+      }
+      if (gone.empty()) continue;
+      const auto isGone = [&](const void* inAddress) {
+        const std::ptrdiff_t at = chunkOf(inAddress);
+        return at >= 0 && freeBlocks[static_cast<std::size_t>(at)] == perChunk;
+      };
+      for (Block** link = &pool.freeList; *link != nullptr;) {
+        if (isGone(*link)) *link = (*link)->next;
+        else link = &(*link)->next;
+      }
+      for (Chunk** link = &pool.chunks->previous; *link != nullptr;) {
+        if (isGone(*link)) *link = (*link)->previous;
+        else link = &(*link)->previous;
+      }
+    } catch (...) {
+      // No storage for the tallies: the chunks stay, unchanged.
+      continue;
+    }
+    for (char* chunk : gone) std::free(chunk);
+    released = true;
+  }
+  // Freed chunks amid the heap go back to the system only when trimmed.
+  if (released) ::malloc_trim(0);
 }
 
 void SmallBlockAllocator::SetFailAfter(long long inCount) {

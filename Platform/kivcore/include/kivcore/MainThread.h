@@ -28,6 +28,28 @@
 /// queue. A handler installed while calls are queued is called at once for
 /// them. A handler that throws is reported through kivcore's error manager and
 /// called again by the next queued call; the call that woke it stays queued.
+///
+/// Bound: none. A call queued while the main thread does not run its calls
+/// (a host loop that has stopped calling RunPendingCalls, or no main thread
+/// registered) stays queued, with everything it holds, until a run takes it;
+/// a million queued posts of a small message take 90 MiB or more. When a
+/// queued call makes the queue longer than the high-water mark (see
+/// SetPendingCallHighWaterMark), the queue is reported once, through
+/// ThrowError with the key kPendingCallHighWaterKey followed by a text that
+/// gives the count and what is queued (the census a library installs with
+/// SetPendingCallCensus; TarnMessaging's counts posts by station and message
+/// type). The report runs on the queuing thread, outside every lock of the
+/// queue, inside the error manager's GuardedCall; the next one comes only once
+/// a run has taken a queue of at most half the mark. The count itself costs a
+/// queued call one comparison; the census walks the queue once, under the
+/// queue's lock, when the report is made.
+///
+/// Storage: a run that takes a burst (storage for more than four times what
+/// recent runs took, and than kKeptCallStorage calls) and leaves the queue
+/// drained (under a quarter of what it took) gives the burst's storage back,
+/// and the small-block chunks left wholly free (see
+/// SmallBlockAllocator::ReleaseFreeChunks), so a burst's memory goes back once
+/// the burst has been run. A steady stream keeps the storage it needs.
 #pragma once
 
 #include <kivcore/Export.h>
@@ -37,6 +59,7 @@
 
 #include <cstddef>
 #include <functional>
+#include <string>
 
 namespace kivcore::threads {
 
@@ -99,6 +122,27 @@ KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> RegisterCurrentThreadAsMain
 
 /// The registered main thread's adaptor, or empty when none is registered.
 KIVCORE_API boost::shared_ptr<AsyncEventLoopAdaptor> GetRegisteredMainThread();
+
+/// The high-water mark until one is set: 1,048,576 queued calls.
+constexpr std::size_t kDefaultPendingCallHighWaterMark = std::size_t{1} << 20;
+/// The key of the high-water report; the text follows the '='.
+constexpr const char* kPendingCallHighWaterKey = "$$$/kivcore/MainThread/PendingCallHighWater=";
+/// Queue storage, in calls, that a run keeps for the next ones in any case.
+constexpr std::size_t kKeptCallStorage = 4096;
+
+/// Sets the number of queued calls past which the queue is reported (0: never)
+/// and returns the previous mark. The report is armed again at once. Any
+/// thread.
+KIVCORE_API std::size_t SetPendingCallHighWaterMark(std::size_t inMark) noexcept;
+
+/// Says what inCount queued calls from inCalls are, for the high-water
+/// report. Called under the queue's lock: it must not queue calls, take a
+/// lock the queue's users may hold, or call host code. It may throw (the
+/// report then gives the count alone).
+using PendingCallCensus = std::string (*)(const boost::function<void()>* inCalls, std::size_t inCount);
+/// Installs the census of the high-water report (null: the count alone) and
+/// returns the previous one. For a library that queues calls; any thread.
+KIVCORE_API PendingCallCensus SetPendingCallCensus(PendingCallCensus inCensus) noexcept;
 
 /// True only on the registered main thread. One atomic load and a comparison.
 KIVCORE_API bool CurrentThreadIsMainThread() noexcept;

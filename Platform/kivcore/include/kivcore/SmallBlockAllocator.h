@@ -55,6 +55,13 @@ public:
   /// or disposed of during the call, never below zero.
   static Statistics GetStatistics();
 
+  /// Returns to the system the pools' chunks whose every block is free and
+  /// back in its pool (not held in a thread's cache); for after a burst of
+  /// allocations has been freed. Takes each pool's lock in turn while it
+  /// walks that pool's free blocks. Does nothing under AddressSanitizer,
+  /// where every block comes from malloc.
+  static void ReleaseFreeChunks() noexcept;
+
   /// Fault injection: the next inCount allocations succeed, then every
   /// Allocate returns null. A negative count (the default) never fails.
   static void SetFailAfter(long long inCount);
