@@ -2,24 +2,40 @@
 #include <TarnMessaging/StationIDs.h>
 #include <TarnMessaging/StationRegistry.h>
 
+#include "ContractCheck.h"
 #include "DiagnosticReports.h"
 
 #include <kivcore/InitializerRegistry.h>
 #include <kivcore/MainThread.h>
-#include <kivcore/RecursiveMutex.h>
 
 #include "PostKinds.h"
 
 #include <boost/shared_ptr.hpp>
 
+#include <chrono>
+#include <condition_variable>
 #include <cstdint>
+#include <mutex>
+#include <thread>
 
 namespace Tarn {
 namespace {
 
-kivcore::threads::RecursiveMutex sMessagingMutex;
-std::int32_t sInitializeCount = 0;  // guarded by sMessagingMutex
+// The initialization lock guards the count and the adaptor only: no host
+// code (a station's destructor, a queued call, a handler, an error handler)
+// runs while it is held. The last Terminate instead marks the life as ending
+// and runs its steps with the lock let go; an Initialize on another thread
+// meanwhile waits for them (below), one on the same thread (from a queued
+// call, say) goes ahead.
+std::mutex sMessagingMutex;
+std::condition_variable sLifeEnded;  // notified when sEndingOn is cleared
+std::int32_t sInitializeCount = 0;   // guarded by sMessagingMutex
 boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> sMainThreadAdaptor;  // guarded by sMessagingMutex
+std::thread::id sEndingOn;  // the thread running the last Terminate's steps, if any; guarded by sMessagingMutex
+// How long another thread's Initialize waits for those steps: they run host
+// code, which may itself wait for that thread, so the wait is bounded, and
+// the Initialize then fails with a report instead of hanging.
+constexpr std::chrono::seconds kLifeEndWaitLimit{10};
 
 // At exit, a library still initialized with calls queued tells the host
 // that they were never delivered: a forgotten Terminate (or a loop that
@@ -37,14 +53,6 @@ struct ExitCheck {
   }
 } sExitCheck;
 
-class MessagingLock {
-public:
-  MessagingLock() { sMessagingMutex.Lock(nullptr); }
-  ~MessagingLock() { sMessagingMutex.Unlock(); }
-  MessagingLock(const MessagingLock&) = delete;
-  MessagingLock& operator=(const MessagingLock&) = delete;
-};
-
 // Enrols the library with the host's initializer registry; nothing runs at
 // load.
 const kivcore::config::InitializerRegistrar sRegistrar(
@@ -61,22 +69,32 @@ namespace Messaging {
 
 void Initialize() {
   std::size_t countedOffMainThread = 0;
+  bool waitedTooLong = false;
   {
-    MessagingLock lock;
-    if (sInitializeCount == 0) {
-      sMainThreadAdaptor = kivcore::threads::RegisterCurrentThreadAsMainThread();
-      for (const kivcore::utility::ImmutableString* stationID :
-           {&kStation_Idle, &kStation_Repeat, &kStation_AppSuspend, &kStation_AppResume, &kStation_AboutDialog,
-            &kStation_DirectoryChange, &kStation_PanicSave, &kStation_StatusBar, &kStation_ColorPicker,
-            &kStation_LocateClip}) {
-        StationRegistry::RegisterStation(*stationID, nullptr);
-      }
-    } else if (!kivcore::threads::CurrentThreadIsMainThread()) {
-      countedOffMainThread = static_cast<std::size_t>(sInitializeCount) + 1;
+    std::unique_lock<std::mutex> lock(sMessagingMutex);
+    if (sEndingOn != std::thread::id() && sEndingOn != std::this_thread::get_id()) {
+      waitedTooLong = !sLifeEnded.wait_for(lock, kLifeEndWaitLimit, [] { return sEndingOn == std::thread::id(); });
     }
-    ++sInitializeCount;
+    if (!waitedTooLong) {
+      if (sInitializeCount == 0) {
+        sMainThreadAdaptor = kivcore::threads::RegisterCurrentThreadAsMainThread();
+        for (const kivcore::utility::ImmutableString* stationID :
+             {&kStation_Idle, &kStation_Repeat, &kStation_AppSuspend, &kStation_AppResume, &kStation_AboutDialog,
+              &kStation_DirectoryChange, &kStation_PanicSave, &kStation_StatusBar, &kStation_ColorPicker,
+              &kStation_LocateClip}) {
+          StationRegistry::RegisterStation(*stationID, nullptr);
+        }
+      } else if (!kivcore::threads::CurrentThreadIsMainThread()) {
+        countedOffMainThread = static_cast<std::size_t>(sInitializeCount) + 1;
+      }
+      ++sInitializeCount;
+    }
   }
-  // Reported once the lock is let go, since the host's error handler runs.
+  // Reported once the lock is let go, since the host's handlers run.
+  if (waitedTooLong) {
+    const bool lastTerminateEnded = false;
+    TARN_CONTRACT_CHECK(lastTerminateEnded, "Tarn::Messaging::Initialize");
+  }
   if (countedOffMainThread != 0) {
     Diagnostics::Detail::ReportSilentFailure(Diagnostics::Detail::Failure::kInitializeOffMainThread, TARN_CALL_SITE(),
                                              "Tarn::Messaging::Initialize", kNoStation, countedOffMainThread);
@@ -84,17 +102,47 @@ void Initialize() {
 }
 
 void Terminate() {
-  MessagingLock lock;
-  if (--sInitializeCount != 0) return;
+  boost::shared_ptr<kivcore::threads::AsyncEventLoopAdaptor> adaptor;
+  bool balanced = true;
+  {
+    const std::lock_guard<std::mutex> lock(sMessagingMutex);
+    // One more Terminate than Initialize would leave a count that no later
+    // Initialize brings up: refused.
+    balanced = sInitializeCount > 0;
+    if (balanced && --sInitializeCount != 0) return;
+    if (balanced) {
+      sEndingOn = std::this_thread::get_id();
+      adaptor = sMainThreadAdaptor;
+    }
+  }
+  if (!balanced) {
+    TARN_CONTRACT_CHECK(balanced, "Tarn::Messaging::Terminate");
+    return;
+  }
+  // However the steps end (a queued call may throw), the life has ended and
+  // a waiting Initialize goes ahead.
+  struct Ended {
+    ~Ended() {
+      {
+        const std::lock_guard<std::mutex> lock(sMessagingMutex);
+        sEndingOn = std::thread::id();
+      }
+      sLifeEnded.notify_all();
+    }
+  } ended;
   // The host's call site, for the reports of what Terminate finds left over.
   StationRegistry::TerminateFrom(TARN_CALL_SITE());
   // Posts still queued find no station now and deliver nothing; running them
   // frees their copies.
-  if (sMainThreadAdaptor) sMainThreadAdaptor->RunPendingCalls();
-  // A pending call may have initialized the library again; it keeps the
-  // main thread it registered then.
-  if (sInitializeCount != 0) return;
-  sMainThreadAdaptor.reset();
+  if (adaptor) adaptor->RunPendingCalls();
+  {
+    const std::lock_guard<std::mutex> lock(sMessagingMutex);
+    // A queued call may have initialized the library again; it keeps the
+    // main thread it registered then.
+    if (sInitializeCount != 0) return;
+    sMainThreadAdaptor.reset();
+  }
+  adaptor.reset();
   // Idle-time posts wait for an idle broadcast that no station can make now.
   Detail::DropIdlePosts();
 }

@@ -169,6 +169,19 @@ TEST(MessagingLifecycleTest, TerminateGivesBackEverySmallBlock) {
   EXPECT_EQ(kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse, before);
 }
 
+// One Terminate too many is refused: it once left a count below zero, and
+// the next Initialize then brought nothing up.
+TEST(MessagingLifecycleTest, ATerminateWithoutInitializeIsReportedAndChangesNothing) {
+  messaging_test::ContractDialogRecorder dialog;
+  messaging_test::ErrorRecorder errors;
+  Tarn::Messaging::Terminate();
+  EXPECT_EQ(dialog.Count(), 1u);
+  Tarn::Messaging::Initialize();
+  EXPECT_NE(Registry::FindStation(Tarn::kStation_StatusBar), nullptr);
+  Tarn::Messaging::Terminate();
+  EXPECT_EQ(Registry::FindStation(Tarn::kStation_StatusBar), nullptr);
+}
+
 // ---------------------------------------------------------------------------
 // Process exit
 

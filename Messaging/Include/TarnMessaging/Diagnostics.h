@@ -52,9 +52,7 @@
 /// failure path and nothing on any other path.
 ///
 /// Threading: every function may be called from any thread. Reports run on
-/// the thread of the failing call, with no lock of the library held, except
-/// that the Terminate reports run while Terminate holds the library's
-/// initialization lock.
+/// the thread of the failing call, with no lock of the library held.
 #pragma once
 
 #include <TarnMessaging/Export.h>
