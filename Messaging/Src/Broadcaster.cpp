@@ -222,7 +222,8 @@ bool BroadcasterCore::Add(const ListenerEntry& inEntry) {
   if (!inserted.second) return false;
   bool stored = false;
   try {
-    mEntries.push_back(StoredEntry{inEntry, mNextSerial});
+    const MessageID hearsOnly = inEntry.mListener != nullptr ? inEntry.mListener->mHearsOnly : 0;
+    mEntries.push_back(StoredEntry{inEntry, mNextSerial, hearsOnly});
     stored = true;
     if (inEntry.mListener != nullptr) inEntry.mListener->AddBroadcaster(mOwner, mSelf);
   } catch (...) {
@@ -553,6 +554,7 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
   // Built once: the record refers to frame.mCurrent, which each pass
   // refills.
   const Broadcaster::BroadcastMessageRecord record{frame.mCurrent, inMessage, &gone};
+  const MessageID messageID = inMessage.GetMessageID();
   // The traced walk hands each delivery to its policy as a call. It names
   // the delivery directly (no function pointer to follow) and fits inside
   // the boost::function, so nothing is allocated.
@@ -596,11 +598,13 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
           (position < count && mEntries[position].mSerial < frame.mNextBelow)) {
         position = PositionOf(frame.mNextBelow);
       }
-      // Entries marked removed are passed over under the same hold.
+      // Entries marked removed, and listeners that hear another message type
+      // only, are passed over under the same hold: nothing is called or
+      // traced for them.
       const StoredEntry* next = nullptr;
       while (position > 0) {
         next = &mEntries[--position];
-        if ((next->mSerial & kRemovedMark) == 0) break;
+        if ((next->mSerial & kRemovedMark) == 0 && (next->mHearsOnly == 0 || next->mHearsOnly == messageID)) break;
         next = nullptr;
       }
       if (next == nullptr) {

@@ -121,6 +121,7 @@ private:
   struct StoredEntry {
     ListenerEntry mEntry;
     std::uint64_t mSerial;  // even; odd once the entry is removed and emptied
+    MessageID mHearsOnly;   // the one message type a plain listener hears (Listener::HearOnly); 0: all
   };
   // The low bit of a removed entry's serial.
   static constexpr std::uint64_t kRemovedMark = 1;

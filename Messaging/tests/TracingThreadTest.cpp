@@ -7,6 +7,7 @@
 #include <TarnMessaging/IdleCountdownTimer.h>
 #include <TarnMessaging/Station.h>
 #include <TarnMessaging/StationRegistry.h>
+#include <TarnMessaging/Subscription.h>
 #include <TarnMessaging/Tracing.h>
 
 #include <gtest/gtest.h>
@@ -94,6 +95,9 @@ TEST(Tracing, EachDeliveryIsTracedOnceWithStationTypeAndListenerAndNoneAfterTheT
   station.AddListener(&plain);
   station.AddListener(std::weak_ptr<Tarn::Listener>(weak));
   station.AddListener(safe);
+  // Subscriptions to other message types are passed over: no call, no trace.
+  const Tarn::Registration others[] = {Tarn::Subscribe<PingMessage>(station, [](const PingMessage&) {}),
+                                       Tarn::Subscribe<NumberMessage>(bare, [](const NumberMessage&) {})};
   station.BroadcastMessage(NumberMessage(1));
 
   const std::string id = station.GetStationID().c_str(), number = "messaging_test::NumberMessage";

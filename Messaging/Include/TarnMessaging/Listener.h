@@ -33,6 +33,7 @@
 #include <kivcore/SmallBlockAllocator.h>
 
 #include <atomic>
+#include <cstdint>
 #include <list>
 #include <memory>
 
@@ -92,6 +93,13 @@ protected:
   /// Allocates nothing and throws nothing.
   void DetachFromBroadcasters() noexcept;
 
+  /// For a listener that hears messages of one type only (a typed
+  /// subscription): broadcasters pass it over for every other type, before
+  /// any call or trace, so that a broadcast reaches only the listeners of its
+  /// type. Call it in the constructor, before the listener is attached;
+  /// inMessageID 0 (the default) hears every type.
+  void HearOnly(std::uint32_t inMessageID) noexcept { mHearsOnly = inMessageID; }
+
 private:
   friend class BroadcasterCore;
   // One plain-pointer registration: the broadcaster (compared, never
@@ -112,6 +120,7 @@ private:
   BackLinkList mBroadcasters;
   mutable std::atomic<bool> mBroadcastersBusy{false};
   std::atomic<bool> mListening{true};  // read by the delivering (main) thread
+  std::uint32_t mHearsOnly = 0;        // see HearOnly; read by broadcasters when it is attached
 };
 
 }  // namespace Tarn

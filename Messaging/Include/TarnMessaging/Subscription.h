@@ -11,8 +11,8 @@
 /// @endcode
 ///
 /// Subscribe<T> makes a listener that calls the handler for messages of type T
-/// only (one ID compare, then a direct call; nothing is allocated per
-/// delivery) and attaches it by plain pointer to a broadcaster, or to the
+/// only (a broadcast of another type passes it over under the broadcaster's
+/// lock, uncalled and untraced; nothing is allocated per delivery) and attaches it by plain pointer to a broadcaster, or to the
 /// station registered under an ID. Attach registers a listener the caller
 /// holds, in any of the four ways a broadcaster holds one. Both return a
 /// Registration, which detaches on destruction or Reset().
@@ -178,8 +178,8 @@ class TypedListener final : public OwnedListener {
 public:
   /// Keeps inHandler (moved or copied) for the listener's lifetime.
   /// @{
-  explicit TypedListener(Handler&& inHandler) : mHandler(std::move(inHandler)) {}
-  explicit TypedListener(const Handler& inHandler) : mHandler(inHandler) {}
+  explicit TypedListener(Handler&& inHandler) : mHandler(std::move(inHandler)) { HearOnly(T::StaticMessageID()); }
+  explicit TypedListener(const Handler& inHandler) : mHandler(inHandler) { HearOnly(T::StaticMessageID()); }
   /// @}
   // Detached while whole: the handler may be running on the main thread.
   ~TypedListener() override { DetachFromBroadcasters(); }
