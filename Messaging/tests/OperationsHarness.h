@@ -42,6 +42,8 @@
 // in freed memory), stop the process at once with the trace.
 #pragma once
 
+#include "HeapFailure.h"
+
 #include <TarnMessaging.h>
 
 #include <kivcore/kivcore.h>
@@ -63,6 +65,7 @@
 namespace operations_harness {
 
 using kivcore::utility::ImmutableString;
+using kivcore::utility::SmallBlockAllocator;
 namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
 
@@ -76,6 +79,8 @@ struct Choices {
 struct Ping : Tarn::MessageImpl<Ping> {};
 
 constexpr int kSlots = 5, kNodes = 5, kIdle = 4, kMaxLevels = 3, kMaxHandlerActions = 200;
+// An operation's failing allocation is one of the first kFailPoints on the heap or in small-block storage.
+constexpr int kFailPoints = 6;
 // Entry.mWho of the timer, and of a weak or safe entry whose object died before its slot was reused; kSlots + n:
 // station n as a relay.
 constexpr int kTimer = kSlots + kNodes, kGone = -1;
@@ -84,6 +89,8 @@ enum Way { kPlain, kBoost, kStd, kSafe };
 class Harness;
 inline Harness* sHarness = nullptr;
 inline std::atomic<int> sLiveStations{0};
+// What the sequences ran so far: library calls made with an allocation failure drawn, and those that threw.
+inline struct Statistics { long long mFailingCalls = 0, mThrown = 0; } sStatistics;
 void Called(int inSlot);
 void Destroyed(int inSlot);
 void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
@@ -132,11 +139,18 @@ struct Object {
   bool mOwned = false, mAlive = false, mListening = true, mDestroyed = false;
   int mHolds = 0;           // weak or safe deliveries in progress, each keeping it alive
   int mLinks[kNodes] = {};  // back-link records the listener holds, per node
+};
+
+// What the harness holds of a slot's listener: the object, and the registrations of Tarn::Attach per node, for
+// plain-pointer and for its own way, each with the life of the node it was made in.
+struct Handles {
   std::unique_ptr<PlainProbe> mPlain;
   boost::shared_ptr<PlainProbe> mBoost;
   std::shared_ptr<PlainProbe> mStd;
   Tarn::ISafeListenerRef mSafe;
   Tarn::Listener* mListener = nullptr;  // while owned; null for safe listeners
+  Tarn::Registration mAttached[kNodes][2];
+  int mLife[kNodes][2] = {};
 };
 
 struct Frame {
@@ -162,13 +176,19 @@ public:
     sHarness = nullptr;
   }
 
-  void Run(int inSteps) {
-    for (int step = 0; step < inSteps && mFailure.empty() && !mChoices.Exhausted(); ++step) {
+  // Runs at most inSteps steps from inStep, then Finish. A step that leaves the library terminated initializes it
+  // again, here or, now and then, on a new thread that runs the rest of the sequence: the main thread moves.
+  std::string Run(int inSteps, int inStep = 0) {
+    for (int step = inStep; step < inSteps && mFailure.empty() && !mChoices.Exhausted(); ++step) {
       Note("\n%d:", step);
       Act(0);
+      std::string failure;
+      if (!mMain && Pick(3) == 0)
+        return Note(" move"), OnThread(true, [&] { Initialize(), Compare(), failure = Run(inSteps, step + 1); }), failure;
       if (!mMain) Initialize();
       Compare();
     }
+    return Finish();
   }
 
   // Lets everything go, terminates the library, and returns the first
@@ -209,20 +229,10 @@ public:
     // fine if the model, walking on to the next call, has left every frame of this station behind.
     bool walkedPast = false;
     if (inStation == nullptr && mStale && mFailure.empty()) {
-      const std::vector<Frame> frames = mFrames;
-      const std::vector<Level> levels = mLevels;
-      std::vector<Node> nodes(std::begin(mNodes), std::end(mNodes));
-      struct Held { bool mAlive; int mHolds; int mLinks[kNodes]; };
-      std::vector<Held> held;
-      for (const Object& object : mObjects) held.push_back(Held{object.mAlive, object.mHolds, {}}), std::copy(std::begin(object.mLinks), std::end(object.mLinks), held.back().mLinks);
-      const bool timer = mTimerListening;
+      const Snapshot before = Save();
       if (Next() >= 0) {
         if (node.mFrames > 0) Fatal("a station was deleted while a broadcast on it runs");
-        mFrames = frames, mLevels = levels, mTimerListening = timer, walkedPast = true;
-        std::copy(nodes.begin(), nodes.end(), std::begin(mNodes));
-        for (int slot = 0; slot < kSlots; ++slot)
-          mObjects[slot].mAlive = held[slot].mAlive, mObjects[slot].mHolds = held[slot].mHolds,
-          std::copy(std::begin(held[slot].mLinks), std::end(held[slot].mLinks), mObjects[slot].mLinks);
+        Restore(before), walkedPast = true;
       }
     }
     if (inStation != nullptr && mStations[inNode] != nullptr) Fail("two stations of one ID alive");
@@ -252,71 +262,123 @@ private:
     mMain = mNodes[kIdle].mRegistered = true;
   }
 
-  // Runs inCall on a helper thread while this thread waits, or here.
+  // Runs inCall on a helper thread while this thread waits, or here. Here, the library call meets the allocation
+  // failure its operation drew, if any (the heap's or small-block storage's n-th allocation): the call throws
+  // std::bad_alloc and leaves the library as it was (Act then restores the model), or returns having done it all.
   template <class Call>
   void OnThread(bool inHelper, Call inCall) {
-    if (!inHelper) return inCall();
-    auto done = std::async(std::launch::async, inCall);
-    if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready)
-      std::fprintf(stderr, "operations harness: a helper operation hangs%s\n", mTrace.c_str()), std::abort();
-    done.get();
+    if (inHelper) {
+      auto done = std::async(std::launch::async, inCall);
+      if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready)
+        std::fprintf(stderr, "operations harness: a helper operation hangs%s\n", mTrace.c_str()), std::abort();
+      return done.get();
+    }
+    const int failAt = std::exchange(mFailAt, -1);
+    if (failAt < 0) return inCall();
+    failAt < kFailPoints ? messaging_test::FailHeapAfter(failAt) : SmallBlockAllocator::SetFailAfter(failAt - kFailPoints);
+    try {
+      inCall();
+    } catch (const std::bad_alloc&) {
+      mThrew = true;
+    }
+    messaging_test::FailHeapAfter(-1), SmallBlockAllocator::SetFailAfter(-1);
+    ++sStatistics.mFailingCalls, sStatistics.mThrown += mThrew;
+    Note(mThrew ? " (bad_alloc at %d)" : " (done despite %d)", failAt);
   }
 
-  // One operation, from the top (inLevel 0) or from a handler.
+  // One operation, from the top (inLevel 0) or from a handler; a quarter of them with an allocation failure.
   void Act(int inLevel) {
     // Low slots come more often, so that operations meet on the same listener.
     const int slot = std::min(Pick(kSlots), Pick(kSlots)), node = Pick(kNodes), op = Pick(13), choice = Pick(8);
     const bool helper = mMain && Pick(4) == 0;
-    switch (op) {
-      case 0: return Create(slot);
-      case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
-      case 4: return Kill(slot, helper);
-      case 5: return Listen(slot, choice < 5);
-      case 6: return SetBroadcasting(node, choice < 5);
-      case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
-      case 9: return Relay(node, choice % kIdle, choice < 5);
-      case 10: case 11: return RegistryOp(node, choice % 5, helper);
-      default: return TimerOp(choice);
-    }
+    const int failAt = Pick(4) == 0 ? Pick(2 * kFailPoints) : -1;
+    Snapshot before = failAt >= 0 ? Save() : Snapshot();
+    mFailAt = failAt;
+    [&] {
+      switch (op) {
+        case 0: return Create(slot);
+        case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
+        case 4: return Kill(slot, helper);
+        case 5: return Listen(slot, choice < 5);
+        case 6: return SetBroadcasting(node, choice < 5);
+        case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
+        case 9: return Relay(node, choice % kIdle, choice < 5);
+        case 10: case 11: return RegistryOp(node, choice % 5, helper);
+        default: return mMain ? TimerOp(choice) : Revive(inLevel, choice);
+      }
+    }();
+    mFailAt = -1;
+    if (!std::exchange(mThrew, false)) return;
+    // A station the failed call made stays, as a registered station made by a lookup would.
+    for (int made = 1; made < kNodes; ++made) before.mNodes[made].mMade |= mStations[made] != nullptr;
+    Restore(before);
+  }
+
+  // After a Terminate from a handler: the library initialized again here, or on another thread that, as the main
+  // thread, operates (broadcasts too) while this one waits in its handler, and terminates the library again.
+  void Revive(int inLevel, int inChoice) {
+    // A station of the old life still broadcasting would meet its successor; the model keeps one per ID.
+    for (int node = 1; node < kNodes; ++node)
+      if (mNodes[node].mFrames > 0) return;
+    if (inChoice < 4) return Note(" init"), Initialize();
+    Note(" elsewhere{");
+    OnThread(true, [&] {
+      Initialize();
+      for (int action = Pick(3); action >= 0 && mFailure.empty(); --action) Act(inLevel);
+      if (mMain) Terminate();
+    });
+    Note("}");
   }
 
   void Create(int inSlot) {
     Object& object = mObjects[inSlot];
+    Handles& handles = mHandles[inSlot];
     if (object.mAlive) return;
     for (Node& node : mNodes)
       for (Entry& entry : node.mEntries) entry.mWho = entry.mWho == inSlot ? kGone : entry.mWho;
-    object = Object();
+    object = Object(), handles.mListener = nullptr;
     object.mKind = Pick(4);
     object.mOwned = object.mAlive = true;
     Note(" new%d.%d", inSlot, object.mKind);
     switch (object.mKind) {
-      case kPlain: object.mListener = (object.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
-      case kBoost: object.mListener = (object.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
-      case kStd: object.mListener = (object.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
-      default: object.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot));
+      case kPlain: handles.mListener = (handles.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
+      case kBoost: handles.mListener = (handles.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
+      case kStd: handles.mListener = (handles.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
+      default: handles.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot));
     }
   }
 
+  // Added or removed by the broadcaster's or the utilities' call, or by a registration of Tarn::Attach: made, or
+  // reset (which removes nothing once the station it was made in is gone).
   void AddOrRemove(int inSlot, int inNode, bool inAdd, int inChoice, bool inHelper) {
     Object& object = mObjects[inSlot];
     if (!object.mOwned) return;
     // Objects owned by a shared pointer are sometimes registered by plain pointer: a second entry.
     const int way = (object.mKind == kBoost || object.mKind == kStd) && inChoice < 3 ? kPlain : object.mKind;
+    Tarn::Registration& attached = mHandles[inSlot].mAttached[inNode][way != kPlain];
+    int& life = mHandles[inSlot].mLife[inNode][way != kPlain];
+    const bool registration = Pick(3) == 0 && (inAdd || attached);
     // A worker's removal of a listener the main thread is delivering to waits for that delivery, and here the
     // main thread waits for the worker.
     if (!inAdd && inHelper && Delivering(inSlot, way)) return;
     // Only the harness's broadcaster, which never dies, is left a back-link by a removal that does not unlink.
-    const bool unlink = inNode != 0 || inChoice < 6;
+    const bool unlink = registration || inNode != 0 || inChoice < 6;
     Note(inAdd ? " add%d.%d@%d" : " rm%d.%d@%d", inSlot, way, inNode);
-    Note(unlink ? "%s" : "(keep link)%s", inHelper ? "h" : "");
-    Model(inNode, inSlot, way, inAdd, unlink);
+    Note(registration ? "(attach)%s" : unlink ? "%s" : "(keep link)%s", inHelper ? "h" : "");
+    if (inAdd || !registration || life == mLives[inNode]) Model(inNode, inSlot, way, inAdd, unlink);
     OnThread(inHelper, [&] {
-      WithListener(object, way, [&](const auto& inListener) { Call(inNode, inAdd, unlink, inListener); });
+      if (registration && !inAdd) return attached.Reset();
+      WithListener(mHandles[inSlot], way, [&](const auto& inListener) {
+        if (!registration) return Call(inNode, inAdd, unlink, inListener);
+        Tarn::Registration made = inNode == 0 ? Tarn::Attach(mB0, inListener) : Tarn::Attach(mIDs[inNode], inListener);
+        // The earlier registration is given up, not reset: it would remove the entry just made.
+        attached.Release(), attached = std::move(made), life = mLives[inNode];
+      });
     });
   }
 
   template <class Use>
-  static void WithListener(Object& ioObject, int inWay, Use inUse) {
+  static void WithListener(Handles& ioObject, int inWay, Use inUse) {
     switch (inWay) {
       case kPlain: return inUse(ioObject.mListener);
       case kBoost: return inUse(boost::weak_ptr<Tarn::Listener>(ioObject.mBoost));
@@ -340,15 +402,18 @@ private:
     Note(inHelper ? " kill%dh" : " kill%d", inSlot);
     object.mOwned = false;
     if (object.mHolds == 0) Die(inSlot);
-    OnThread(inHelper, [&] { object.mPlain.reset(), object.mBoost.reset(), object.mStd.reset(), object.mSafe = nullptr; });
+    Handles& handles = mHandles[inSlot];
+    // Given up first: a plain listener detaches itself as it dies, a weak or safe entry stays for a broadcast to prune.
+    for (auto& attached : handles.mAttached) attached[0].Release(), attached[1].Release();
+    OnThread(inHelper, [&] { handles.mPlain.reset(), handles.mBoost.reset(), handles.mStd.reset(), handles.mSafe = nullptr; });
   }
 
   void Listen(int inSlot, bool inOn) {
-    Object& object = mObjects[inSlot];
-    if (!object.mOwned || object.mListener == nullptr) return;
+    Tarn::Listener* listener = mHandles[inSlot].mListener;
+    if (!mObjects[inSlot].mOwned || listener == nullptr) return;
     Note(inOn ? " listen%d" : " deaf%d", inSlot);
-    object.mListening = inOn;
-    inOn ? object.mListener->StartListening() : object.mListener->StopListening();
+    mObjects[inSlot].mListening = inOn;
+    inOn ? listener->StartListening() : listener->StopListening();
   }
 
   void SetBroadcasting(int inNode, bool inOn) {
@@ -504,7 +569,7 @@ private:
 
   // A station deleted: it leaves the broadcasters it relays, its listeners lose it.
   void Delete(int inNode) {
-    mNodes[inNode] = Node();
+    mNodes[inNode] = Node(), ++mLives[inNode];
     for (Object& object : mObjects) object.mLinks[inNode] = 0;
     for (Node& node : mNodes) Erase(node.mEntries, [&](const Entry& inEntry) { return inEntry.mWho == kSlots + inNode; });
   }
@@ -565,10 +630,11 @@ private:
     for (int slot = 0; slot < kSlots; ++slot) {
       Object& object = mObjects[slot];
       if (object.mKind >= 0 && object.mDestroyed == object.mAlive) Fail("slot " + std::to_string(slot) + " lives against the model");
-      for (int node = 0; node < kNodes && object.mOwned && object.mListener != nullptr; ++node) {
+      Tarn::Listener* listener = mHandles[slot].mListener;
+      for (int node = 0; node < kNodes && object.mOwned && listener != nullptr; ++node) {
         Tarn::Broadcaster* broadcaster = node == 0 ? &mB0 : mStations[node];
-        if (broadcaster != nullptr && (broadcaster->HasListener(object.mListener) != HasEntry(node, slot, kPlain) ||
-                                       object.mListener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0)))
+        if (broadcaster != nullptr && (broadcaster->HasListener(listener) != HasEntry(node, slot, kPlain) ||
+                                       listener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0)))
           Fail("registration or back-link of slot " + std::to_string(slot) + " at " + std::to_string(node));
       }
     }
@@ -587,6 +653,29 @@ private:
   // release it (0: none).
   struct Level { std::size_t mBase; int mRetained; };
   std::vector<Level> mLevels;  // per broadcast begun by the harness
+  int mLives[kNodes] = {};  // stations of the node deleted so far
+  // The model, as an operation whose call throws std::bad_alloc must leave it.
+  struct Snapshot {
+    std::vector<Node> mNodes;
+    std::vector<Object> mObjects;
+    std::vector<Frame> mFrames;
+    std::vector<Level> mLevels;
+    std::vector<int> mLives;
+    bool mTimerListening = false;
+  };
+  Snapshot Save() const {
+    return Snapshot{{std::begin(mNodes), std::end(mNodes)}, {std::begin(mObjects), std::end(mObjects)}, mFrames, mLevels,
+                    {std::begin(mLives), std::end(mLives)}, mTimerListening};
+  }
+  void Restore(const Snapshot& inSnapshot) {
+    std::copy(inSnapshot.mNodes.begin(), inSnapshot.mNodes.end(), mNodes);
+    std::copy(inSnapshot.mObjects.begin(), inSnapshot.mObjects.end(), mObjects);
+    std::copy(inSnapshot.mLives.begin(), inSnapshot.mLives.end(), mLives);
+    mFrames = inSnapshot.mFrames, mLevels = inSnapshot.mLevels, mTimerListening = inSnapshot.mTimerListening;
+  }
+  int mFailAt = -1;      // the allocation failure the current operation drew: see OnThread; -1: none
+  bool mThrew = false;   // the current operation's library call threw std::bad_alloc
+  Handles mHandles[kSlots];
   bool mStale = false;         // the library runs the innermost broadcast past the last call the model walked to
   int mToken = 1, mHandlerActions = 0;
   bool mMain = true, mTimerListening = false;  // mMain: the library is initialized (this thread is its main thread)
@@ -606,11 +695,7 @@ inline std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator:
 // One sequence of at most inSteps operations; returns the failure, or an empty string.
 inline std::string RunSequence(Choices& ioChoices, int inSteps) {
   const std::size_t baseline = BlocksInUse();
-  const std::string failure = [&] {
-    Harness harness(ioChoices);
-    harness.Run(inSteps);
-    return harness.Finish();
-  }();
+  const std::string failure = Harness(ioChoices).Run(inSteps);
   return failure.empty() && BlocksInUse() != baseline ? "small blocks leaked" : failure;
 }
 
