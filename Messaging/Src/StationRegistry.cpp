@@ -233,7 +233,9 @@ void ReportLeftovers(const StationMap& inDoomed, const void* inCallSite) {
   for (const auto& element : inDoomed) {
     const StationRecord& record = element.second;
     if (record.mStation == nullptr) continue;
-    if (record.mRetainCount != 0 && retained++ == 0) firstRetained = &record;
+    // The holds of calls still running (a handler's delivery among them) are
+    // the library's own, not the host's to balance.
+    if (record.mRetainCount > record.mCallHolds && retained++ == 0) firstRetained = &record;
     const std::size_t count = BroadcasterCore::CountListeners(*record.mStation);
     if (count != 0 && listened++ == 0) {
       firstListened = &record;
@@ -242,7 +244,8 @@ void ReportLeftovers(const StationMap& inDoomed, const void* inCallSite) {
   }
   if (firstRetained != nullptr) {
     Diagnostics::Detail::ReportSilentFailure(Failure::kRetainedAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
-                                             firstRetained->mStationID, retained, firstRetained->mRetainCount);
+                                             firstRetained->mStationID, retained,
+                                             firstRetained->mRetainCount - firstRetained->mCallHolds);
   }
   if (firstListened != nullptr) {
     Diagnostics::Detail::ReportSilentFailure(Failure::kListenersAtTerminate, inCallSite, "Tarn::Messaging::Terminate",

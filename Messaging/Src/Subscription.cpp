@@ -163,11 +163,12 @@ OwnedListener::~OwnedListener() = default;
 
 void OwnedListener::Dispose() noexcept {
   DetachFromBroadcasters();
-  // Deliveries run on the main thread only. Off it, the detach above has
-  // waited for any of them (and mDepth is not read there); on it, a running
-  // one is on this very stack, and its handler (with what it captured) must
-  // outlive its return.
-  if (kivcore::threads::CurrentThreadIsMainThread() && mDepth > 0) {
+  // The detach above has waited for every delivery to this listener on
+  // another thread, so a handler call still counted runs on this very
+  // stack, and the handler (with what it captured) must outlive its return.
+  // The stack decides, not whether this thread is the main thread now: a
+  // handler that made the last Terminate runs on a thread that no longer is.
+  if (mDepth > 0) {
     mDisposed = true;
     return;
   }

@@ -22,7 +22,7 @@ namespace Utils = Tarn::StationUtils;
 using messaging_test::CallLog;
 using messaging_test::RecordingListener;
 
-// A "quit" listener ends the library while the station it hears from is
+// A "quit" subscription ends the library while the station it hears from is
 // broadcasting: the station once went at once (use after free), and a later
 // handler removing itself, its thread no longer the main thread, waited for
 // its own delivery for ever.
@@ -33,13 +33,20 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   const ImmutableString id = Registry::UniqueStationID();
   Registry::RegisterStation(id, &CountingFactory);
   CallLog log;
-  RecordingListener oldest("oldest", &log), leaving("leaving", &log), quit("quit", &log);
-  quit.SetAction([&](const Tarn::Message&) { Tarn::Messaging::Terminate(); });
+  RecordingListener oldest("oldest", &log), leaving("leaving", &log);
   leaving.SetAction([&](const Tarn::Message&) { Utils::RemoveListener(id, &leaving); });
   oldest.SetAction([&](const Tarn::Message&) {
     EXPECT_EQ(StationLog::Destructions(), 0) << "the station went under its own broadcast";
   });
-  for (RecordingListener* listener : {&oldest, &leaving, &quit}) Utils::AddListener(id, listener);
+  for (RecordingListener* listener : {&oldest, &leaving}) Utils::AddListener(id, listener);
+  // Its thread no longer the main thread, the handler resets its own
+  // subscription and then uses what it captured: freed only as it returns.
+  Tarn::Registration quit;
+  quit = Tarn::Subscribe<NumberMessage>(id, [&, name = std::string("quit")](const NumberMessage& inMessage) {
+    Tarn::Messaging::Terminate();
+    quit.Reset();
+    log.Record(name + ":" + std::to_string(inMessage.mValue));
+  });
   Utils::BroadcastMessage(id, NumberMessage(1));
   EXPECT_EQ(log.Entries(), (std::vector<std::string>{"quit:1", "leaving:1", "oldest:1"}));
   EXPECT_EQ(StationLog::Destructions(), 1) << "the station outlived its broadcast";

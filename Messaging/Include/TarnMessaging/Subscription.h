@@ -143,15 +143,16 @@ public:
   OwnedListener& operator=(const OwnedListener&) = delete;
 
   /// Detaches (waiting off the main thread as RemoveListener does), then
-  /// deletes this listener, or, when called on the main thread from inside
-  /// its own handler, deletes it as that handler returns.
+  /// deletes this listener, or, when called from inside its own handler
+  /// (the main thread's, or one that made the last Terminate), deletes it as
+  /// that handler returns.
   void Dispose() noexcept;
 
 protected:
   OwnedListener() noexcept = default;
   ~OwnedListener() override;
 
-  /// Marks one handler call on the main thread for Dispose.
+  /// Marks one handler call for Dispose.
   class Delivery {
   public:
     /// Counts one handler call on ioListener until the scope ends.
@@ -167,8 +168,8 @@ protected:
   };
 
 private:
-  int mDepth = 0;          // handler calls running; main thread only
-  bool mDisposed = false;  // Dispose ran inside a handler call; main thread only
+  int mDepth = 0;          // handler calls running; on the delivering thread
+  bool mDisposed = false;  // Dispose ran inside a handler call, on its thread
 };
 
 /// A subscription's listener: calls mHandler for messages of type T only.
