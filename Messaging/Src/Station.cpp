@@ -7,6 +7,7 @@
 #include "PostKinds.h"
 #include "StationRetirement.h"
 
+#include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
 namespace Tarn {
@@ -39,8 +40,14 @@ Station::~Station() {
   DetachFromBroadcasters();
   // The registry removes a station's record before deleting it, so this
   // lookup normally finds nothing; it also makes a registry that is already
-  // gone at process exit say so.
-  StationRegistry::FindStation(mStationID);
+  // gone at process exit say so. For an ID registered anew it makes that
+  // record's station, and the factory may throw (std::bad_alloc included):
+  // a destructor cannot let that out, so the error manager gets it and the
+  // destruction goes on.
+  kivcore::config::ErrorManager::Get(false)->GuardedCall([this] {
+    StationRegistry::FindStation(mStationID);
+    return 1;
+  });
 }
 
 void Station::BroadcastCounted(const Message& inMessage) {

@@ -20,43 +20,47 @@ struct Registration::Record {
 };
 
 struct RegistrationFactory {
-  static Registration ForEntry(const Broadcaster& inBroadcaster, const ListenerEntry& inEntry) {
+  // Allocates the record, then has inAttach attach the listener and fill in
+  // the entry to remove later; in that order, so that an attach whose record
+  // cannot be had throws with nothing attached. inAttach returns false when
+  // the broadcaster refused the input (and reported it): the registration is
+  // then empty, never one that would remove something else later.
+  template <class Attacher>
+  static Registration Make(const Broadcaster& inBroadcaster, Attacher inAttach) {
     Registration result(new Registration::Record);
+    if (!inAttach(result.mRecord->mEntry)) return Registration();
     result.mRecord->mCore = Registration::CoreOf(inBroadcaster);
-    result.mRecord->mEntry = inEntry;
     return result;
   }
 };
 
 namespace {
 
-// The broadcaster's AddListener reports misuse; an input it refused gives an
-// empty registration, never a record that would remove something else later.
 Registration AttachPlain(Broadcaster& ioBroadcaster, Listener* inListener) {
-  ioBroadcaster.AddListener(inListener);
-  if (inListener == nullptr) return Registration();
-  ListenerEntry entry;
-  entry.mListener = inListener;
-  return RegistrationFactory::ForEntry(ioBroadcaster, entry);
+  return RegistrationFactory::Make(ioBroadcaster, [&](ListenerEntry& outEntry) {
+    ioBroadcaster.AddListener(inListener);
+    outEntry.mListener = inListener;
+    return inListener != nullptr;
+  });
 }
 
 template <class WeakPtr>
 Registration AttachWeak(Broadcaster& ioBroadcaster, const WeakPtr& inListener, WeakPtr ListenerEntry::*inField) {
-  ioBroadcaster.AddListener(inListener);
-  if (inListener.expired()) return Registration();
-  ListenerEntry entry;
-  entry.*inField = inListener;
-  return RegistrationFactory::ForEntry(ioBroadcaster, entry);
+  return RegistrationFactory::Make(ioBroadcaster, [&](ListenerEntry& outEntry) {
+    ioBroadcaster.AddListener(inListener);
+    outEntry.*inField = inListener;
+    return !inListener.expired();
+  });
 }
 
 Registration AttachSafe(Broadcaster& ioBroadcaster, const ISafeListenerRef& inListener) {
-  ioBroadcaster.AddListener(inListener);
-  ListenerEntry entry;
-  // The weak-reference block, not a counted reference: the registration
-  // must not keep the listener alive.
-  entry.mSafeListener = GetSafeListenerHandle(inListener);
-  if (!entry.mSafeListener) return Registration();
-  return RegistrationFactory::ForEntry(ioBroadcaster, entry);
+  return RegistrationFactory::Make(ioBroadcaster, [&](ListenerEntry& outEntry) {
+    ioBroadcaster.AddListener(inListener);
+    // The weak-reference block, not a counted reference: the registration
+    // must not keep the listener alive.
+    outEntry.mSafeListener = GetSafeListenerHandle(inListener);
+    return static_cast<bool>(outEntry.mSafeListener);
+  });
 }
 
 template <class Attacher>

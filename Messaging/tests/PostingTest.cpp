@@ -1,4 +1,4 @@
-// Bringing the library up and down while storage runs out, and posting
+// Bringing the library up and down and attaching while storage runs out, and posting
 // afterwards.
 //
 // This executable replaces the global operator new so that a test can make
@@ -10,6 +10,8 @@
 #include <TarnMessaging.h>
 
 #include <kivcore/SmallBlockAllocator.h>
+
+#include <boost/make_shared.hpp>
 
 #include <gtest/gtest.h>
 
@@ -78,6 +80,59 @@ TEST(PostingTest, InitializeAndTerminateSurviveEveryFailingAllocation) {
     }
     EXPECT_TRUE(allSucceeded) << "the sweep never got past the failures";
   }
+}
+
+// Every form of Tarn::Attach, failing at each of its heap allocations in
+// turn: one that throws std::bad_alloc leaves nothing attached. The record
+// was once allocated after the listener was added, and its failure left a
+// listener hearing every broadcast with no registration to detach it.
+TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
+  MainThreadGuard mainThread;
+  Tarn::Messaging::Initialize();
+  Tarn::Broadcaster broadcaster;
+  RecordingListener plain("plain");
+  const auto boostListener = boost::make_shared<RecordingListener>("boost");
+  const auto stdListener = std::make_shared<RecordingListener>("std");
+  auto* const safe = new CountedSafeListener("safe");
+  const Tarn::ISafeListenerRef safeRef(safe);
+  const CallRecorder* const recorders[] = {&plain, boostListener.get(), stdListener.get(), safe};
+  auto heard = [&] {
+    int calls = 0;
+    for (const CallRecorder* recorder : recorders) calls += recorder->Calls();
+    return calls;
+  };
+  for (const bool onStation : {false, true}) {
+    Tarn::Broadcaster& target = onStation ? *Tarn::StationRegistry::FindStation(Tarn::kStation_StatusBar) : broadcaster;
+    auto attach = [&](const auto& inListener) {
+      return onStation ? Tarn::Attach(Tarn::kStation_StatusBar, inListener) : Tarn::Attach(broadcaster, inListener);
+    };
+    const std::function<Tarn::Registration()> forms[] = {
+        [&] { return attach(static_cast<Tarn::Listener*>(&plain)); },
+        [&] { return attach(boost::weak_ptr<Tarn::Listener>(boostListener)); },
+        [&] { return attach(std::weak_ptr<Tarn::Listener>(stdListener)); },
+        [&] { return attach(safeRef); },
+    };
+    for (const auto& form : forms) {
+      for (long long n = 0; n < 100 && !HasFailure(); ++n) {
+        SCOPED_TRACE(std::string(onStation ? "station" : "broadcaster") + " form " + std::to_string(&form - forms) +
+                     ", failing after " + std::to_string(n));
+        const int before = heard();
+        try {
+          gHeapAllocationsLeft.store(n);
+          const Tarn::Registration registration = form();
+          gHeapAllocationsLeft.store(-1);
+          target.BroadcastMessage(PingMessage());
+          EXPECT_EQ(heard(), before + 1);
+          break;
+        } catch (const std::bad_alloc&) {
+          gHeapAllocationsLeft.store(-1);
+        }
+        target.BroadcastMessage(PingMessage());
+        EXPECT_EQ(heard(), before) << "a failed attach left its listener attached";
+      }
+    }
+  }
+  Tarn::Messaging::Terminate();
 }
 
 // Once warmed up, posting and delivering take no general-heap storage at all:

@@ -93,4 +93,18 @@ TEST_F(StationTest, ARetainThatMakesNoStationLeavesNoCountBehind) {
   Registry::ReleaseStation(id);  // no longer registered: nothing to release, nothing read
 }
 
+// A station a worker's disposal queued, whose ID is then registered anew with
+// a factory that throws: deleting it looks its ID up, which runs the factory
+// inside the destructor. The process once ended there; now the failure goes
+// to the error manager and the deletion completes.
+TEST_F(StationTest, AStationWhoseIDWasRegisteredAnewWithAFailingFactoryIsDeletedAndTheFailureReported) {
+  messaging_test::ExceptionRecorder failures;
+  const ImmutableString id = MakeCounted();
+  RunOnWorker([&] { Registry::DisposeStation(id); });
+  Registry::RegisterStation(id, [](const ImmutableString&) -> Tarn::Station* { throw std::runtime_error("factory"); });
+  DrainPendingStations();
+  EXPECT_EQ(StationLog::Destructions(), 1);
+  EXPECT_EQ(failures.Messages(), std::vector<std::string>{"factory"});
+}
+
 }  // namespace
