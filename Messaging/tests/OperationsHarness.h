@@ -84,13 +84,14 @@ constexpr int kFailPoints = 6;
 // Entry.mWho of the timer, and of a weak or safe entry whose object died before its slot was reused; kSlots + n:
 // station n as a relay.
 constexpr int kTimer = kSlots + kNodes, kGone = -1;
-enum Way { kPlain, kBoost, kStd, kSafe };
+enum Way { kPlain, kBoost, kStd, kSafe, kSub };  // kSub: a subscription (Tarn::Subscribe), held by plain pointer
 
 class Harness;
 inline Harness* sHarness = nullptr;
 inline std::atomic<int> sLiveStations{0};
-// What the sequences ran so far: library calls made with an allocation failure drawn, and those that threw.
-inline struct Statistics { long long mFailingCalls = 0, mThrown = 0; } sStatistics;
+// What the sequences ran so far: library calls made with an allocation failure drawn, those that threw, and the
+// times the main thread moved to another thread.
+inline struct Statistics { long long mFailingCalls = 0, mThrown = 0, mMoves = 0; } sStatistics;
 void Called(int inSlot);
 void Destroyed(int inSlot);
 void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
@@ -104,6 +105,20 @@ struct Probe : Base {
   const int mSlot;
 };
 using PlainProbe = Probe<Tarn::Listener>;
+
+// A subscription's handler: the slot's object lives as long as the handler. It reads what it captured after the
+// call as well, which must still be there then, whatever the call did to its registration.
+struct Handler {
+  explicit Handler(int inSlot) : mSlot(std::make_unique<int>(inSlot)) {}
+  Handler(Handler&&) = default;
+  ~Handler() { mSlot ? Destroyed(*mSlot) : void(); }
+  void operator()(const Ping&) const {
+    const int slot = *mSlot;
+    Called(slot);
+    if (*mSlot != slot) Destroyed(kGone);
+  }
+  std::unique_ptr<int> mSlot;
+};
 
 // Reports its life for node mNode (1-4); -1: counted only.
 struct TrackedStation : Tarn::Station {
@@ -183,8 +198,8 @@ public:
       Note("\n%d:", step);
       Act(0);
       std::string failure;
-      if (!mMain && Pick(3) == 0)
-        return Note(" move"), OnThread(true, [&] { Initialize(), Compare(), failure = Run(inSteps, step + 1); }), failure;
+      if (!mMain && Pick(4) == 0)
+        return Note(" move"), ++sStatistics.mMoves, OnThread(true, [&] { Initialize(), Compare(), failure = Run(inSteps, step + 1); }), failure;
       if (!mMain) Initialize();
       Compare();
     }
@@ -217,10 +232,10 @@ public:
     Note(" [%d]", inSlot);
     mStale = false;
     const int actions = Pick(5) < 3 || mHandlerActions >= kMaxHandlerActions ? 0 : 1 + Pick(2);
-    for (int action = 0; action < actions && mFailure.empty(); ++action, ++mHandlerActions) Act(static_cast<int>(mLevels.size()));
+    for (int action = 0; action < actions && mFailure.empty(); ++action, ++mHandlerActions) Act(static_cast<int>(mLevels.size()), inSlot);
     mStale = true;
   }
-  void OnDestroyed(int inSlot) { mObjects[inSlot].mDestroyed = true; }
+  void OnDestroyed(int inSlot) { inSlot == kGone ? Fatal("a subscription's handler was destroyed while it ran") : void(mObjects[inSlot].mDestroyed = true); }
   void OnStation(int inNode, Tarn::Station* inStation) {
     const Node& node = mNodes[inNode];
     // Inside the library, after the last handler it called, the model has yet to walk the rest of the innermost
@@ -286,17 +301,19 @@ private:
     Note(mThrew ? " (bad_alloc at %d)" : " (done despite %d)", failAt);
   }
 
-  // One operation, from the top (inLevel 0) or from a handler; a quarter of them with an allocation failure.
-  void Act(int inLevel) {
-    // Low slots come more often, so that operations meet on the same listener.
-    const int slot = std::min(Pick(kSlots), Pick(kSlots)), node = Pick(kNodes), op = Pick(13), choice = Pick(8);
+  // One operation, from the top (inLevel 0) or from the handler of slot inCalled; a quarter of them with an
+  // allocation failure.
+  void Act(int inLevel, int inCalled = -1) {
+    // Low slots, and in a handler its own slot, come more often, so that operations meet on the same listener.
+    const int slot = inCalled >= 0 && Pick(3) == 0 ? inCalled : std::min(Pick(kSlots), Pick(kSlots));
+    const int node = Pick(kNodes), op = Pick(14), choice = Pick(8);
     const bool helper = mMain && Pick(4) == 0;
     const int failAt = Pick(4) == 0 ? Pick(2 * kFailPoints) : -1;
     Snapshot before = failAt >= 0 ? Save() : Snapshot();
     mFailAt = failAt;
     [&] {
       switch (op) {
-        case 0: return Create(slot);
+        case 0: return Create(slot, node);
         case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
         case 4: return Kill(slot, helper);
         case 5: return Listen(slot, choice < 5);
@@ -304,7 +321,8 @@ private:
         case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
         case 9: return Relay(node, choice % kIdle, choice < 5);
         case 10: case 11: return RegistryOp(node, choice % 5, helper);
-        default: return mMain ? TimerOp(choice) : Revive(inLevel, choice);
+        case 12: return mMain ? TimerOp(choice) : Revive(inLevel, choice);
+        default: return !mMain ? Revive(inLevel, choice) : inLevel > 0 ? Terminate() : TimerOp(choice);  // mostly from handlers
       }
     }();
     mFailAt = -1;
@@ -321,7 +339,7 @@ private:
     for (int node = 1; node < kNodes; ++node)
       if (mNodes[node].mFrames > 0) return;
     if (inChoice < 4) return Note(" init"), Initialize();
-    Note(" elsewhere{");
+    Note(" elsewhere{"), ++sStatistics.mMoves;
     OnThread(true, [&] {
       Initialize();
       for (int action = Pick(3); action >= 0 && mFailure.empty(); --action) Act(inLevel);
@@ -330,29 +348,41 @@ private:
     Note("}");
   }
 
-  void Create(int inSlot) {
+  void Create(int inSlot, int inNode) {
     Object& object = mObjects[inSlot];
     Handles& handles = mHandles[inSlot];
     if (object.mAlive) return;
     for (Node& node : mNodes)
       for (Entry& entry : node.mEntries) entry.mWho = entry.mWho == inSlot ? kGone : entry.mWho;
     object = Object(), handles.mListener = nullptr;
-    object.mKind = Pick(4);
+    object.mKind = Pick(5);
     object.mOwned = object.mAlive = true;
     Note(" new%d.%d", inSlot, object.mKind);
     switch (object.mKind) {
       case kPlain: handles.mListener = (handles.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
       case kBoost: handles.mListener = (handles.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
       case kStd: handles.mListener = (handles.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
-      default: handles.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot));
+      case kSafe: handles.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot)); break;
+      default: Subscribe(inSlot, inNode == kIdle ? 0 : inNode);  // idle messages are not pings
     }
+  }
+
+  // A subscription is made attached, and gone at once when its station ID is not registered.
+  void Subscribe(int inSlot, int inNode) {
+    Note("@%d", inNode);
+    Model(inNode, inSlot, kSub, true, true);
+    if (!Reach(inNode)) mObjects[inSlot].mOwned = false, Die(inSlot);
+    OnThread(false, [&] {
+      Tarn::Registration made = inNode == 0 ? Tarn::Subscribe<Ping>(mB0, Handler(inSlot)) : Tarn::Subscribe<Ping>(mIDs[inNode], Handler(inSlot));
+      mHandles[inSlot].mAttached[0][0] = std::move(made);
+    });
   }
 
   // Added or removed by the broadcaster's or the utilities' call, or by a registration of Tarn::Attach: made, or
   // reset (which removes nothing once the station it was made in is gone).
   void AddOrRemove(int inSlot, int inNode, bool inAdd, int inChoice, bool inHelper) {
     Object& object = mObjects[inSlot];
-    if (!object.mOwned) return;
+    if (!object.mOwned || object.mKind == kSub) return;
     // Objects owned by a shared pointer are sometimes registered by plain pointer: a second entry.
     const int way = (object.mKind == kBoost || object.mKind == kStd) && inChoice < 3 ? kPlain : object.mKind;
     Tarn::Registration& attached = mHandles[inSlot].mAttached[inNode][way != kPlain];
@@ -397,15 +427,21 @@ private:
 
   void Kill(int inSlot, bool inHelper) {
     Object& object = mObjects[inSlot];
-    // Destroying a listener while a plain delivery to it runs is the owner's fault, not the library's.
-    if (!object.mOwned || Delivering(inSlot, kPlain)) return;
+    // Destroying a listener while a plain delivery to it runs is the owner's fault, not the library's. A
+    // subscription reset on a worker waits for its delivery on the main thread, while here the main thread waits.
+    const bool sub = object.mKind == kSub;
+    if (!object.mOwned || Delivering(inSlot, sub ? (inHelper ? kSub : -1) : kPlain)) return;
     Note(inHelper ? " kill%dh" : " kill%d", inSlot);
     object.mOwned = false;
+    // A subscription is detached at once, and its handler destroyed once no call of it runs.
+    for (Node& node : mNodes) Erase(node.mEntries, [&](const Entry& inEntry) { return sub && inEntry.mWho == inSlot; });
     if (object.mHolds == 0) Die(inSlot);
     Handles& handles = mHandles[inSlot];
     // Given up first: a plain listener detaches itself as it dies, a weak or safe entry stays for a broadcast to prune.
-    for (auto& attached : handles.mAttached) attached[0].Release(), attached[1].Release();
-    OnThread(inHelper, [&] { handles.mPlain.reset(), handles.mBoost.reset(), handles.mStd.reset(), handles.mSafe = nullptr; });
+    for (auto& attached : handles.mAttached) sub ? void() : (attached[0].Release(), attached[1].Release());
+    OnThread(inHelper, [&] {
+      handles.mAttached[0][0].Reset(), handles.mPlain.reset(), handles.mBoost.reset(), handles.mStd.reset(), handles.mSafe = nullptr;
+    });
   }
 
   void Listen(int inSlot, bool inOn) {
@@ -553,7 +589,7 @@ private:
   void Die(int inSlot) {
     mObjects[inSlot].mAlive = false;
     for (int node = 0; node < kNodes; ++node)
-      mObjects[inSlot].mLinks[node] = 0, Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && inEntry.mWay == kPlain; });
+      mObjects[inSlot].mLinks[node] = 0, Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && (inEntry.mWay == kPlain || inEntry.mWay == kSub); });
   }
 
   void Doom(int inNode) {
