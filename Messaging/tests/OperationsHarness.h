@@ -735,61 +735,85 @@ inline std::string RunSequence(Choices& ioChoices, int inSteps) {
   return failure.empty() && BlocksInUse() != baseline ? "small blocks leaked" : failure;
 }
 
-// For RunConcurrent: a call after the listener's removal returned is a fault.
+// For RunConcurrent: a call after the listener's removal returned is a fault. A drainer deletes, from its handler,
+// the stations workers let go, perhaps the relay it is called through.
 // Destroyed on the worker while the main thread may be delivering to it, so it detaches while still whole, as the
 // listener contract asks of such a class.
 struct Watcher : Tarn::Listener {
+  explicit Watcher(bool inDrains = false) : mDrains(inDrains) {}
   ~Watcher() override { DetachFromBroadcasters(); }
-  void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0; }
+  void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0, ++mCalls, mDrains ? Drain() : void(); }
   std::atomic<bool> mRemoved{false};
+  std::atomic<int> mCalls{0};
+  const bool mDrains;
   static inline std::atomic<int> sLateCalls{0};
 };
 
-// A worker tears down while the main thread broadcasts. Each round the worker makes a station, attaches it as a
-// relay to a broadcaster the main thread broadcasts on, gives it a listener (which also hears a well-known station),
-// removes or destroys the listener, and lets the station go by disposal and last release. Meanwhile the main thread
-// broadcasts on both, drains, and now and then disposes of the well-known station and registers it again.
-// Returns the failure, or an empty string.
+// Two workers tear down while the main thread broadcasts. Each round a worker makes a station, attaches it as a
+// relay to a broadcaster the main thread broadcasts on, gives it the drainer and a listener (which also hears a
+// well-known station), removes or destroys the listener, and lets the station go by disposal and last release, in
+// either order. Meanwhile the main thread broadcasts on both, drains, and now and then disposes of the well-known
+// station and registers it again. Then a worker adds, posts to and removes listeners of the well-known station while
+// the main thread makes the last Terminate and initializes again, over and over. Returns the failure, or "".
 inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
   const std::size_t baseline = BlocksInUse();
   const int lateCalls = Watcher::sLateCalls;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+  auto check = [&] { std::chrono::steady_clock::now() > deadline ? std::fprintf(stderr, "operations harness: a worker hangs\n"), std::abort() : void(); };
+  std::string failure;
   Tarn::Messaging::Initialize();
   {
     Tarn::Broadcaster parent;
-    std::atomic<bool> done{false};
-    auto worker = std::async(std::launch::async, [&] {
-      std::minstd_rand random(inSeed);
+    Watcher drainer(true);
+    std::atomic<int> working{2};
+    auto tearDown = [&](std::uint32_t inWorkerSeed) {
+      std::minstd_rand random(inWorkerSeed);
       for (int round = 0; round < inRounds; ++round) {
         const ImmutableString id = Registry::UniqueStationID();
         Registry::RegisterStation(id, &MakeCounted);
-        parent.AddListener(Registry::RetainStation(id));
+        Tarn::Station* station = Registry::RetainStation(id);
+        parent.AddListener(station), station->AddListener(&drainer);
         auto watcher = std::make_unique<Watcher>();
-        for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::AddListener(*station, watcher.get());
+        for (const ImmutableString* id : {&id, &Tarn::kStation_StatusBar}) Utils::AddListener(*id, watcher.get());
         if (random() % 2 == 0) {
-          for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::RemoveListener(*station, watcher.get());
+          for (const ImmutableString* id : {&id, &Tarn::kStation_StatusBar}) Utils::RemoveListener(*id, watcher.get());
           watcher->mRemoved = true;
         }
         if (random() % 2 == 0) watcher.reset();  // destroyed while attached, or once removed
-        Registry::DisposeStation(id);
-        Registry::ReleaseStation(id);  // the last: the station goes while the main thread may be relaying through it
+        // The last release deletes the station, or the main thread does once it was queued: while it may be relaying.
+        random() % 2 == 0 ? (Registry::DisposeStation(id), Registry::ReleaseStation(id)) : (Registry::ReleaseStation(id), Registry::DisposeStation(id));
       }
-      done = true;
-    });
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
-    for (int round = 0; !done; ++round) {
+      --working;
+    };
+    auto first = std::async(std::launch::async, tearDown, inSeed), second = std::async(std::launch::async, tearDown, inSeed + 1);
+    for (int round = 0; working > 0; ++round, check()) {
       parent.BroadcastMessage(Ping());
       Utils::BroadcastMessage(Tarn::kStation_StatusBar, Ping());
       Drain();
       if (round % 16 == 0) Registry::DisposeStation(Tarn::kStation_StatusBar), Registry::RegisterStation(Tarn::kStation_StatusBar, nullptr);
-      if (std::chrono::steady_clock::now() > deadline) std::fprintf(stderr, "operations harness: the worker hangs\n"), std::abort();
     }
-    worker.get();
+    first.get(), second.get();
     Drain();
+    if (parent.HasListeners()) failure = "a deleted relay is still attached";
+    if (drainer.mCalls == 0) failure = "no broadcast went through a relay";
   }
+  std::atomic<bool> done{false};
+  auto worker = std::async(std::launch::async, [&] {
+    for (int round = 0; round < inRounds / 2; ++round) {
+      Watcher watcher;
+      Utils::AddListener(Tarn::kStation_StatusBar, &watcher);
+      Utils::PostMessageToUIThread(Tarn::kStation_StatusBar, Ping(), true);
+      Utils::RemoveListener(Tarn::kStation_StatusBar, &watcher);
+      watcher.mRemoved = true;
+    }
+    done = true;
+  });
+  for (; !done; check()) Utils::BroadcastMessage(Tarn::kStation_StatusBar, Ping()), Drain(), Tarn::Messaging::Terminate(), Tarn::Messaging::Initialize();
+  worker.get();
   Tarn::Messaging::Terminate();
   if (Watcher::sLateCalls != lateCalls) return "a listener was called after its removal returned";
   if (sLiveStations != 0) return "stations outlived Terminate";
-  return BlocksInUse() != baseline ? "small blocks leaked" : "";
+  return !failure.empty() ? failure : BlocksInUse() != baseline ? "small blocks leaked" : "";
 }
 
 }  // namespace operations_harness
