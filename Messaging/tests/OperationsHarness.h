@@ -77,6 +77,13 @@ struct Choices {
 };
 
 struct Ping : Tarn::MessageImpl<Ping> {};
+struct Posted : Tarn::MessageImpl<Posted> {
+  explicit Posted(int inNumber) : mNumber(inNumber) {}
+  int mNumber;
+};
+inline int PostNumber(const Tarn::Message& inMessage) {
+  return inMessage.GetMessageID() == Posted::StaticMessageID() ? static_cast<const Posted&>(inMessage).mNumber : 0;
+}
 
 constexpr int kSlots = 5, kNodes = 5, kIdle = 4, kMaxLevels = 3, kMaxHandlerActions = 200;
 // An operation's failing allocation is one of the first kFailPoints on the heap or in small-block storage.
@@ -92,7 +99,7 @@ inline std::atomic<int> sLiveStations{0};
 // What the sequences ran so far: library calls made with an allocation failure drawn, those that threw, and the
 // times the main thread moved to another thread.
 inline struct Statistics { long long mFailingCalls = 0, mThrown = 0, mMoves = 0; } sStatistics;
-void Called(int inSlot);
+void Called(int inSlot, int inPost = 0);  // inPost: the number of the post delivered, 0: a broadcast
 void Destroyed(int inSlot);
 void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
 
@@ -101,7 +108,7 @@ template <class Base>
 struct Probe : Base {
   explicit Probe(int inSlot) : mSlot(inSlot) {}
   ~Probe() override { Destroyed(mSlot); }
-  void ListenToMessage(const Tarn::Message&) override { Called(mSlot); }
+  void ListenToMessage(const Tarn::Message& inMessage) override { Called(mSlot, PostNumber(inMessage)); }
   const int mSlot;
 };
 using PlainProbe = Probe<Tarn::Listener>;
@@ -166,6 +173,10 @@ struct Handles {
   Tarn::Listener* mListener = nullptr;  // while owned; null for safe listeners
   Tarn::Registration mAttached[kNodes][2];
   int mLife[kNodes][2] = {};
+};
+
+struct Queued {
+  int mNumber, mNode, mKind;  // mKind: see Harness::Post
 };
 
 struct Frame {
@@ -234,6 +245,18 @@ public:
     const int actions = Pick(5) < 3 || mHandlerActions >= kMaxHandlerActions ? 0 : 1 + Pick(2);
     for (int action = 0; action < actions && mFailure.empty(); ++action, ++mHandlerActions) Act(static_cast<int>(mLevels.size()), inSlot);
     mStale = true;
+  }
+  // A post was delivered: one the current run is to deliver, not before one delivered already. Its handler may
+  // make the last Terminate (outside broadcasts the model walks).
+  void OnPosted(int inSlot, int inPost) {
+    if (!mFailure.empty()) return;
+    const auto post = std::find_if(mRun.mPosts.begin(), mRun.mPosts.end(), [&](const Queued& inOne) { return inOne.mNumber == inPost; });
+    const std::size_t at = static_cast<std::size_t>(post - mRun.mPosts.begin());
+    if (post == mRun.mPosts.end()) return Fail("post " + std::to_string(inPost) + " delivered: cancelled, replaced, dropped or not due");
+    if (at < mRun.mAt) return Fail("post " + std::to_string(inPost) + " delivered after a later one");
+    mRun.mAt = at, ++mRun.mHeard[at * kSlots + inSlot];
+    Note(" <%d>%d", inSlot, inPost);
+    if (mLevels.empty() && mMain && Pick(8) == 0) Terminate();
   }
   void OnDestroyed(int inSlot) { inSlot == kGone ? Fatal("a subscription's handler was destroyed while it ran") : void(mObjects[inSlot].mDestroyed = true); }
   void OnStation(int inNode, Tarn::Station* inStation) {
@@ -306,7 +329,7 @@ private:
   void Act(int inLevel, int inCalled = -1) {
     // Low slots, and in a handler its own slot, come more often, so that operations meet on the same listener.
     const int slot = inCalled >= 0 && Pick(3) == 0 ? inCalled : std::min(Pick(kSlots), Pick(kSlots));
-    const int node = Pick(kNodes), op = Pick(14), choice = Pick(8);
+    const int node = Pick(kNodes), op = Pick(16), choice = Pick(8);
     const bool helper = mMain && Pick(4) == 0;
     const int failAt = Pick(4) == 0 ? Pick(2 * kFailPoints) : -1;
     Snapshot before = failAt >= 0 ? Save() : Snapshot();
@@ -322,6 +345,9 @@ private:
         case 9: return Relay(node, choice % kIdle, choice < 5);
         case 10: case 11: return RegistryOp(node, choice % 5, helper);
         case 12: return mMain ? TimerOp(choice) : Revive(inLevel, choice);
+        // Not to the idle station: any broadcast there runs the idle-time posts first.
+        case 13: return mMain ? Post(1 + node % 3, choice % 4, helper) : void();
+        case 14: return !mMain ? void() : choice < 5 ? Flush() : Cancel(choice);
         default: return !mMain ? Revive(inLevel, choice) : inLevel > 0 ? Terminate() : TimerOp(choice);  // mostly from handlers
       }
     }();
@@ -465,11 +491,13 @@ private:
     const bool retained = inNode != 0 && Reach(inNode);
     if (retained) ++mNodes[inNode].mRetains;
     mLevels.push_back(Level{mFrames.size(), retained ? inNode : 0});
-    if (mMain && (inNode == 0 || retained) && mNodes[inNode].mBroadcasting) Push(inNode);
+    const bool delivers = mMain && (inNode == 0 || retained) && mNodes[inNode].mBroadcasting;
+    if (delivers) Push(inNode);
     const bool stale = std::exchange(mStale, true);
     if (inNode == 0) mB0.BroadcastMessage(Ping());
-    else if (inNode == kIdle) Utils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
-    else Utils::BroadcastMessage(mIDs[inNode], Ping());
+    else if (inNode != kIdle) Utils::BroadcastMessage(mIDs[inNode], Ping());
+    // The idle-time posts waiting are delivered first; those its handlers make wait for the next.
+    else RunPosts(delivers ? &mPosts[1] : nullptr, [] { Utils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage()); });
     mStale = stale;
     const int missed = mFailure.empty() ? Next() : -1;
     if (missed >= 0) Fail("a broadcast ended without calling slot " + std::to_string(missed));
@@ -523,7 +551,7 @@ private:
       }
     });
     if (got != ((inOp == 1 || inOp == 2) && node.mRegistered ? mStations[inNode] : nullptr)) Fail("the registry returned another station");
-    if (inHelper) Drain();
+    if (inHelper) Flush();
     Settle();
   }
 
@@ -550,9 +578,75 @@ private:
     mTimer.reset(), Settle();
   }
 
+  // Posts: plain (inKind 0), coalesced (1), cancellable (2) and idle-time (3), to a station. A coalesced post takes
+  // the place of one waiting for the same station.
+  void Post(int inNode, int inKind, bool inHelper) {
+    static const char* const kKinds[] = {" post%d@%d", " coalesce%d@%d", " cancellable%d@%d", " idle%d@%d"};
+    const int number = mPostNumber++;
+    Note(kKinds[inKind], number, inNode), Note(inHelper ? "h" : "");
+    std::vector<Queued>& queue = mPosts[inKind == 3];
+    const auto same = std::find_if(queue.begin(), queue.end(), [&](const Queued& inPost) { return inKind == 1 && inPost.mKind == 1 && inPost.mNode == inNode; });
+    same != queue.end() ? void(same->mNumber = number) : queue.push_back(Queued{number, inNode, inKind});
+    Tarn::PostCancelToken token;
+    if (inKind == 2) mTokens.emplace_back(number, token);
+    OnThread(inHelper, [&] {
+      switch (inKind) {
+        case 0: return Utils::PostMessageToUIThread(mIDs[inNode], Posted(number), true);
+        case 1: return Utils::PostCoalescedMessageToUIThread(mIDs[inNode], Posted(number));
+        case 2: return Utils::PostMessageToUIThread(mIDs[inNode], Posted(number), token);
+        default: return Utils::PostMessageAtIdleTime(mIDs[inNode], Posted(number));
+      }
+    });
+  }
+
+  void Cancel(int inChoice) {
+    if (mTokens.empty()) return;
+    const auto cancelled = mTokens.begin() + inChoice % static_cast<int>(mTokens.size());
+    Note(" cancel%d", cancelled->first);
+    for (std::vector<Queued>& queue : mPosts)
+      queue.erase(std::remove_if(queue.begin(), queue.end(), [&](const Queued& inPost) { return inPost.mNumber == cancelled->first; }), queue.end());
+    cancelled->second.Cancel(), mTokens.erase(cancelled);
+  }
+
+  // What a main thread does for workers: runs the pending calls (the posts), deletes the stations they disposed of.
+  void Flush() {
+    Note(" flush");
+    RunPosts(&mPosts[0], [this] { Utils::FlushPostedMessagesOnUIThread(), mMain ? Drain() : void(); });
+  }
+
+  // inRun delivers the posts of ioDue (none if null), in order: each to every listener of its station, and of the
+  // stations relaying it, as the model has them now, unless a Terminate drops them.
+  template <class Deliver>
+  void RunPosts(std::vector<Queued>* ioDue, Deliver inRun) {
+    PostRun run;
+    if (ioDue != nullptr) run.mPosts = std::exchange(*ioDue, {});
+    for (const Queued& post : run.mPosts)
+      for (int slot = 0; slot < kSlots; ++slot) run.mExpected.push_back(Count(post.mNode, slot));
+    run.mHeard.assign(run.mExpected.size(), 0);
+    const PostRun outer = std::exchange(mRun, run);
+    inRun();
+    for (std::size_t at = 0; at < mRun.mHeard.size() && !mRun.mTerminated && mFailure.empty(); ++at)
+      if (mRun.mHeard[at] != mRun.mExpected[at])
+        Fail("post " + std::to_string(mRun.mPosts[at / kSlots].mNumber) + " heard " + std::to_string(mRun.mHeard[at]) + " times by slot " + std::to_string(at % kSlots) + "; the model expects " + std::to_string(mRun.mExpected[at]));
+    mRun = outer;
+  }
+
+  // How often a broadcast on inNode now reaches inSlot with a post (subscriptions take pings only).
+  int Count(int inNode, int inSlot) {
+    if (!mMain || !Reach(inNode) || !mNodes[inNode].mBroadcasting) return 0;
+    int count = 0;
+    for (const Entry& entry : mNodes[inNode].mEntries) {
+      const Object& object = mObjects[inSlot];
+      if (entry.mWho == inSlot) count += entry.mWay == kPlain ? object.mListening : entry.mWay != kSub && object.mAlive;
+      if (entry.mWho >= kSlots && entry.mWho < kTimer) count += Count(entry.mWho - kSlots, inSlot);
+    }
+    return count;
+  }
+
   void Terminate() {
     DestroyTimer();
     Note(" terminate");
+    mPosts[0].clear(), mPosts[1].clear(), mTokens.clear(), mRun.mTerminated = true;
     for (int node = 1; node < kNodes; ++node) Doom(node);
     mMain = false, Tarn::Messaging::Terminate(), Settle();
   }
@@ -690,6 +784,16 @@ private:
   struct Level { std::size_t mBase; int mRetained; };
   std::vector<Level> mLevels;  // per broadcast begun by the harness
   int mLives[kNodes] = {};  // stations of the node deleted so far
+  std::vector<Queued> mPosts[2];  // waiting for the next run of pending calls, and for the next idle broadcast
+  // The run of posts in progress: the posts, the one delivered last, and per post and slot the calls heard and due.
+  struct PostRun {
+    std::vector<Queued> mPosts;
+    std::size_t mAt = 0;
+    std::vector<int> mHeard, mExpected;
+    bool mTerminated = false;
+  } mRun;
+  int mPostNumber = 1;
+  std::vector<std::pair<int, Tarn::PostCancelToken>> mTokens;  // of the cancellable posts made since the last Terminate
   // The model, as an operation whose call throws std::bad_alloc must leave it.
   struct Snapshot {
     std::vector<Node> mNodes;
@@ -698,16 +802,18 @@ private:
     std::vector<Level> mLevels;
     std::vector<int> mLives;
     bool mTimerListening = false;
+    std::vector<Queued> mPosts[2];
   };
   Snapshot Save() const {
     return Snapshot{{std::begin(mNodes), std::end(mNodes)}, {std::begin(mObjects), std::end(mObjects)}, mFrames, mLevels,
-                    {std::begin(mLives), std::end(mLives)}, mTimerListening};
+                    {std::begin(mLives), std::end(mLives)}, mTimerListening, {mPosts[0], mPosts[1]}};
   }
   void Restore(const Snapshot& inSnapshot) {
     std::copy(inSnapshot.mNodes.begin(), inSnapshot.mNodes.end(), mNodes);
     std::copy(inSnapshot.mObjects.begin(), inSnapshot.mObjects.end(), mObjects);
     std::copy(inSnapshot.mLives.begin(), inSnapshot.mLives.end(), mLives);
     mFrames = inSnapshot.mFrames, mLevels = inSnapshot.mLevels, mTimerListening = inSnapshot.mTimerListening;
+    mPosts[0] = inSnapshot.mPosts[0], mPosts[1] = inSnapshot.mPosts[1];
   }
   int mFailAt = -1;      // the allocation failure the current operation drew: see OnThread; -1: none
   bool mThrew = false;   // the current operation's library call threw std::bad_alloc
@@ -719,7 +825,7 @@ private:
   Tarn::Broadcaster mB0;  // last: its listeners are gone before it
 };
 
-inline void Called(int inSlot) { sHarness->OnCall(inSlot); }
+inline void Called(int inSlot, int inPost) { inPost > 0 ? sHarness->OnPosted(inSlot, inPost) : sHarness->OnCall(inSlot); }
 inline void Destroyed(int inSlot) { sHarness != nullptr ? sHarness->OnDestroyed(inSlot) : void(); }
 inline void StationLife(int inNode, Tarn::Station* inStation) {
   if (inNode >= 0 && sHarness != nullptr) sHarness->OnStation(inNode, inStation);
