@@ -21,6 +21,7 @@
 #include <exception>
 #include <functional>
 #include <limits>
+#include <mutex>
 #include <new>
 #include <string>
 #include <thread>
@@ -65,6 +66,67 @@ public:
 private:
   RecursiveMutex& mMutex;
 };
+
+// The innermost broadcast running on this thread (of any core). Initial-
+// exec, as kivcore's allocator cache: one load or store relative to the
+// thread pointer, once per broadcast.
+thread_local const BroadcasterCore::Frame* tInnermostFrame __attribute__((tls_model("initial-exec"))) = nullptr;
+
+// A removal that waits while deliveries run on its own thread's stack (a
+// handler's removal, once another thread delivers too). Only such removals
+// can wait for one another in a circle: a thread with no delivery on its
+// stack is never waited for. They are listed process-wide while they wait;
+// a listed thread is blocked, so its frames stand still and others may read
+// them under sWaitsMutex, which is taken inside a core's lock, never the
+// other way round.
+struct WaitNode {
+  const BroadcasterCore* mCore;
+  const ListenerEntry* mEntry;
+  const BroadcasterCore::Frame* mInnermost;  // the remover's own deliveries
+  bool mReached;                             // for WaitsInACircle
+  WaitNode* mNext;
+};
+std::mutex sWaitsMutex;
+WaitNode* sWaits = nullptr;  // guarded by sWaitsMutex
+
+bool Delivers(const BroadcasterCore::Frame* inInnermost, const BroadcasterCore* inCore, const ListenerEntry& inEntry) {
+  for (const BroadcasterCore::Frame* frame = inInnermost; frame != nullptr; frame = frame->mOuter) {
+    if (frame->mDelivering && frame->mCore == inCore && frame->mCurrent == inEntry) return true;
+  }
+  return false;
+}
+
+// Whether ioStart, listed, waits for a delivery whose thread waits, through
+// a chain of listed removals, for a delivery on ioStart's own stack: none of
+// them would ever return. Every edge runs between blocked threads and stays
+// while they wait, so a circle is always found by the removal that closes
+// it. sWaitsMutex must be held.
+bool WaitsInACircle(WaitNode& ioStart) {
+  for (WaitNode* node = sWaits; node != nullptr; node = node->mNext) node->mReached = false;
+  ioStart.mReached = true;
+  for (bool grew = true; grew;) {
+    grew = false;
+    for (const WaitNode* waiter = sWaits; waiter != nullptr; waiter = waiter->mNext) {
+      if (!waiter->mReached) continue;
+      for (WaitNode* other = sWaits; other != nullptr; other = other->mNext) {
+        if (other == waiter || !Delivers(other->mInnermost, waiter->mCore, *waiter->mEntry)) continue;
+        if (other == &ioStart) return true;
+        if (!other->mReached) grew = other->mReached = true;
+      }
+    }
+  }
+  return false;
+}
+
+void Unlist(const WaitNode& inNode) noexcept {
+  std::lock_guard<std::mutex> guard(sWaitsMutex);
+  for (WaitNode** link = &sWaits; *link != nullptr; link = &(*link)->mNext) {
+    if (*link == &inNode) {
+      *link = inNode.mNext;
+      return;
+    }
+  }
+}
 
 }  // namespace
 
@@ -198,6 +260,34 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
   // which a handler may drop meanwhile.
   const std::uintptr_t self = kivcore::threads::CurrentThreadToken();
   if (!OtherThreadDelivers(inListener, self)) return Removed::kAtOnce;
+  WaitNode node{this, &inListener, tInnermostFrame, false, nullptr};
+  if (node.mInnermost != nullptr) {
+    bool circle = false;
+    {
+      std::lock_guard<std::mutex> guard(sWaitsMutex);
+      node.mNext = sWaits;
+      sWaits = &node;
+      circle = WaitsInACircle(node);
+      if (circle) sWaits = node.mNext;
+    }
+    if (circle) {
+      // The entry is gone, so no new delivery of it starts; the running one
+      // ends after the delivery on this stack does. The report runs without
+      // the lock, as host code must.
+      mMutex.Unlock();
+      TracingState::ReportMisuse("a removal inside a handler never waits for a delivery whose thread waits for that handler",
+                                 __FILE__, kRemoveListenerName, __LINE__);
+      mMutex.Lock("Broadcaster::RemoveListener2");
+      return Removed::kAtOnce;
+    }
+  }
+  // Unlisted on every way out of the wait below, which throws nothing.
+  struct Listed {
+    const WaitNode& mNode;
+    ~Listed() {
+      if (mNode.mInnermost != nullptr) Unlist(mNode);
+    }
+  } listed{node};
   // The lock is let go while this removal waits, and a handler on the
   // delivering thread may destroy the broadcaster meanwhile: the removal
   // holds the core itself from here, so that it finds a closed core rather
@@ -419,6 +509,8 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
   kivcore::config::ErrorManager* const errors = kivcore::config::ErrorManager::Get(false);
   Frame frame;
   frame.mThread = kivcore::threads::CurrentThreadToken();
+  frame.mCore = this;
+  frame.mOuter = tInnermostFrame;
   if constexpr (std::is_same<Policy, Traced>::value) frame.mTrace = &ioPolicy.mDelivery;
   bool currentIsPlain = true;  // frame.mCurrent has no weak field set
   bool gone = false;
@@ -440,11 +532,13 @@ void BroadcasterCore::Walk(const Message& inMessage, Policy& ioPolicy) {
     Frame& mFrame;
     bool mLinked = false;
     ~FrameScope() {
+      tInnermostFrame = mFrame.mOuter;
       if (!mLinked) return;
       Locked lock(mCore.mMutex, "Broadcaster::BroadcastMessage2");
       mCore.Unlink(mFrame);
     }
   } scope{*this, frame};
+  tInnermostFrame = &frame;
 
   // One hold of the lock links the frame and picks the first entry; each
   // later hold ends one delivery and picks the next.

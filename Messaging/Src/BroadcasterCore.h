@@ -15,7 +15,11 @@
 // newest one older than the last it served, whatever was added or removed
 // meanwhile. A removal erases the entry and then waits on one condition
 // variable until no frame on another thread delivers that listener: nothing
-// is allocated, and no thread ever waits for its own stack.
+// is allocated, and no thread ever waits for its own stack. Nor in a circle:
+// once the main thread has moved, two threads may each deliver inside a
+// handler, and a removal that would wait for a delivery whose thread waits,
+// through any chain of removals, for a delivery on the remover's own stack
+// is reported as misuse and returns at once instead.
 #pragma once
 
 #include <TarnMessaging/Broadcaster.h>
@@ -47,6 +51,10 @@ public:
     // A traced broadcast's broadcaster, station and message type, fixed
     // before the frame is linked; null when untraced.
     const Tracing::Delivery* mTrace = nullptr;
+    // The core it runs on, and the broadcasting thread's next outer frame
+    // (of any core): the thread's own deliveries, innermost first.
+    const BroadcasterCore* mCore = nullptr;
+    const Frame* mOuter = nullptr;
   };
   // A removal waiting for deliveries of an equal entry; on the remover's stack.
   struct Waiter {

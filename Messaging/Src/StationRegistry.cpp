@@ -51,14 +51,17 @@ struct StationRecord {
 using StationMap = std::map<ImmutableString, StationRecord, std::less<ImmutableString>,
                             Alloc<std::pair<const ImmutableString, StationRecord>>>;
 // A station the registry no longer lists but still owns. mRetired: kept for
-// the end of a broadcast on it (else: queued by a disposal off the main
-// thread, for the next main-thread disposal).
+// the end of a broadcast on it, or of the calls that hold it (else: queued
+// by a disposal off the main thread, for the next main-thread disposal).
 // mClaim: the nesting level of the running deletion sweep that will delete
-// it (0: none).
+// it (0: none). mCallHolds: the holds of calls that were running when a
+// Terminate took the station from the registry; the last of their releases
+// deletes it, and no sweep does before.
 struct PendingStation {
   Station* mStation;
   bool mRetired;
   std::uint32_t mClaim = 0;
+  std::uint32_t mCallHolds = 0;
 };
 using PendingStationList = std::vector<PendingStation, Alloc<PendingStation>>;
 
@@ -120,20 +123,31 @@ enum class Sweep {
   kEverything // at static destruction: every station, busy or not
 };
 
+// Deletes a station the registry no longer reaches, letting the registry's
+// lock go (one level of it) meanwhile: the station's detach may wait for a
+// delivery to it on another thread (the main thread may have moved), and
+// that delivery's end looks for retired stations under the lock. The lock
+// must be held.
+void DeleteUnlocked(Station* inStation) noexcept {
+  sStationRegistryMutex.Unlock();
+  StationRetirement::Delete(inStation);
+  sStationRegistryMutex.Lock(nullptr);
+}
+
 // Deletes the stations of the list that Sweep names and no broadcast holds,
 // in the order they were queued; a busy one stays, retired, for the end of
-// that broadcast. The registry's lock must be held. A station destructor may
-// dispose of another station and re-enter here: each call claims the
-// stations it will delete before deleting any, and a nested call deletes
-// only stations queued after that, so none is deleted twice and none is lost.
+// that broadcast. The registry's lock must be held; it is let go while each
+// station is deleted. A station destructor may dispose of another station
+// and re-enter here, and another thread may sweep meanwhile: each call
+// claims the stations it will delete, under a number no running call has,
+// before deleting any, and deletes only its own claims, so none is deleted
+// twice and none is lost.
 void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
-  static std::uint32_t sSweepDepth = 0;  // guarded by the registry's lock
-  const std::uint32_t sweep = ++sSweepDepth;
-  struct Leave {
-    ~Leave() { --sSweepDepth; }
-  } leave;
+  static std::uint32_t sLastSweep = 0;  // guarded by the registry's lock
+  if (++sLastSweep == 0) ++sLastSweep;  // 0 means unclaimed
+  const std::uint32_t sweep = sLastSweep;
   for (PendingStation& pending : ioList) {
-    if (pending.mClaim != 0) continue;
+    if (pending.mClaim != 0 || (inSweep != Sweep::kEverything && pending.mCallHolds != 0)) continue;
     if (inSweep != Sweep::kEverything && StationRetirement::IsBroadcasting(*pending.mStation)) {
       pending.mRetired = true;
     } else if (inSweep != Sweep::kRetired || pending.mRetired) {
@@ -145,7 +159,7 @@ void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
     if (doomed == ioList.end()) break;
     Station* const station = doomed->mStation;
     ioList.erase(doomed);
-    StationRetirement::Delete(station);
+    DeleteUnlocked(station);
   }
   sHasRetired.store(std::any_of(ioList.begin(), ioList.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
   // An empty list keeps no storage, so that a drained registry holds no
@@ -220,37 +234,65 @@ Station* CompleteDisposal(StationMap& ioMap, StationMap::iterator inFound, bool 
   return doomed;
 }
 
-// Reports the stations that Terminate is about to delete while they are
-// still retained or still have listeners: their users will find them gone
-// without a word. The map is the caller's own by now, so no lock is needed.
-void ReportLeftovers(const StationMap& inDoomed, const void* inCallSite) {
-  using Diagnostics::Detail::Failure;
-  std::size_t retained = 0;
-  std::size_t listened = 0;
-  const StationRecord* firstRetained = nullptr;
-  const StationRecord* firstListened = nullptr;
-  std::size_t listeners = 0;
-  for (const auto& element : inDoomed) {
-    const StationRecord& record = element.second;
-    if (record.mStation == nullptr) continue;
-    // The holds of calls still running (a handler's delivery among them) are
-    // the library's own, not the host's to balance.
-    if (record.mRetainCount > record.mCallHolds && retained++ == 0) firstRetained = &record;
-    const std::size_t count = BroadcasterCore::CountListeners(*record.mStation);
-    if (count != 0 && listened++ == 0) {
-      firstListened = &record;
-      listeners = count;
+// What Terminate finds left over in the registry it takes: stations still
+// retained by the host or with listeners still attached, whose users will
+// find them gone without a word. Counted under the registry's lock, while
+// every station is still there to count; reported after it is let go, since
+// the report calls the host's error handler.
+struct Leftovers {
+  std::size_t mRetained = 0;
+  std::size_t mListened = 0;
+  ImmutableString mFirstRetained;
+  std::size_t mRetainCount = 0;
+  ImmutableString mFirstListened;
+  std::size_t mListeners = 0;
+
+  void Count(const StationMap& inMap) {
+    for (const auto& element : inMap) {
+      const StationRecord& record = element.second;
+      if (record.mStation == nullptr) continue;
+      // The holds of calls still running (a handler's delivery among them)
+      // are the library's own, not the host's to balance.
+      if (record.mRetainCount > record.mCallHolds && mRetained++ == 0) {
+        mFirstRetained = record.mStationID;
+        mRetainCount = record.mRetainCount - record.mCallHolds;
+      }
+      const std::size_t count = BroadcasterCore::CountListeners(*record.mStation);
+      if (count != 0 && mListened++ == 0) {
+        mFirstListened = record.mStationID;
+        mListeners = count;
+      }
     }
   }
-  if (firstRetained != nullptr) {
-    Diagnostics::Detail::ReportSilentFailure(Failure::kRetainedAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
-                                             firstRetained->mStationID, retained,
-                                             firstRetained->mRetainCount - firstRetained->mCallHolds);
+
+  void Report(const void* inCallSite) const {
+    using Diagnostics::Detail::Failure;
+    if (mRetained != 0) {
+      Diagnostics::Detail::ReportSilentFailure(Failure::kRetainedAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
+                                               mFirstRetained, mRetained, mRetainCount);
+    }
+    if (mListened != 0) {
+      Diagnostics::Detail::ReportSilentFailure(Failure::kListenersAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
+                                               mFirstListened, mListened, mListeners);
+    }
   }
-  if (firstListened != nullptr) {
-    Diagnostics::Detail::ReportSilentFailure(Failure::kListenersAtTerminate, inCallSite, "Tarn::Messaging::Terminate",
-                                             firstListened->mStationID, listened, listeners);
-  }
+};
+
+// A call's release of a station that a Terminate retired while the call
+// held it: the last such release takes the station from the pending list
+// and returns it, to be deleted once the lock is let go, unless a broadcast
+// on it still runs (its end deletes it then). The registry's lock must be
+// held.
+Station* ReleaseRetiredHold(Station* inStation) noexcept {
+  PendingStationList& pending = GetPendingStationList();
+  const auto held = std::find_if(pending.begin(), pending.end(), [&](const PendingStation& inPending) {
+    return inPending.mStation == inStation && inPending.mCallHolds != 0;
+  });
+  if (held == pending.end() || --held->mCallHolds != 0 || StationRetirement::IsBroadcasting(*inStation)) return nullptr;
+  pending.erase(held);
+  sHasRetired.store(std::any_of(pending.begin(), pending.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
+  if (pending.empty()) PendingStationList().swap(pending);
+  return inStation;
 }
 
 }  // namespace
@@ -334,7 +376,7 @@ void DisposeStation(const ImmutableString& inStationID) {
   record.mStation = nullptr;
   map->erase(found);
   if (deleteNow) {
-    StationRetirement::Delete(station);
+    DeleteUnlocked(station);
   } else if (station != nullptr && onMainThread) {
     Retire(station);
   } else if (station != nullptr) {
@@ -372,38 +414,37 @@ void Terminate() { TerminateFrom(TARN_CALL_SITE()); }
 
 void TerminateFrom(const void* inCallSite) {
   StationMap doomed;
+  Leftovers leftovers;
   {
     RegistryLock lock("StationRegistry::Terminate");
     StationMapAccess map;
-    // Room for every station, in case each is still broadcasting; made
-    // before anything changes, so an exhausted allocator leaves the registry
-    // as it was.
+    // Room for every station, in case each is still in use; made before
+    // anything changes, so an exhausted allocator leaves the registry as it
+    // was, and used in this same hold, before another thread's disposal or
+    // sweep can take it or give it back.
     PendingStationList& pending = GetPendingStationList();
     pending.reserve(pending.size() + map->size());
+    if (Diagnostics::Detail::ReportsOn()) leftovers.Count(*map);
+    // A station that a running call holds (a worker's StationUtils call, a
+    // main-thread broadcast by ID that has not begun yet) or that a broadcast
+    // runs on (Terminate called from one of its handlers) is retired: it goes
+    // when the last of those calls lets it go, or when that broadcast ends.
+    for (auto& element : *map) {
+      StationRecord& record = element.second;
+      if (record.mStation == nullptr) continue;
+      if (record.mCallHolds == 0 && !StationRetirement::IsBroadcasting(*record.mStation)) continue;
+      pending.push_back(PendingStation{record.mStation, true, 0, record.mCallHolds});
+      sHasRetired.store(true);
+      record.mStation = nullptr;
+    }
+    if (pending.empty()) PendingStationList().swap(pending);
     doomed.swap(*map);
     ++sLife;
   }
-  if (Diagnostics::Detail::ReportsOn()) ReportLeftovers(doomed, inCallSite);
+  leftovers.Report(inCallSite);
   // Station destructors run without the registry's lock; each looks itself
-  // up and finds nothing. A station with a broadcast in progress (Terminate
-  // called from one of its handlers) is retired and goes when that broadcast
-  // ends.
-  for (auto& element : doomed) {
-    Station* station = element.second.mStation;
-    element.second.mStation = nullptr;
-    if (station == nullptr) continue;
-    if (StationRetirement::IsBroadcasting(*station)) {
-      RegistryLock lock("StationRegistry::Terminate");
-      Retire(station);
-    } else {
-      StationRetirement::Delete(station);
-    }
-  }
-  // Stations retired here go at the end of their broadcasts, like every
-  // retired station; the room made for them is given back if none was.
-  RegistryLock lock("StationRegistry::Terminate");
-  PendingStationList& pending = GetPendingStationList();
-  if (pending.empty()) PendingStationList().swap(pending);
+  // up and finds nothing.
+  for (auto& element : doomed) StationRetirement::Delete(std::exchange(element.second.mStation, nullptr));
 }
 
 }  // namespace StationRegistry
@@ -436,26 +477,30 @@ Station* StationRetainer::Retain(const ImmutableString& inStationID, Hold* outHo
   return station;
 }
 
-void StationRetainer::Release(const Hold& inHold) noexcept {
+void StationRetainer::Release(const Hold& inHold, Station* inStation) noexcept {
   Station* doomed = nullptr;
   {
     RegistryLock lock("StationRegistry::ReleaseStation");
     // After a Terminate the record is gone, and the ID may name a new
-    // station that this hold never counted.
-    if (inHold.mLife != sLife) return;
-    StationMapAccess map;
-    if (map.IsOrphan()) return;
-    // The record stands: only this hold's own release removes a record
-    // while call holds remain.
-    StationRecord& record = *static_cast<StationRecord*>(inHold.mRecord);
-    --record.mCallHolds;
-    // A count of 0 here is a host's unbalanced release: the disposal this
-    // hold deferred is still completed.
-    if (record.mRetainCount > 1 || !record.mDisposeRequested || record.mCallHolds != 0) {
-      --record.mRetainCount;
-      return;
+    // station that this hold never counted: the hold is on the station that
+    // Terminate retired instead.
+    if (inHold.mLife != sLife) {
+      doomed = ReleaseRetiredHold(inStation);
+    } else {
+      StationMapAccess map;
+      if (map.IsOrphan()) return;
+      // The record stands: only this hold's own release removes a record
+      // while call holds remain.
+      StationRecord& record = *static_cast<StationRecord*>(inHold.mRecord);
+      --record.mCallHolds;
+      // A count of 0 here is a host's unbalanced release: the disposal this
+      // hold deferred is still completed.
+      if (record.mRetainCount > 1 || !record.mDisposeRequested || record.mCallHolds != 0) {
+        --record.mRetainCount;
+        return;
+      }
+      doomed = CompleteDisposal(*map, map->find(record.mStationID), true);
     }
-    doomed = CompleteDisposal(*map, map->find(record.mStationID), true);
   }
   // Deleted after the lock is released: on a worker thread the station's
   // destructor waits for a delivery to it running on the main thread, whose

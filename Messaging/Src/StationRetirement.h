@@ -6,6 +6,8 @@
 // on the main thread, retires it instead while that count is not 0; retired
 // stations are deleted when the outermost of those broadcasts ends, by the
 // registry's main-thread disposals and releases, and after Terminate.
+// Terminate also retires the stations that running calls hold by ID; the
+// last of those calls' releases deletes them.
 #pragma once
 
 #include <TarnMessaging/Station.h>

@@ -4,6 +4,7 @@
 #include "TestSupport.h"
 
 #include <TarnMessaging/Broadcaster.h>
+#include <TarnMessaging/Messaging.h>
 
 #include <gtest/gtest.h>
 
@@ -132,6 +133,44 @@ TEST(BroadcasterThreads, ASecondRemovalWhileAnEarlierOneWaitsIsReported) {
   second.join();
   EXPECT_EQ(returned.load(), 2);
   EXPECT_EQ(dialog.Count(), 1u);
+  EXPECT_FALSE(broadcaster.HasListeners());
+}
+
+// The main thread moves while a handler runs: L1's handler makes the last
+// Terminate and, while another thread (initialized anew) delivers L2 on the
+// same broadcaster, removes L2; L2's handler there removes L1, whose
+// delivery waits for it. Both once waited for ever; now the removal that
+// closes the circle is reported and returns.
+TEST(BroadcasterThreads, RemovalsInHandlersOnTwoThreadsNeverWaitInACircle) {
+  messaging_test::Watchdog watchdog;
+  messaging_test::ContractDialogRecorder dialog;
+  messaging_test::ErrorRecorder errors;
+  Tarn::Messaging::Initialize();
+  Tarn::Broadcaster broadcaster;
+  messaging_test::RecordingListener first("L1"), second("L2");
+  Latch delivering;
+  ThreadGroup mover;
+  first.SetAction([&](const Tarn::Message&) {
+    if (first.Calls() != 1) return;
+    Tarn::Messaging::Terminate();
+    mover.Start([&] {
+      Tarn::Messaging::Initialize();
+      broadcaster.BroadcastMessage(NumberMessage(2));
+      Tarn::Messaging::Terminate();
+    });
+    EXPECT_TRUE(delivering.WaitFor());
+    broadcaster.RemoveListener(&second, true);
+  });
+  second.SetAction([&](const Tarn::Message&) {
+    delivering.CountDown();
+    broadcaster.RemoveListener(&first, true);
+  });
+  broadcaster.AddListener(&second);
+  broadcaster.AddListener(&first);
+  broadcaster.BroadcastMessage(NumberMessage(1));
+  mover.JoinAll();
+  EXPECT_EQ(dialog.Count(), 1u);
+  EXPECT_EQ(first.Calls() + second.Calls(), 3);
   EXPECT_FALSE(broadcaster.HasListeners());
 }
 

@@ -1,6 +1,9 @@
 // Bringing the library down from inside a broadcast, and the station
 // registry at process exit.
+#include "DiagnosticsTestSupport.h"
 #include "StationTestSupport.h"
+
+#include <TarnMessaging/Tracing.h>
 
 #include <kivcore/InitializerRegistry.h>
 #include <kivcore/SmallBlockAllocator.h>
@@ -69,6 +72,120 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   Registry::DisposeStation(Tarn::kStation_Idle);
   EXPECT_EQ(Registry::FindStation(Tarn::kStation_Idle), nullptr) << "the new station is held by a retain it never had";
   Tarn::Messaging::Terminate();
+}
+
+// A station that a running call holds outlives the last Terminate made on
+// another thread meanwhile, and goes as the call lets it go: a worker's call
+// while the main thread terminates and initializes again; a main-thread
+// broadcast by ID while a worker terminates before the broadcast has begun.
+// Terminate also keeps the room it made for the stations it retires while
+// the host's error handler, reporting leftovers, uses up the spare room.
+TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCall) {
+  messaging_test::Watchdog watchdog;
+  Tarn::Messaging::Initialize();
+  messaging_test::Latch inCall, restarted;
+  const messaging_test::ErrorRecorder contractErrors;
+  const auto previous = kivcore::debug::SetContractDialogHandler([&](const char*, const char*, const char*, int) {
+    inCall.CountDown();
+    EXPECT_TRUE(restarted.WaitFor());
+    return false;
+  });
+  messaging_test::ThreadGroup worker;
+  worker.Start([] { Utils::AddListener(Tarn::kStation_StatusBar, std::weak_ptr<Tarn::Listener>()); });
+  EXPECT_TRUE(inCall.WaitFor());
+  Tarn::Messaging::Terminate();
+  Tarn::Messaging::Initialize();
+  restarted.CountDown();
+  worker.JoinAll();
+  kivcore::debug::SetContractDialogHandler(previous);
+
+  struct SlowStation : CountedStation {
+    using CountedStation::CountedStation;
+    void BroadcastMessage(const Tarn::Message& inMessage) override {
+      RunOnWorker([] { Registry::Terminate(); });
+      CountedStation::BroadcastMessage(inMessage);
+    }
+  };
+  StationLog::Reset();
+  const ImmutableString slow = Registry::UniqueStationID();
+  Registry::RegisterStation(slow, [](const ImmutableString& inID) -> Tarn::Station* { return new SlowStation(inID); });
+  RecordingListener heard("heard");
+  Utils::AddListener(slow, &heard);
+  Utils::BroadcastMessage(slow, NumberMessage(1));
+  EXPECT_EQ(heard.Calls(), 1);
+  EXPECT_EQ(StationLog::Destructions(), 1) << "the station outlived the call that held it";
+
+  const messaging_test::SilentFailureReportsSetting reports(Tarn::Diagnostics::SilentFailureReports::kOn);
+  const auto handler = kivcore::config::SetErrorHandler([](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.find("ListenersAtTerminate") == std::string::npos) return;
+    Registry::DisposeStation(Registry::RegisterUniqueStation());  // the pending list gives back its spare room
+    kivcore::utility::SmallBlockAllocator::SetFailAfter(0);
+  });
+  const ImmutableString busy = Registry::UniqueStationID();
+  Registry::RegisterStation(busy, &CountingFactory);
+  RecordingListener quit("quit");
+  quit.SetAction([&](const Tarn::Message&) {
+    const messaging_test::SmallBlockFailureGuard restore(-1);  // to never again, however Terminate ends
+    Registry::Terminate();
+  });
+  Utils::AddListener(busy, &quit);
+  Utils::BroadcastMessage(busy, NumberMessage(2));
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(StationLog::Destructions(), 2) << "the station Terminate retired was lost";
+  Tarn::Messaging::Terminate();
+}
+
+// A handler's Terminate retires the station it hears from; the main thread
+// then moves, and the new one is about to relay through that station (a
+// listener of a broadcaster) when the old broadcast ends and deletes it. The
+// deletion waits for the relay, which ends by looking for retired stations:
+// a deletion made under the registry's lock waited for ever.
+TEST(MessagingLifecycleTest, AStationDeletedAfterTheMainThreadMovedWaitsWithoutTheRegistryLock) {
+  messaging_test::Watchdog watchdog;
+  Tarn::Messaging::Initialize();
+  const ImmutableString id = Registry::RegisterUniqueStation();
+  Tarn::Station* const station = Registry::FindStation(id);
+  Tarn::Broadcaster broadcaster;
+  broadcaster.AddListener(station);
+  messaging_test::Latch aboutToRelay, deleting;
+  struct Gate : Tarn::Tracing::DeliveryTracer {
+    Gate(const void* inStation, messaging_test::Latch& ioReached, messaging_test::Latch& ioGo)
+        : mStation(inStation), mReached(ioReached), mGo(ioGo) {}
+    void DeliveryBegins(const Tarn::Tracing::Delivery& inDelivery) override {
+      if (inDelivery.mListener != mStation) return;
+      mReached.CountDown();
+      EXPECT_TRUE(mGo.WaitFor());
+    }
+    void DeliveryEnded(const Tarn::Tracing::Delivery&, std::chrono::nanoseconds) override {}
+    const void* mStation;
+    messaging_test::Latch& mReached;
+    messaging_test::Latch& mGo;
+  } gate(static_cast<Tarn::Listener*>(station), aboutToRelay, deleting);
+  const auto handler = kivcore::config::SetErrorHandler([&](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.rfind(Tarn::Tracing::kRemovalWaitKey, 0) == 0) deleting.CountDown();
+  });
+  const auto threshold = Tarn::Tracing::SetRemovalWaitReport(std::chrono::milliseconds(1));
+  Tarn::Tracing::SetDeliveryTracer(&gate);
+  RecordingListener quit("quit");
+  messaging_test::ThreadGroup mover;
+  quit.SetAction([&](const Tarn::Message&) {
+    if (quit.Calls() != 1) return;
+    Tarn::Messaging::Terminate();
+    mover.Start([&] {
+      Tarn::Messaging::Initialize();
+      broadcaster.BroadcastMessage(NumberMessage(2));
+      Tarn::Messaging::Terminate();
+    });
+    EXPECT_TRUE(aboutToRelay.WaitFor());
+  });
+  station->AddListener(&quit);
+  station->BroadcastMessage(NumberMessage(1));
+  mover.JoinAll();
+  Tarn::Tracing::SetDeliveryTracer(nullptr);
+  Tarn::Tracing::SetRemovalWaitReport(threshold);
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(quit.Calls(), 2);
+  EXPECT_FALSE(broadcaster.HasListeners());
 }
 
 // A host that brings its libraries up through the initializer registry
