@@ -18,6 +18,7 @@
 #include <atomic>
 #include <cstdlib>
 #include <new>
+#include <stdexcept>
 #include <thread>
 
 namespace {
@@ -132,6 +133,48 @@ TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
       }
     }
   }
+  Tarn::Messaging::Terminate();
+}
+
+// A queued call that throws once storage has run out: its exception
+// propagates and the posts behind it (plain, coalesced and cancellable) stay
+// queued, in order, and go out with the next run. Putting them back once
+// took storage: they were destroyed unrun, std::bad_alloc replaced the
+// exception, the coalesced key stayed blocked for ever and the cancellable
+// copy stayed with its token.
+TEST(PostingTest, ACallThatThrowsWithStorageOutLeavesThePostsBehindItQueued) {
+  MainThreadGuard mainThread;
+  Tarn::Messaging::Initialize();
+  CallLog log;
+  RecordingListener listener("l", &log);
+  Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &listener);
+  const std::size_t blocksBefore = SmallBlockAllocator::GetStatistics().blocksInUse;
+  const Tarn::PostCancelToken token;
+  kivcore::threads::AsyncCallFromMainThread(
+      [] {
+        const std::runtime_error error("call");
+        gHeapAllocationsLeft.store(0);
+        throw error;
+      },
+      0);
+  std::vector<std::string> expected;
+  // More than any earlier run of this process left room for.
+  for (int i = 0; i < 1000; ++i) {
+    if (i == 1) Tarn::StationUtils::PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i));
+    else if (i == 2) PostMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i), token);
+    else PostMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i), true);
+    expected.push_back("l:" + std::to_string(i));
+  }
+  EXPECT_THROW(FlushPostedMessagesOnUIThread(), std::runtime_error);
+  gHeapAllocationsLeft.store(-1);
+  EXPECT_EQ(log.Entries().size(), 0u);
+  FlushPostedMessagesOnUIThread();
+  EXPECT_EQ(log.Entries(), expected);
+  EXPECT_EQ(SmallBlockAllocator::GetStatistics().blocksInUse, blocksBefore) << "a copy outlived its delivery";
+  Tarn::StationUtils::PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(1));
+  FlushPostedMessagesOnUIThread();
+  EXPECT_EQ(listener.Calls(), 1001) << "the coalesced key stayed blocked";
+  Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
   Tarn::Messaging::Terminate();
 }
 

@@ -15,6 +15,13 @@
 // - each producer's calls stay in order: a run nested in another on the same
 //   thread first finishes the outer run's calls, which were queued earlier,
 //   and a run that throws puts the calls it has not run back in front.
+//
+// Putting calls back allocates nothing, so that a call that throws when
+// storage runs short neither loses the calls behind it nor has its exception
+// replaced by std::bad_alloc: they stay in the run's vector, which becomes,
+// when the run ends, the put-back part of the queue, ahead of the main
+// vector. The next run joins the two before it runs anything; when that
+// needs storage it cannot have, it throws with both parts as they were.
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
@@ -26,9 +33,11 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
+#include <exception>
 #include <iterator>
 #include <memory>
 #include <mutex>
+#include <utility>
 #include <vector>
 
 namespace kivcore::threads {
@@ -42,10 +51,20 @@ using WakeupHandler = std::shared_ptr<const std::function<void()>>;
 // initialized and trivially destructible, so the query works at any time.
 std::atomic<unsigned long> gMainThreadId{0};
 
+// The calls one RunPendingCalls took from the queue, and how far it got; or
+// the calls a run that threw put back, from next on.
+struct Run {
+  std::vector<Call> calls;
+  std::size_t next = 0;
+  bool putBack = false;  // a call threw: the rest waits for the next run
+};
+
 struct MainThreadState {
   std::mutex mutex;
   std::condition_variable callQueued;  // signalled only while waiters > 0
   std::vector<Call> queue;             // guarded by mutex
+  Run putBack;                         // queued ahead of queue; guarded by mutex
+  std::size_t heldBack = 0;            // calls put back but still in a run (Run::putBack); guarded by mutex
   std::vector<Call> spare;             // owned by the outermost RunPendingCalls while spareInUse
   bool spareInUse = false;             // guarded by mutex
   int waiters = 0;                     // threads in WaitForPendingCalls; guarded by mutex
@@ -65,10 +84,15 @@ MainThreadState& State() {
 
 unsigned long CurrentThreadId() noexcept { return static_cast<unsigned long>(pthread_self()); }
 
+// The number of calls queued, put-back ones included. state.mutex held.
+std::size_t Waiting(const MainThreadState& inState) noexcept {
+  return inState.queue.size() + inState.putBack.calls.size() - inState.putBack.next + inState.heldBack;
+}
+
 // Arms the queue's wakeup if it needs one; returns the handler to call (after
 // the lock is released), or null. state.mutex held.
 WakeupHandler ArmWakeup(MainThreadState& ioState, std::uint64_t& outArming) {
-  if (ioState.wakeupArmed || !ioState.wakeup || ioState.queue.empty()) return nullptr;
+  if (ioState.wakeupArmed || !ioState.wakeup || Waiting(ioState) == 0) return nullptr;
   ioState.wakeupArmed = true;
   outArming = ++ioState.armings;
   return ioState.wakeup;
@@ -89,43 +113,84 @@ void CallWakeup(MainThreadState& ioState, const WakeupHandler& inHandler, std::u
   if (ioState.armings == inArming) ioState.wakeupArmed = false;
 }
 
-// The calls one RunPendingCalls took from the queue, and how far it got.
-struct Run {
-  std::vector<Call> calls;
-  std::size_t next = 0;
-};
-
 // The innermost run on this thread. A run nested in it (a call that runs
 // pending calls itself) finishes it first: its calls were queued before any
 // call the nested run could take.
 thread_local Run* tCurrentRun = nullptr;
 
-// Runs what is left of ioRun. When a call throws, the calls after it go back
-// to the front of the queue (they were queued before anything in it), the
-// wakeup handler is called for them, and the exception propagates. The
-// moved-from calls stay in ioRun, to be destroyed outside the lock.
+// Runs what is left of ioRun. When a call throws, the calls after it are put
+// back (counted as queued at once, and the wakeup handler is called for
+// them) and the exception propagates: a run nested in this one (a call that
+// runs pending calls itself) still finishes them first, and otherwise the
+// end of the run hands them to the front of the queue (PutBack).
 void RunRemaining(MainThreadState& ioState, Run& ioRun) {
+  if (ioRun.putBack) {
+    std::lock_guard<std::mutex> lock(ioState.mutex);
+    ioState.heldBack -= ioRun.calls.size() - ioRun.next;
+    ioRun.putBack = false;
+  }
+  // The run's vector stays in place while the run lives: nested runs only
+  // advance next.
+  std::size_t running = 0;
   try {
-    while (ioRun.next < ioRun.calls.size()) {
-      Call& call = ioRun.calls[ioRun.next++];
-      call();
+    while (!ioRun.putBack && ioRun.next < ioRun.calls.size()) {
+      running = ioRun.next++;
+      ioRun.calls[running]();
       // Release what the call holds now rather than at the end of the run.
-      call.clear();
+      ioRun.calls[running].clear();
     }
   } catch (...) {
+    // Its destructor is the host's code, run here rather than under the
+    // queue's lock later.
+    ioRun.calls[running].clear();
     WakeupHandler wakeup;
     std::uint64_t arming = 0;
     {
       std::lock_guard<std::mutex> lock(ioState.mutex);
-      const auto rest = ioRun.calls.begin() + static_cast<std::ptrdiff_t>(ioRun.next);
-      ioState.queue.insert(ioState.queue.begin(), std::make_move_iterator(rest), std::make_move_iterator(ioRun.calls.end()));
-      ioRun.next = ioRun.calls.size();
+      // A nested run may have put the rest back already.
+      if (!ioRun.putBack) ioState.heldBack += ioRun.calls.size() - ioRun.next;
+      ioRun.putBack = true;
       wakeup = ArmWakeup(ioState, arming);
     }
-    // No post may come to schedule the run these calls now wait for.
     CallWakeup(ioState, wakeup, arming);
     throw;
   }
+}
+
+// At the end of a run, hands the calls it put back to the front of the queue
+// (they were queued before anything in it) and calls the wakeup handler for
+// them if a run took the queue since. The run's vector goes whole, so
+// nothing is allocated.
+void PutBack(MainThreadState& ioState, Run& ioRun) noexcept {
+  WakeupHandler wakeup;
+  std::uint64_t arming = 0;
+  std::exception_ptr failure;
+  {
+    std::lock_guard<std::mutex> lock(ioState.mutex);
+    Run& putBack = ioState.putBack;
+    ioState.heldBack -= ioRun.calls.size() - ioRun.next;
+    if (putBack.next == putBack.calls.size()) {
+      putBack.calls.swap(ioRun.calls);
+      putBack.next = ioRun.next;
+    } else {
+      // Calls put back already: only runs on two threads at once, outside
+      // the contract, get here. Joining them may fail for want of storage;
+      // the calls are then lost, and the failure is reported.
+      try {
+        putBack.calls.insert(putBack.calls.begin() + static_cast<std::ptrdiff_t>(putBack.next),
+                             std::make_move_iterator(ioRun.calls.begin() + static_cast<std::ptrdiff_t>(ioRun.next)),
+                             std::make_move_iterator(ioRun.calls.end()));
+      } catch (...) {
+        failure = std::current_exception();
+      }
+    }
+    ioRun.next = ioRun.calls.size();
+    wakeup = ArmWakeup(ioState, arming);
+  }
+  if (failure) {
+    config::ErrorManager::Get(false)->GuardedCall([&failure]() -> int { std::rethrow_exception(failure); });
+  }
+  CallWakeup(ioState, wakeup, arming);
 }
 
 }  // namespace
@@ -146,20 +211,36 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
   bool usingSpare = false;
   {
     std::lock_guard<std::mutex> lock(state.mutex);
-    if (state.queue.empty()) return;
-    if (!state.spareInUse) {
-      state.spareInUse = true;
-      usingSpare = true;
-      run.calls.swap(state.spare);
+    Run& putBack = state.putBack;
+    if (putBack.next != putBack.calls.size()) {
+      // Calls put back come first. When the queue cannot join them for want
+      // of storage, this throws with both as they were (the run-out calls
+      // dropped first hold nothing).
+      if (!state.queue.empty()) {
+        putBack.calls.erase(putBack.calls.begin(), putBack.calls.begin() + static_cast<std::ptrdiff_t>(putBack.next));
+        putBack.next = 0;
+        putBack.calls.insert(putBack.calls.end(), std::make_move_iterator(state.queue.begin()),
+                             std::make_move_iterator(state.queue.end()));
+        state.queue.clear();
+      }
+      run.calls.swap(putBack.calls);
+      run.next = std::exchange(putBack.next, 0);
+    } else {
+      if (state.queue.empty()) return;
+      if (!state.spareInUse) {
+        state.spareInUse = true;
+        usingSpare = true;
+        run.calls.swap(state.spare);
+      }
+      run.calls.swap(state.queue);
     }
-    run.calls.swap(state.queue);
     // The first call queued from now on wakes the host loop for the next run.
     state.wakeupArmed = false;
   }
 
-  // On every way out, destroys the run (and moved-from) calls outside the
-  // lock, since their destructors may queue calls or drop the last adaptor,
-  // and hands the spare vector back.
+  // On every way out, puts back the calls a throw left unrun, destroys the
+  // run (and moved-from) calls outside the lock, since their destructors may
+  // queue calls or drop the last adaptor, and hands the spare vector back.
   struct Finish {
     MainThreadState& state;
     Run& run;
@@ -167,6 +248,7 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
     bool usingSpare;
     ~Finish() {
       tCurrentRun = outer;
+      if (run.putBack) PutBack(state, run);
       run.calls.clear();
       if (!usingSpare) return;
       std::lock_guard<std::mutex> lock(state.mutex);
@@ -182,9 +264,9 @@ void AsyncEventLoopAdaptor::RunPendingCalls() {
 bool AsyncEventLoopAdaptor::WaitForPendingCalls(int inTimeoutMilliseconds) {
   MainThreadState& state = State();
   std::unique_lock<std::mutex> lock(state.mutex);
-  if (!state.queue.empty()) return true;
+  if (Waiting(state) != 0) return true;
   ++state.waiters;
-  auto queued = [&state] { return !state.queue.empty(); };
+  auto queued = [&state] { return Waiting(state) != 0; };
   bool result = true;
   if (inTimeoutMilliseconds < 0) state.callQueued.wait(lock, queued);
   else result = state.callQueued.wait_for(lock, std::chrono::milliseconds(inTimeoutMilliseconds), queued);
@@ -231,7 +313,7 @@ bool AsyncEventLoopAdaptor::RemoveWakeupHandler(const void* inOwner) {
 std::size_t AsyncEventLoopAdaptor::PendingCallCount() const {
   MainThreadState& state = State();
   std::lock_guard<std::mutex> lock(state.mutex);
-  return state.queue.size();
+  return Waiting(state);
 }
 
 boost::shared_ptr<AsyncEventLoopAdaptor> RegisterCurrentThreadAsMainThread() {

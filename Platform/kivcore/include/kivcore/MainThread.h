@@ -54,7 +54,9 @@ public:
   /// calling thread; called from inside such a call, first runs the calls the
   /// outer run has not reached. When a call throws, the calls after it stay
   /// queued (at the front, in order), the wakeup handler is called for them,
-  /// and the exception propagates.
+  /// and the exception propagates; putting them back takes no storage. The
+  /// next run joins them with newer calls before it runs any, and throws
+  /// std::bad_alloc, with all of them still queued, when it cannot.
   void RunPendingCalls();
 
   /// Returns true at once when calls are queued; otherwise blocks until one
