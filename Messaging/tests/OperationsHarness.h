@@ -176,7 +176,7 @@ struct Handles {
 };
 
 struct Queued {
-  int mNumber, mNode, mKind;  // mKind: see Harness::Post
+  int mNumber, mNode, mKind, mKey;  // mKind: see Harness::Post; mKey: a coalesced post's caller key (-1: its type's), a cancellable post's token
 };
 
 struct Frame {
@@ -347,7 +347,7 @@ private:
         case 12: return mMain ? TimerOp(choice) : Revive(inLevel, choice);
         // Not to the idle station: any broadcast there runs the idle-time posts first.
         case 13: return mMain ? Post(1 + node % 3, choice % 4, helper) : void();
-        case 14: return !mMain ? void() : choice < 5 ? Flush() : Cancel(choice);
+        case 14: return !mMain ? void() : choice < 5 ? Flush() : Cancel(choice % 2, helper);
         default: return !mMain ? Revive(inLevel, choice) : inLevel > 0 ? Terminate() : TimerOp(choice);  // mostly from handlers
       }
     }();
@@ -578,34 +578,34 @@ private:
     mTimer.reset(), Settle();
   }
 
-  // Posts: plain (inKind 0), coalesced (1), cancellable (2) and idle-time (3), to a station. A coalesced post takes
-  // the place of one waiting for the same station.
+  // Posts: plain (inKind 0), coalesced (1) under the type's key or a caller key, cancellable (2) under one of two
+  // tokens, and idle-time (3), to a station. A coalesced post takes the place of one waiting under the same key.
   void Post(int inNode, int inKind, bool inHelper) {
     static const char* const kKinds[] = {" post%d@%d", " coalesce%d@%d", " cancellable%d@%d", " idle%d@%d"};
-    const int number = mPostNumber++;
-    Note(kKinds[inKind], number, inNode), Note(inHelper ? "h" : "");
+    const int number = mPostNumber++, key = inKind == 2 ? Pick(2) : inKind == 1 ? Pick(3) - 1 : 0;
+    Note(kKinds[inKind], number, inNode), Note(inHelper ? "h#%d" : "#%d", key);
     std::vector<Queued>& queue = mPosts[inKind == 3];
-    const auto same = std::find_if(queue.begin(), queue.end(), [&](const Queued& inPost) { return inKind == 1 && inPost.mKind == 1 && inPost.mNode == inNode; });
-    same != queue.end() ? void(same->mNumber = number) : queue.push_back(Queued{number, inNode, inKind});
-    Tarn::PostCancelToken token;
-    if (inKind == 2) mTokens.emplace_back(number, token);
+    const auto same = std::find_if(queue.begin(), queue.end(), [&](const Queued& inPost) { return inKind == 1 && inPost.mKind == 1 && inPost.mNode == inNode && inPost.mKey == key; });
+    if (same != queue.end()) same->mNumber = number;
+    else if (inKind != 2 || !mCancelled[key]) queue.push_back(Queued{number, inNode, inKind, key});
     OnThread(inHelper, [&] {
+      const ImmutableString& id = mIDs[inNode];
       switch (inKind) {
-        case 0: return Utils::PostMessageToUIThread(mIDs[inNode], Posted(number), true);
-        case 1: return Utils::PostCoalescedMessageToUIThread(mIDs[inNode], Posted(number));
-        case 2: return Utils::PostMessageToUIThread(mIDs[inNode], Posted(number), token);
-        default: return Utils::PostMessageAtIdleTime(mIDs[inNode], Posted(number));
+        case 0: return Utils::PostMessageToUIThread(id, Posted(number), true);
+        case 1: return key < 0 ? Utils::PostCoalescedMessageToUIThread(id, Posted(number)) : Utils::PostCoalescedMessageToUIThread(id, Posted(number), key);
+        case 2: return Utils::PostMessageToUIThread(id, Posted(number), mTokens[key]);
+        default: return Utils::PostMessageAtIdleTime(id, Posted(number));
       }
     });
   }
 
-  void Cancel(int inChoice) {
-    if (mTokens.empty()) return;
-    const auto cancelled = mTokens.begin() + inChoice % static_cast<int>(mTokens.size());
-    Note(" cancel%d", cancelled->first);
-    for (std::vector<Queued>& queue : mPosts)
-      queue.erase(std::remove_if(queue.begin(), queue.end(), [&](const Queued& inPost) { return inPost.mNumber == cancelled->first; }), queue.end());
-    cancelled->second.Cancel(), mTokens.erase(cancelled);
+  // A token cancelled drops its posts, and every later one; now and then it is replaced by a new token.
+  void Cancel(int inToken, bool inHelper) {
+    Note(inHelper ? " cancel#%dh" : " cancel#%d", inToken);
+    mPosts[0].erase(std::remove_if(mPosts[0].begin(), mPosts[0].end(), [&](const Queued& inPost) { return inPost.mKind == 2 && inPost.mKey == inToken; }), mPosts[0].end());
+    mCancelled[inToken] = true;
+    OnThread(inHelper, [&] { mTokens[inToken].Cancel(); });
+    if (Pick(2) == 0) mTokens[inToken] = Tarn::PostCancelToken(), mCancelled[inToken] = false;
   }
 
   // What a main thread does for workers: runs the pending calls (the posts), deletes the stations they disposed of.
@@ -646,7 +646,7 @@ private:
   void Terminate() {
     DestroyTimer();
     Note(" terminate");
-    mPosts[0].clear(), mPosts[1].clear(), mTokens.clear(), mRun.mTerminated = true;
+    mPosts[0].clear(), mPosts[1].clear(), mRun.mTerminated = true;
     for (int node = 1; node < kNodes; ++node) Doom(node);
     mMain = false, Tarn::Messaging::Terminate(), Settle();
   }
@@ -793,7 +793,8 @@ private:
     bool mTerminated = false;
   } mRun;
   int mPostNumber = 1;
-  std::vector<std::pair<int, Tarn::PostCancelToken>> mTokens;  // of the cancellable posts made since the last Terminate
+  Tarn::PostCancelToken mTokens[2];
+  bool mCancelled[2] = {};
   // The model, as an operation whose call throws std::bad_alloc must leave it.
   struct Snapshot {
     std::vector<Node> mNodes;
@@ -905,7 +906,7 @@ inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
   }
   std::atomic<bool> done{false};
   auto worker = std::async(std::launch::async, [&] {
-    for (int round = 0; round < inRounds / 2; ++round) {
+    for (int round = 0; round < inRounds / 8; ++round) {
       Watcher watcher;
       Utils::AddListener(Tarn::kStation_StatusBar, &watcher);
       Utils::PostMessageToUIThread(Tarn::kStation_StatusBar, Ping(), true);

@@ -43,7 +43,7 @@ TEST(OperationsModelTest, SeededSequencesAgreeWithTheModel) {
   // The sequences end with stations retained on purpose; the harness fails on any report.
   const messaging_test::SilentFailureReportsSetting quiet(Tarn::Diagnostics::SilentFailureReports::kOff);
   const std::uint64_t first = messaging_test::EnvironmentNumber("TARN_TEST_SEED", 0x5eed0000);
-  const std::uint64_t sequences = messaging_test::EnvironmentNumber("TARN_TEST_SEQUENCES", Volume(10000));
+  const std::uint64_t sequences = messaging_test::EnvironmentNumber("TARN_TEST_SEQUENCES", Volume(6000));
   for (std::uint64_t seed = first; seed < first + sequences; ++seed) {
     SeededChoices choices(seed);
     const std::string failure = operations_harness::RunSequence(choices, 20 + static_cast<int>(seed % 41));
