@@ -31,9 +31,7 @@ inline void* AllocateOrFail(std::size_t inSize) {
 
 }  // namespace messaging_test
 
+// The array forms the standard library provides call these.
 void* operator new(std::size_t inSize) { return messaging_test::AllocateOrFail(inSize); }
-void* operator new[](std::size_t inSize) { return messaging_test::AllocateOrFail(inSize); }
 void operator delete(void* inBlock) noexcept { std::free(inBlock); }
-void operator delete[](void* inBlock) noexcept { std::free(inBlock); }
 void operator delete(void* inBlock, std::size_t) noexcept { std::free(inBlock); }
-void operator delete[](void* inBlock, std::size_t) noexcept { std::free(inBlock); }

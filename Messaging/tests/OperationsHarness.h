@@ -119,11 +119,7 @@ struct Handler {
   explicit Handler(int inSlot) : mSlot(std::make_unique<int>(inSlot)) {}
   Handler(Handler&&) = default;
   ~Handler() { mSlot ? Destroyed(*mSlot) : void(); }
-  void operator()(const Ping&) const {
-    const int slot = *mSlot;
-    Called(slot);
-    if (*mSlot != slot) Destroyed(kGone);
-  }
+  void operator()(const Ping&) const { const int slot = *mSlot; Called(slot), *mSlot != slot ? Destroyed(kGone) : void(); }
   std::unique_ptr<int> mSlot;
 };
 
@@ -395,10 +391,8 @@ private:
     Note("@%d", inNode);
     Model(inNode, inSlot, kSub, true, true);
     if (!Reach(inNode)) mObjects[inSlot].mOwned = false, Die(inSlot);
-    OnThread(false, [&] {
-      Tarn::Registration made = inNode == 0 ? Tarn::Subscribe<Ping>(mB0, Handler(inSlot)) : Tarn::Subscribe<Ping>(mIDs[inNode], Handler(inSlot));
-      mHandles[inSlot].mAttached[0][0] = std::move(made);
-    });
+    Tarn::Registration& made = mHandles[inSlot].mAttached[0][0];
+    OnThread(false, [&] { made = inNode == 0 ? Tarn::Subscribe<Ping>(mB0, Handler(inSlot)) : Tarn::Subscribe<Ping>(mIDs[inNode], Handler(inSlot)); });
   }
 
   // Added or removed by the broadcaster's or the utilities' call, or by a registration of Tarn::Attach: made, or

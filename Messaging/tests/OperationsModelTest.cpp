@@ -49,7 +49,7 @@ TEST(OperationsModelTest, SeededSequencesAgreeWithTheModel) {
     const std::string failure = operations_harness::RunSequence(choices, 20 + static_cast<int>(seed % 41));
     ASSERT_EQ(failure, "") << choices.Replay();
   }
-  const operations_harness::Statistics& ran = operations_harness::sStatistics;
+  const operations_harness::Statistics& ran = operations_harness::sStatistics;  // for the record
   std::printf("%llu sequences; %lld calls drew a failing allocation, %lld threw std::bad_alloc; the main thread moved %lld times\n",
               static_cast<unsigned long long>(sequences), ran.mFailingCalls, ran.mThrown, ran.mMoves);
 }
