@@ -59,7 +59,7 @@ TEST(OperationsModelTest, StationsAndListenersTornDownOnWorkersWhileTheMainThrea
   // The sequences end with stations retained on purpose; the harness fails on any report.
   const messaging_test::SilentFailureReportsSetting quiet(Tarn::Diagnostics::SilentFailureReports::kOff);
   const auto seed = static_cast<std::uint32_t>(messaging_test::EnvironmentNumber("TARN_TEST_SEED", 0x5eed0000));
-  EXPECT_EQ(operations_harness::RunConcurrent(static_cast<int>(Volume(15000)), seed), "");
+  EXPECT_EQ(operations_harness::RunConcurrent(static_cast<int>(Volume(8000)), seed), "");
 }
 
 }  // namespace
