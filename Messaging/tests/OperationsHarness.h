@@ -9,15 +9,30 @@
 //
 // The world: a broadcaster of the harness's own (node 0), three registry
 // stations made by a factory that reports their lives (nodes 1-3), the idle
-// station (node 4), five listener slots of the four kinds (plain pointer,
-// boost::weak_ptr, std::weak_ptr, safe listener), an idle countdown timer.
-// Operations: listeners made, attached, detached, stopped and killed;
+// station (node 4), five listener slots of five kinds (plain pointer,
+// boost::weak_ptr, std::weak_ptr, safe listener, subscription), an idle
+// countdown timer, two cancel tokens.
+// Operations: listeners made, attached and detached (by the broadcaster, the
+// utilities, or registrations of Tarn::Attach made and reset), stopped and
+// killed; subscriptions made and reset, from their own handlers too;
 // broadcasting stopped and started; broadcasts, also nested from handlers;
 // stations attached as relays to the broadcaster or to lower stations (chains,
 // never cycles); register, retain, find, release and dispose; timers made,
-// armed and destroyed; the library terminated (and initialized again when the
-// step ends). Handlers run operations too, and some operations run on a
-// helper thread while the main thread waits (inside a handler as well).
+// armed and destroyed; posts of every kind (plain, coalesced under the type's
+// or a caller's key, cancellable, idle-time), cancels, runs of the pending
+// calls; the last Terminate, from the top, from handlers and from posted
+// calls. After a Terminate in a handler the library is initialized again
+// there, or on another thread that works as the main thread while the
+// handler's thread waits; after a step that terminated, here or on a new
+// thread that takes the rest of the sequence over (the main thread moves).
+// Handlers run operations too, and some operations run on a helper thread
+// while the main thread waits (inside a handler as well).
+//
+// Allocation failure: a quarter of the operations make their library call
+// with the n-th heap or small-block allocation failing. A call that throws
+// std::bad_alloc must leave the library as it was (the model goes back to
+// where it was before the operation, and everything above is checked against
+// it); a call that returns must have done all it said.
 //
 // The model numbers every registration; a running broadcast serves the newest
 // entry older than the one it served last and never one added after it
@@ -27,19 +42,25 @@
 // registration and back-link, every listener's life. A station must never be
 // deleted while a broadcast on it runs; one disposed of meanwhile goes when
 // that broadcast ends, and one a worker let go is gone once the main thread
-// has run its posted calls and disposed of a registered station. After the
-// final Terminate no station or listener may remain and every small block
-// must be back. Any contract report is a failure: the harness makes no bad
-// calls.
+// has run its posted calls and disposed of a registered station, or made the
+// last Terminate. Posts are checked as a run delivers them: in the order
+// queued, none cancelled, replaced or dropped, and each heard by every
+// listener of its station (and of the stations relaying it) as often as the
+// model says. After the final Terminate no station or listener may remain and
+// every small block must be back. Any contract report is a failure: the
+// harness makes no bad calls.
 //
-// RunConcurrent is the same library under real concurrency: a worker makes,
-// relays and lets go of stations and listeners while the main thread
-// broadcasts through them; no call may follow a removal that returned.
+// RunConcurrent is the same library under real concurrency: two workers make,
+// relay and let go of stations and listeners while the main thread broadcasts
+// through them; then a worker adds, posts and removes on a well-known station
+// while the main thread terminates and initializes, over and over. No call
+// may follow a removal that returned.
 //
 // Threading: one sequence at a time, from the thread that is to be the main
 // thread. A helper operation that does not return within 20 s (a deadlock),
-// and a station deleted while a broadcast on it runs (the library would go on
-// in freed memory), stop the process at once with the trace.
+// a station deleted while a broadcast on it runs (the library would go on in
+// freed memory), and a subscription's handler destroyed while it runs stop the
+// process at once with the trace. The statistics are for one thread at a time.
 #pragma once
 
 #include "HeapFailure.h"
