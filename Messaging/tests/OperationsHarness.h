@@ -642,14 +642,15 @@ private:
     mRun = outer;
   }
 
-  // How often a broadcast on inNode now reaches inSlot with a post (subscriptions take pings only).
-  int Count(int inNode, int inSlot) {
-    if (!mMain || !Reach(inNode) || !mNodes[inNode].mBroadcasting) return 0;
+  // How often a broadcast on inNode now reaches inSlot with a post (subscriptions take pings only). A relay
+  // relays while it lives, registered or not.
+  int Count(int inNode, int inSlot, bool inRelay = false) {
+    if (!mMain || !(inRelay || Reach(inNode)) || !mNodes[inNode].mBroadcasting) return 0;
     int count = 0;
     for (const Entry& entry : mNodes[inNode].mEntries) {
       const Object& object = mObjects[inSlot];
       if (entry.mWho == inSlot) count += entry.mWay == kPlain ? object.mListening : entry.mWay != kSub && object.mAlive;
-      if (entry.mWho >= kSlots && entry.mWho < kTimer) count += Count(entry.mWho - kSlots, inSlot);
+      if (entry.mWho >= kSlots && entry.mWho < kTimer) count += Count(entry.mWho - kSlots, inSlot, true);
     }
     return count;
   }
@@ -815,10 +816,11 @@ private:
     std::vector<int> mLives;
     bool mTimerListening = false;
     std::vector<Queued> mPosts[2];
+    bool mCancelled[2] = {};
   };
   Snapshot Save() const {
     return Snapshot{{std::begin(mNodes), std::end(mNodes)}, {std::begin(mObjects), std::end(mObjects)}, mFrames, mLevels,
-                    {std::begin(mLives), std::end(mLives)}, mTimerListening, {mPosts[0], mPosts[1]}};
+                    {std::begin(mLives), std::end(mLives)}, mTimerListening, {mPosts[0], mPosts[1]}, {mCancelled[0], mCancelled[1]}};
   }
   void Restore(const Snapshot& inSnapshot) {
     std::copy(inSnapshot.mNodes.begin(), inSnapshot.mNodes.end(), mNodes);
@@ -826,6 +828,7 @@ private:
     std::copy(inSnapshot.mLives.begin(), inSnapshot.mLives.end(), mLives);
     mFrames = inSnapshot.mFrames, mLevels = inSnapshot.mLevels, mTimerListening = inSnapshot.mTimerListening;
     mPosts[0] = inSnapshot.mPosts[0], mPosts[1] = inSnapshot.mPosts[1];
+    std::copy(std::begin(inSnapshot.mCancelled), std::end(inSnapshot.mCancelled), mCancelled);
   }
   int mFailAt = -1;      // the allocation failure the current operation drew: see OnThread; -1: none
   bool mThrew = false;   // the current operation's library call threw std::bad_alloc
