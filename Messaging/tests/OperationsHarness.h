@@ -920,7 +920,7 @@ inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
   }
   std::atomic<bool> done{false};
   auto worker = std::async(std::launch::async, [&] {
-    for (int round = 0; round < inRounds / 8; ++round) {
+    for (int round = 0; round < inRounds; ++round) {
       Watcher watcher;
       Utils::AddListener(Tarn::kStation_StatusBar, &watcher);
       Utils::PostMessageToUIThread(Tarn::kStation_StatusBar, Ping(), true);
