@@ -53,8 +53,8 @@ using StationMap = std::map<ImmutableString, StationRecord, std::less<ImmutableS
 // A station the registry no longer lists but still owns. mRetired: kept for
 // the end of a broadcast on it, or of the calls that hold it (else: queued
 // by a disposal off the main thread, for the next main-thread disposal).
-// mClaim: the nesting level of the running deletion sweep that will delete
-// it (0: none). mCallHolds: the holds of calls that were running when a
+// mClaim: the number of the running deletion sweep that will delete it (0:
+// none). mCallHolds: the holds of calls that were running when a
 // Terminate took the station from the registry; the last of their releases
 // deletes it, and no sweep does before.
 struct PendingStation {

@@ -203,10 +203,7 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
   // A posted "quit" ends the library: the delivery's own hold on the station
   // is not the host's to balance.
   Utils::RetainStation(station);
-  Tarn::Registration quit = Tarn::Subscribe<messaging_test::PingMessage>(station, [&](const auto&) {
-    quit.Reset();
-    Tarn::Messaging::Terminate();
-  });
+  listener.SetAction([](const Tarn::Message&) { Tarn::Messaging::Terminate(); });
   Utils::PostMessageToUIThread(station, messaging_test::PingMessage(), true);
   Utils::FlushPostedMessagesOnUIThread();
   EXPECT_TRUE(HasKey(errors.Reports(), 7, "RetainedAtTerminate",

@@ -26,32 +26,61 @@ using messaging_test::CallLog;
 using messaging_test::RecordingListener;
 
 // A "quit" subscription ends the library while the station it hears from is
-// broadcasting: the station once went at once (use after free), and a later
+// broadcasting: the station once went at once (use after free), a later
 // handler removing itself, its thread no longer the main thread, waited for
-// its own delivery for ever.
+// its own delivery for ever, and the quit handler, resetting its own
+// subscription, was freed under itself. Another thread then becomes the main
+// thread and is about to relay through the station (a listener of a
+// broadcaster) as the broadcast ends and deletes it: the deletion waits for
+// the relay, whose end looks for retired stations; made under the
+// registry's lock, it waited for ever.
 TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLibraryComeBack) {
   messaging_test::Watchdog watchdog;
   StationLog::Reset();
   Tarn::Messaging::Initialize();
+  static messaging_test::Latch sAboutToRelay, sDeleting;
+  struct GatedStation : CountedStation {
+    using CountedStation::CountedStation;
+    void ListenToMessage(const Tarn::Message& inMessage) override {
+      sAboutToRelay.CountDown();
+      EXPECT_TRUE(sDeleting.WaitFor());
+      CountedStation::ListenToMessage(inMessage);
+    }
+  };
   const ImmutableString id = Registry::UniqueStationID();
-  Registry::RegisterStation(id, &CountingFactory);
+  Registry::RegisterStation(id, [](const ImmutableString& inID) -> Tarn::Station* { return new GatedStation(inID); });
+  Tarn::Station* const station = Registry::FindStation(id);
+  Tarn::Broadcaster broadcaster;
+  broadcaster.AddListener(station);
+  const auto handler = kivcore::config::SetErrorHandler([](const kivcore::config::ErrorReport& inReport) {
+    if (inReport.key.rfind(Tarn::Tracing::kRemovalWaitKey, 0) == 0) sDeleting.CountDown();
+  });
+  const auto threshold = Tarn::Tracing::SetRemovalWaitReport(std::chrono::milliseconds(1));
   CallLog log;
   RecordingListener oldest("oldest", &log), leaving("leaving", &log);
-  leaving.SetAction([&](const Tarn::Message&) { Utils::RemoveListener(id, &leaving); });
+  leaving.SetAction([&](const Tarn::Message&) { station->RemoveListener(&leaving, true); });
   oldest.SetAction([&](const Tarn::Message&) {
     EXPECT_EQ(StationLog::Destructions(), 0) << "the station went under its own broadcast";
   });
   for (RecordingListener* listener : {&oldest, &leaving}) Utils::AddListener(id, listener);
-  // Its thread no longer the main thread, the handler resets its own
-  // subscription and then uses what it captured: freed only as it returns.
+  messaging_test::ThreadGroup mover;
   Tarn::Registration quit;
   quit = Tarn::Subscribe<NumberMessage>(id, [&, name = std::string("quit")](const NumberMessage& inMessage) {
     Tarn::Messaging::Terminate();
     quit.Reset();
     log.Record(name + ":" + std::to_string(inMessage.mValue));
+    mover.Start([&] {
+      Tarn::Messaging::Initialize();
+      broadcaster.BroadcastMessage(NumberMessage(2));
+      Tarn::Messaging::Terminate();
+    });
+    EXPECT_TRUE(sAboutToRelay.WaitFor());
   });
-  Utils::BroadcastMessage(id, NumberMessage(1));
-  EXPECT_EQ(log.Entries(), (std::vector<std::string>{"quit:1", "leaving:1", "oldest:1"}));
+  station->BroadcastMessage(NumberMessage(1));
+  mover.JoinAll();
+  Tarn::Tracing::SetRemovalWaitReport(threshold);
+  kivcore::config::SetErrorHandler(handler);
+  EXPECT_EQ(log.Entries(), (std::vector<std::string>{"quit:1", "leaving:1", "oldest:1", "oldest:2"}));
   EXPECT_EQ(StationLog::Destructions(), 1) << "the station outlived its broadcast";
   EXPECT_FALSE(kivcore::threads::CurrentThreadIsMainThread());
 
@@ -75,30 +104,16 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
 }
 
 // A station that a running call holds outlives the last Terminate made on
-// another thread meanwhile, and goes as the call lets it go: a worker's call
-// while the main thread terminates and initializes again; a main-thread
-// broadcast by ID while a worker terminates before the broadcast has begun.
-// Terminate also keeps the room it made for the stations it retires while
-// the host's error handler, reporting leftovers, uses up the spare room.
+// another thread meanwhile, and goes as the call lets it go: here a
+// main-thread broadcast by ID while a worker terminates before the broadcast
+// has begun (a worker's call while the main thread terminates once freed the
+// station the same way). Terminate also keeps the room it made for the
+// stations it retires while the host's error handler, reporting leftovers,
+// uses up the spare room. The library comes up and goes down with the host's
+// initializer registry.
 TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCall) {
-  messaging_test::Watchdog watchdog;
-  Tarn::Messaging::Initialize();
-  messaging_test::Latch inCall, restarted;
-  const messaging_test::ErrorRecorder contractErrors;
-  const auto previous = kivcore::debug::SetContractDialogHandler([&](const char*, const char*, const char*, int) {
-    inCall.CountDown();
-    EXPECT_TRUE(restarted.WaitFor());
-    return false;
-  });
-  messaging_test::ThreadGroup worker;
-  worker.Start([] { Utils::AddListener(Tarn::kStation_StatusBar, std::weak_ptr<Tarn::Listener>()); });
-  EXPECT_TRUE(inCall.WaitFor());
-  Tarn::Messaging::Terminate();
-  Tarn::Messaging::Initialize();
-  restarted.CountDown();
-  worker.JoinAll();
-  kivcore::debug::SetContractDialogHandler(previous);
-
+  StationLog::Reset();
+  ASSERT_TRUE(kivcore::config::InitializerRegistry::InitializeAll(kivcore::proplist::PropList()));
   struct SlowStation : CountedStation {
     using CountedStation::CountedStation;
     void BroadcastMessage(const Tarn::Message& inMessage) override {
@@ -106,7 +121,6 @@ TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCa
       CountedStation::BroadcastMessage(inMessage);
     }
   };
-  StationLog::Reset();
   const ImmutableString slow = Registry::UniqueStationID();
   Registry::RegisterStation(slow, [](const ImmutableString& inID) -> Tarn::Station* { return new SlowStation(inID); });
   RecordingListener heard("heard");
@@ -132,67 +146,6 @@ TEST(MessagingLifecycleTest, AStationACallHoldsOutlivesTerminateAndGoesWithTheCa
   Utils::BroadcastMessage(busy, NumberMessage(2));
   kivcore::config::SetErrorHandler(handler);
   EXPECT_EQ(StationLog::Destructions(), 2) << "the station Terminate retired was lost";
-  Tarn::Messaging::Terminate();
-}
-
-// A handler's Terminate retires the station it hears from; the main thread
-// then moves, and the new one is about to relay through that station (a
-// listener of a broadcaster) when the old broadcast ends and deletes it. The
-// deletion waits for the relay, which ends by looking for retired stations:
-// a deletion made under the registry's lock waited for ever.
-TEST(MessagingLifecycleTest, AStationDeletedAfterTheMainThreadMovedWaitsWithoutTheRegistryLock) {
-  messaging_test::Watchdog watchdog;
-  Tarn::Messaging::Initialize();
-  const ImmutableString id = Registry::RegisterUniqueStation();
-  Tarn::Station* const station = Registry::FindStation(id);
-  Tarn::Broadcaster broadcaster;
-  broadcaster.AddListener(station);
-  messaging_test::Latch aboutToRelay, deleting;
-  struct Gate : Tarn::Tracing::DeliveryTracer {
-    Gate(const void* inStation, messaging_test::Latch& ioReached, messaging_test::Latch& ioGo)
-        : mStation(inStation), mReached(ioReached), mGo(ioGo) {}
-    void DeliveryBegins(const Tarn::Tracing::Delivery& inDelivery) override {
-      if (inDelivery.mListener != mStation) return;
-      mReached.CountDown();
-      EXPECT_TRUE(mGo.WaitFor());
-    }
-    void DeliveryEnded(const Tarn::Tracing::Delivery&, std::chrono::nanoseconds) override {}
-    const void* mStation;
-    messaging_test::Latch& mReached;
-    messaging_test::Latch& mGo;
-  } gate(static_cast<Tarn::Listener*>(station), aboutToRelay, deleting);
-  const auto handler = kivcore::config::SetErrorHandler([&](const kivcore::config::ErrorReport& inReport) {
-    if (inReport.key.rfind(Tarn::Tracing::kRemovalWaitKey, 0) == 0) deleting.CountDown();
-  });
-  const auto threshold = Tarn::Tracing::SetRemovalWaitReport(std::chrono::milliseconds(1));
-  Tarn::Tracing::SetDeliveryTracer(&gate);
-  RecordingListener quit("quit");
-  messaging_test::ThreadGroup mover;
-  quit.SetAction([&](const Tarn::Message&) {
-    if (quit.Calls() != 1) return;
-    Tarn::Messaging::Terminate();
-    mover.Start([&] {
-      Tarn::Messaging::Initialize();
-      broadcaster.BroadcastMessage(NumberMessage(2));
-      Tarn::Messaging::Terminate();
-    });
-    EXPECT_TRUE(aboutToRelay.WaitFor());
-  });
-  station->AddListener(&quit);
-  station->BroadcastMessage(NumberMessage(1));
-  mover.JoinAll();
-  Tarn::Tracing::SetDeliveryTracer(nullptr);
-  Tarn::Tracing::SetRemovalWaitReport(threshold);
-  kivcore::config::SetErrorHandler(handler);
-  EXPECT_EQ(quit.Calls(), 2);
-  EXPECT_FALSE(broadcaster.HasListeners());
-}
-
-// A host that brings its libraries up through the initializer registry
-// brings this one up and down with them.
-TEST(MessagingLifecycleTest, TheInitializerRegistryBringsTheLibraryUpAndDown) {
-  ASSERT_TRUE(kivcore::config::InitializerRegistry::InitializeAll(kivcore::proplist::PropList()));
-  EXPECT_TRUE(kivcore::threads::CurrentThreadIsMainThread());
   kivcore::config::InitializerRegistry::TerminateAll();
   EXPECT_FALSE(kivcore::threads::CurrentThreadIsMainThread());
 }
