@@ -243,9 +243,24 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
   // Declared before the lock, so that it is let go after the lock is.
   std::shared_ptr<BroadcasterCore> keep;
   Locked lock(mMutex, "Broadcaster::RemoveListener1");
-  const auto found = mIndex.find(inListener);
+  auto found = mIndex.find(inListener);
+  const bool noEarlierRemovalWaits = !inCheck || found == mIndex.end() || mGateMap.find(inListener) == mGateMap.end();
+  if (!noEarlierRemovalWaits) {
+    // No host code runs under the core's lock: the contract dialog and the
+    // error handler may block, or use this broadcaster. The report goes out
+    // with the lock let go (taken again however the report ends), and the
+    // entry is looked up anew after.
+    {
+      struct Relock {
+        RecursiveMutex& mMutex;
+        ~Relock() { mMutex.Lock("Broadcaster::RemoveListener1"); }
+      } relock{mMutex};
+      mMutex.Unlock();
+      TARN_CONTRACT_CHECK(noEarlierRemovalWaits, kRemoveListenerName);
+    }
+    found = mIndex.find(inListener);
+  }
   if (found != mIndex.end()) {
-    if (inCheck) TARN_CONTRACT_CHECK(mGateMap.find(inListener) == mGateMap.end(), kRemoveListenerName);
     // Running broadcasts hold serials, not positions: erasing moves nothing
     // they depend on. Erasing frees storage and allocates none.
     mEntries.erase(mEntries.begin() + static_cast<std::ptrdiff_t>(PositionOf(found->second)));

@@ -85,7 +85,8 @@ public:
   // entry. Allocates nothing, so destructors may call it (without inCheck it
   // throws nothing).
   // inCheck runs the misuse check of a public removal (a second removal of
-  // an equal entry while an earlier one still waits); it may throw.
+  // an equal entry while an earlier one still waits); it reports with the
+  // core's lock let go, and may throw.
   // Returns kWaited when a delivery on another thread had to end first.
   enum class Removed { kAtOnce, kWaited };
   Removed Remove(const ListenerEntry& inListener, Listener* inUnlink, Wait inWait, bool inCheck);

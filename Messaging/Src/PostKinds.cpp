@@ -11,8 +11,9 @@
 //
 // Who frees what, and where:
 // - a coalesced copy that a newer one replaces: the replacing poster, after
-//   it has released the store's lock; the map entry: its queued call, on the
-//   main thread, as the delivery begins;
+//   it has released the store's lock; the map entry: the last of its queued
+//   calls, on the main thread, as its delivery begins, or a poster whose
+//   queuing failed;
 // - a cancellable copy: the main thread after its delivery, before the
 //   delivery counts as ended; or the thread that calls Cancel, before Cancel
 //   returns; a token's shared state: whichever of its token copies and
@@ -191,9 +192,25 @@ struct CoalescingKey {
   }
 };
 
-// A key is in the map exactly while one call for it is queued; that call
-// alone erases it, so the iterator it holds stays valid until it runs.
-using CoalescedMap = std::map<CoalescingKey, PostedCall>;
+// A key's entry. A copy is put in only while a call for the entry is surely
+// queued and has not run, so that every copy put in is delivered: a poster
+// that finds no such call queues one first, and puts its copy in once the
+// queue took the call. A poster whose queuing fails has put nothing in, so
+// its failure touches no other post.
+struct CoalescedEntry {
+  PostedCall mCopy;  // the newest post; empty once a call took it
+  // Calls for the entry queued and not yet run, or being queued; mUnsure
+  // posters are queuing theirs (a call may run before its poster learns it
+  // was queued). More than mUnsure: one is surely queued and has not run.
+  std::uint32_t mPending = 0;
+  std::uint32_t mUnsure = 0;
+  bool HasSureCall() const noexcept { return mPending > mUnsure; }
+};
+
+// A key is in the map while a call for it is queued or being queued; the
+// last of those erases it, so the iterator each call holds stays valid
+// until it runs.
+using CoalescedMap = std::map<CoalescingKey, CoalescedEntry>;
 
 struct CoalescedPosts {
   std::mutex mMutex;
@@ -203,6 +220,11 @@ struct CoalescedPosts {
 CoalescedPosts& Coalesced() {
   static CoalescedPosts* posts = new CoalescedPosts;
   return *posts;
+}
+
+// Erases an entry that no call will come for any more. mMutex held.
+void EraseIfDone(CoalescedPosts& ioPosts, CoalescedMap::iterator inEntry) noexcept {
+  if (inEntry->second.mPending == 0 && inEntry->second.mUnsure == 0) ioPosts.mQueued.erase(inEntry);
 }
 
 // What the queue holds for a coalesced post: its entry in the map, whose
@@ -216,11 +238,14 @@ public:
     PostedCall call;
     {
       std::lock_guard<std::mutex> lock(posts.mMutex);
-      call.swap(mEntry->second);
-      // From here on a post with this key is queued anew, behind this one.
-      posts.mQueued.erase(mEntry);
+      // From here on a post with this key is queued anew, behind this one
+      // (a call still being queued for it is not sure yet). An empty copy:
+      // an earlier call for the entry delivered it.
+      call.swap(mEntry->second.mCopy);
+      --mEntry->second.mPending;
+      EraseIfDone(posts, mEntry);
     }
-    call();
+    if (!call.empty()) call();
   }
 
 private:
@@ -231,28 +256,34 @@ void PostCoalesced(const CoalescingKey& inKey, const Message& inMessage) {
   // Holds the new copy, then the one it replaces, freed after the lock.
   PostedCall call = inMessage.CreateCallback(inKey.mStationID);
   CoalescedPosts& posts = Coalesced();
-  CoalescedMap::iterator entry;
-  {
-    std::lock_guard<std::mutex> lock(posts.mMutex);
-    const auto inserted = posts.mQueued.try_emplace(inKey);
-    inserted.first->second.swap(call);
-    if (!inserted.second) return;
-    entry = inserted.first;
-  }
-  try {
-    kivcore::threads::AsyncCallFromMainThread(PostedCall(CoalescedCall(entry)), 0);
-  } catch (...) {
-    // Not queued: no call would ever erase the entry.
-    PostedCall lost;
-    {
-      std::lock_guard<std::mutex> lock(posts.mMutex);
-      lost.swap(entry->second);
-      posts.mQueued.erase(entry);
+  std::unique_lock<std::mutex> lock(posts.mMutex);
+  for (;;) {
+    const CoalescedMap::iterator entry = posts.mQueued.try_emplace(inKey).first;
+    if (entry->second.HasSureCall()) {
+      entry->second.mCopy.swap(call);
+      lock.unlock();
+      return;
     }
-    throw;
+    ++entry->second.mPending;
+    ++entry->second.mUnsure;
+    lock.unlock();
+    try {
+      kivcore::threads::AsyncCallFromMainThread(PostedCall(CoalescedCall(entry)), 0);
+    } catch (...) {
+      lock.lock();
+      --entry->second.mUnsure;
+      --entry->second.mPending;
+      EraseIfDone(posts, entry);
+      lock.unlock();
+      throw;
+    }
+    lock.lock();
+    --entry->second.mUnsure;
+    // Next round: the copy goes in behind the call just queued, unless that
+    // call has run already (it took nothing of this post); then another is
+    // queued.
   }
 }
-
 }  // namespace
 
 void StationUtils::PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage) {
@@ -274,11 +305,45 @@ namespace {
 struct IdlePosts {
   std::mutex mMutex;
   std::vector<PostedCall> mWaiting;  // in the order posted; guarded by mMutex
+  // The posts a run that threw did not reach, from mPutBackNext on: they
+  // come before mWaiting. Guarded by mMutex.
+  std::vector<PostedCall> mPutBack;
+  std::size_t mPutBackNext = 0;
 };
 
 IdlePosts& Idle() {
   static IdlePosts* posts = new IdlePosts;
   return *posts;
+}
+
+// The posts one RunIdlePosts took, and how far it got. The vector stays in
+// place while the run lives: a nested run only advances mNext.
+struct IdleRun {
+  std::vector<PostedCall> mPosts;
+  std::size_t mNext = 0;
+  bool mStopped = false;  // a post threw: the rest waits for the next idle broadcast
+};
+
+// The innermost idle run on this thread (the main thread). An idle broadcast
+// from a handler of one of its posts finishes it first: its posts were made
+// before any the nested broadcast could take.
+thread_local IdleRun* tIdleRun = nullptr;
+
+void RunRest(IdleRun& ioRun) {
+  ioRun.mStopped = false;
+  std::size_t running = 0;
+  try {
+    while (!ioRun.mStopped && ioRun.mNext < ioRun.mPosts.size()) {
+      running = ioRun.mNext++;
+      ioRun.mPosts[running]();
+      ioRun.mPosts[running].clear();
+    }
+  } catch (...) {
+    // The copy's destructor is the host's code: not under our lock later.
+    ioRun.mPosts[running].clear();
+    ioRun.mStopped = true;
+    throw;
+  }
 }
 
 }  // namespace
@@ -293,34 +358,56 @@ void StationUtils::PostMessageAtIdleTime(const ImmutableString& inStationID, con
 
 void Detail::RunIdlePosts() {
   IdlePosts& posts = Idle();
-  std::vector<PostedCall> batch;
+  if (tIdleRun != nullptr) RunRest(*tIdleRun);
+  IdleRun run;
   {
     std::lock_guard<std::mutex> lock(posts.mMutex);
-    batch.swap(posts.mWaiting);
+    if (posts.mPutBackNext < posts.mPutBack.size()) {
+      // Posts put back come first. When the newer ones cannot join them for
+      // want of storage, this throws with both as they were (the delivered
+      // posts dropped first hold nothing).
+      if (!posts.mWaiting.empty()) {
+        posts.mPutBack.erase(posts.mPutBack.begin(), posts.mPutBack.begin() + static_cast<std::ptrdiff_t>(posts.mPutBackNext));
+        posts.mPutBackNext = 0;
+        posts.mPutBack.insert(posts.mPutBack.end(), std::make_move_iterator(posts.mWaiting.begin()),
+                              std::make_move_iterator(posts.mWaiting.end()));
+        posts.mWaiting.clear();
+      }
+      run.mPosts.swap(posts.mPutBack);
+      run.mNext = std::exchange(posts.mPutBackNext, 0);
+    } else {
+      run.mPosts.swap(posts.mWaiting);
+    }
     sIdlePostsWaiting.store(false, std::memory_order_relaxed);
   }
-  std::size_t next = 0;
-  try {
-    while (next < batch.size()) {
-      PostedCall& call = batch[next++];
-      call();
-      call.clear();
+  // When a post threw, hands the rest back whole, allocating nothing: no run
+  // took posts since this one did, since a nested run first finishes this
+  // one's posts and takes nothing when they throw.
+  struct Finish {
+    IdlePosts& mIdle;
+    IdleRun& mRun;
+    IdleRun* mOuter;
+    ~Finish() {
+      tIdleRun = mOuter;
+      if (!mRun.mStopped || mRun.mNext == mRun.mPosts.size()) return;
+      std::lock_guard<std::mutex> lock(mIdle.mMutex);
+      mIdle.mPutBack.swap(mRun.mPosts);
+      mIdle.mPutBackNext = mRun.mNext;
+      sIdlePostsWaiting.store(true, std::memory_order_relaxed);
     }
-  } catch (...) {
-    // They were posted before anything that waits now.
-    std::lock_guard<std::mutex> lock(posts.mMutex);
-    posts.mWaiting.insert(posts.mWaiting.begin(), std::make_move_iterator(batch.begin() + static_cast<std::ptrdiff_t>(next)),
-                          std::make_move_iterator(batch.end()));
-    if (!posts.mWaiting.empty()) sIdlePostsWaiting.store(true, std::memory_order_relaxed);
-    throw;
-  }
+  } finish{posts, run, tIdleRun};
+  tIdleRun = &run;
+  RunRest(run);
 }
 
 void Detail::DropIdlePosts() noexcept {
   IdlePosts& posts = Idle();
   std::vector<PostedCall> dropped;
+  std::vector<PostedCall> putBack;
   std::lock_guard<std::mutex> lock(posts.mMutex);
   dropped.swap(posts.mWaiting);
+  putBack.swap(posts.mPutBack);
+  posts.mPutBackNext = 0;
   sIdlePostsWaiting.store(false, std::memory_order_relaxed);
 }
 

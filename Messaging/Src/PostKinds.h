@@ -17,9 +17,10 @@ TARN_MESSAGING_LOCAL extern std::atomic<bool> sIdlePostsWaiting;
 
 // Broadcasts the idle-time posts that wait now, in the order they were made;
 // main thread, from a broadcast of the idle station that its listeners will
-// hear. Posts made meanwhile wait for the next one. When a delivery throws,
-// the posts after it wait again, ahead of newer ones, and the exception
-// propagates.
+// hear. Posts made meanwhile wait for the next one; called from a handler of
+// one of those posts, it first finishes the outer call's posts. When a
+// delivery throws, the posts after it wait again, ahead of newer ones
+// (putting them back takes no storage), and the exception propagates.
 TARN_MESSAGING_LOCAL void RunIdlePosts();
 
 // Frees the idle-time posts that wait, unheard; for the last Terminate.

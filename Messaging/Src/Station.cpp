@@ -10,6 +10,8 @@
 #include <kivcore/Error.h>
 #include <kivcore/MainThread.h>
 
+#include <exception>
+
 namespace Tarn {
 
 namespace {
@@ -68,9 +70,18 @@ void Station::BroadcastCounted(const Message& inMessage) {
   } leave{this, frame.mOuter};
   // Idle-time posts go out with an idle broadcast that its listeners hear,
   // just before them; inside the count, so that the station outlives them.
-  if (Detail::sIdlePostsWaiting.load(std::memory_order_relaxed) && mStationID == kStation_Idle && IsBroadcasting())
-    Detail::RunIdlePosts();
+  // One that throws (its station's factory, say) does not cost the idle
+  // listeners their message: the exception leaves once they have heard it.
+  std::exception_ptr idleFailure;
+  if (Detail::sIdlePostsWaiting.load(std::memory_order_relaxed) && mStationID == kStation_Idle && IsBroadcasting()) {
+    try {
+      Detail::RunIdlePosts();
+    } catch (...) {
+      idleFailure = std::current_exception();
+    }
+  }
   Broadcaster::BroadcastMessage(inMessage);
+  if (idleFailure) std::rethrow_exception(idleFailure);
 }
 
 bool Station::IsRelaying(const Message& inMessage) const noexcept {

@@ -28,7 +28,9 @@ struct Library { Library() { Tarn::Messaging::Initialize(); } ~Library() { Tarn:
 // What handlers do to the post being delivered: a coalesced post of the same
 // key is queued anew (not merged into the delivery under way, and not lost);
 // cancelling its token on the main thread returns at once and drops the
-// rest; an idle-time post waits for the next idle broadcast.
+// rest; an idle-time post waits for the next idle broadcast, which, made by
+// the handler itself, first finishes the posts made before (7 once came
+// after 6).
 TEST(PostKindsThreadTest, HandlersPostingOrCancellingDuringTheirOwnDeliveryAffectOnlyLaterPosts) {
   Library library;
   CallLog log;
@@ -38,19 +40,21 @@ TEST(PostKindsThreadTest, HandlersPostingOrCancellingDuringTheirOwnDeliveryAffec
     const int value = ValueOf(inMessage);
     if (value == 1) PostCoalescedMessageToUIThread(kStation_StatusBar, NumberMessage(2));
     if (value == 3) token.Cancel();
-    if (value == 5) PostMessageAtIdleTime(kStation_StatusBar, NumberMessage(6));
+    if (value != 5) return;
+    PostMessageAtIdleTime(kStation_StatusBar, NumberMessage(6));
+    BroadcastMessage(kStation_Idle, PingMessage());
   });
   AddListener(kStation_StatusBar, &a);
   std::thread([&token] {
     PostCoalescedMessageToUIThread(kStation_StatusBar, NumberMessage(1));
     for (int value : {3, 4}) PostMessageToUIThread(kStation_StatusBar, NumberMessage(value), Tarn::PostCancelToken(token));
-    PostMessageAtIdleTime(kStation_StatusBar, NumberMessage(5));
+    for (int value : {5, 7}) PostMessageAtIdleTime(kStation_StatusBar, NumberMessage(value));
     BroadcastMessage(kStation_Idle, PingMessage());  // off the main thread: delivers nothing
   }).join();
   FlushPostedMessagesOnUIThread();
   EXPECT_EQ((std::vector<std::string>{"a:1", "a:3"}), log.Entries());
   for (int run = 0; run < 2; ++run) FlushPostedMessagesOnUIThread(), BroadcastMessage(kStation_Idle, PingMessage());
-  EXPECT_EQ((std::vector<std::string>{"a:1", "a:3", "a:2", "a:5", "a:6"}), log.Entries());
+  EXPECT_EQ((std::vector<std::string>{"a:1", "a:3", "a:2", "a:5", "a:7", "a:6"}), log.Entries());
 }
 
 TEST(PostKindsThreadTest, CancelOnAWorkerWaitsForTheRunningDeliveryAndNoneFollows) {

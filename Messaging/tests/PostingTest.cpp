@@ -15,19 +15,30 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
+#include <chrono>
 #include <cstdlib>
+#include <functional>
 #include <new>
 #include <stdexcept>
 #include <thread>
+#include <utility>
 
 namespace {
-// Allocations left before the heap fails; negative: never fails.
+// Allocations left before the heap fails, on every thread or on this one
+// alone; negative: never fails. A thread's failure first runs its hook.
 std::atomic<long long> gHeapAllocationsLeft{-1};
+thread_local long long tHeapAllocationsLeft = -1;
+thread_local std::function<void()>* tBeforeFailing = nullptr;
 
 void* Allocate(std::size_t inSize) {
   if (gHeapAllocationsLeft.load(std::memory_order_relaxed) >= 0 && gHeapAllocationsLeft.fetch_sub(1) <= 0)
     throw std::bad_alloc();
+  if (tHeapAllocationsLeft >= 0 && tHeapAllocationsLeft-- == 0) {
+    if (std::function<void()>* const hook = std::exchange(tBeforeFailing, nullptr)) (*hook)();
+    throw std::bad_alloc();
+  }
   if (void* block = std::malloc(inSize == 0 ? 1 : inSize)) return block;
   throw std::bad_alloc();
 }
@@ -91,17 +102,12 @@ TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
   MainThreadGuard mainThread;
   Tarn::Messaging::Initialize();
   Tarn::Broadcaster broadcaster;
-  RecordingListener plain("plain");
-  const auto boostListener = boost::make_shared<RecordingListener>("boost");
-  const auto stdListener = std::make_shared<RecordingListener>("std");
-  auto* const safe = new CountedSafeListener("safe");
-  const Tarn::ISafeListenerRef safeRef(safe);
-  const CallRecorder* const recorders[] = {&plain, boostListener.get(), stdListener.get(), safe};
-  auto heard = [&] {
-    int calls = 0;
-    for (const CallRecorder* recorder : recorders) calls += recorder->Calls();
-    return calls;
-  };
+  CallLog log;
+  RecordingListener plain("plain", &log);
+  const auto boostListener = boost::make_shared<RecordingListener>("boost", &log);
+  const auto stdListener = std::make_shared<RecordingListener>("std", &log);
+  const Tarn::ISafeListenerRef safe(new CountedSafeListener("safe", &log));
+  auto heard = [&log] { return log.Entries().size(); };
   for (const bool onStation : {false, true}) {
     Tarn::Broadcaster& target = onStation ? *Tarn::StationRegistry::FindStation(Tarn::kStation_StatusBar) : broadcaster;
     auto attach = [&](const auto& inListener) {
@@ -111,13 +117,13 @@ TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
         [&] { return attach(static_cast<Tarn::Listener*>(&plain)); },
         [&] { return attach(boost::weak_ptr<Tarn::Listener>(boostListener)); },
         [&] { return attach(std::weak_ptr<Tarn::Listener>(stdListener)); },
-        [&] { return attach(safeRef); },
+        [&] { return attach(safe); },
     };
     for (const auto& form : forms) {
       for (long long n = 0; n < 100 && !HasFailure(); ++n) {
         SCOPED_TRACE(std::string(onStation ? "station" : "broadcaster") + " form " + std::to_string(&form - forms) +
                      ", failing after " + std::to_string(n));
-        const int before = heard();
+        const std::size_t before = heard();
         try {
           gHeapAllocationsLeft.store(n);
           const Tarn::Registration registration = form();
@@ -136,13 +142,15 @@ TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
   Tarn::Messaging::Terminate();
 }
 
-// A queued call that throws once storage has run out: its exception
-// propagates and the posts behind it (plain, coalesced and cancellable) stay
-// queued, in order, and go out with the next run. Putting them back once
-// took storage: they were destroyed unrun, std::bad_alloc replaced the
-// exception, the coalesced key stayed blocked for ever and the cancellable
-// copy stayed with its token.
-TEST(PostingTest, ACallThatThrowsWithStorageOutLeavesThePostsBehindItQueued) {
+// Storage running out loses no post that stands. A queued call that throws
+// once storage has run out: its exception propagates and the posts behind it
+// (plain, coalesced and cancellable) stay queued, in order, and go out with
+// the next run. Putting them back once took storage: they were destroyed
+// unrun, std::bad_alloc replaced the exception, the coalesced key stayed
+// blocked for ever and the cancellable copy stayed with its token. Then the
+// same for idle-time posts, and a coalesced post that fails to queue its call.
+TEST(PostingTest, StorageRunningOutLosesNoPostThatStands) {
+  using Tarn::StationUtils::PostCoalescedMessageToUIThread;
   MainThreadGuard mainThread;
   Tarn::Messaging::Initialize();
   CallLog log;
@@ -160,7 +168,7 @@ TEST(PostingTest, ACallThatThrowsWithStorageOutLeavesThePostsBehindItQueued) {
   std::vector<std::string> expected;
   // More than any earlier run of this process left room for.
   for (int i = 0; i < 1000; ++i) {
-    if (i == 1) Tarn::StationUtils::PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i));
+    if (i == 1) PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i));
     else if (i == 2) PostMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i), token);
     else PostMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i), true);
     expected.push_back("l:" + std::to_string(i));
@@ -171,9 +179,62 @@ TEST(PostingTest, ACallThatThrowsWithStorageOutLeavesThePostsBehindItQueued) {
   FlushPostedMessagesOnUIThread();
   EXPECT_EQ(log.Entries(), expected);
   EXPECT_EQ(SmallBlockAllocator::GetStatistics().blocksInUse, blocksBefore) << "a copy outlived its delivery";
-  Tarn::StationUtils::PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(1));
+  PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(1));
   FlushPostedMessagesOnUIThread();
   EXPECT_EQ(listener.Calls(), 1001) << "the coalesced key stayed blocked";
+  // Idle-time posts behind one whose station's factory throws: the same.
+  const kivcore::utility::ImmutableString failing = Tarn::StationRegistry::UniqueStationID();
+  Tarn::StationRegistry::RegisterStation(failing, [](const kivcore::utility::ImmutableString& inID) -> Tarn::Station* {
+    static bool sFailed = false;
+    if (std::exchange(sFailed, true)) return new Tarn::Station(inID);
+    const std::runtime_error error("factory");
+    gHeapAllocationsLeft.store(0);
+    throw error;
+  });
+  for (const auto& station : {failing, Tarn::kStation_StatusBar})
+    Tarn::StationUtils::PostMessageAtIdleTime(station, NumberMessage(1001));
+  Tarn::StationUtils::AddListener(Tarn::kStation_Idle, &listener);
+  EXPECT_THROW(Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, PingMessage()), std::runtime_error);
+  gHeapAllocationsLeft.store(-1);
+  Tarn::StationUtils::BroadcastMessage(Tarn::kStation_Idle, PingMessage());
+  // The idle listeners once missed the message the failure came with.
+  const std::vector<std::string> entries = log.Entries();
+  EXPECT_EQ(std::vector<std::string>(entries.begin() + std::min<std::ptrdiff_t>(1001, entries.size()), entries.end()),
+            (std::vector<std::string>{"l:ping", "l:1001", "l:ping"}));
+  Tarn::StationUtils::RemoveListener(Tarn::kStation_Idle, &listener);
+  Tarn::StationRegistry::DisposeStation(failing);
+  // Worker A's coalesced post fails to queue its call while worker B posts
+  // with the same key: B's post, which returns normally, is delivered, and
+  // A's, which throws, is not. A once erased the entry holding B's copy.
+  std::thread([] {
+    // Fills the queue to its capacity: the next call queued needs storage.
+    for (bool full = false; !full;) {
+      tHeapAllocationsLeft = 0;
+      try {
+        PostMessageToUIThread(Tarn::kStation_StatusBar, PingMessage(), true);
+      } catch (const std::bad_alloc&) {
+        full = true;
+      }
+    }
+    std::thread b;
+    std::atomic<bool> returned{false};
+    std::function<void()> postOnB = [&] {
+      b = std::thread([&] {
+        PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(2));
+        returned = true;
+      });
+      // Fixed, B's post needs the queue's lock, which A holds meanwhile: the
+      // wait then ends at its limit.
+      WaitUntil([&] { return returned.load(); }, std::chrono::milliseconds(100));
+    };
+    tBeforeFailing = &postOnB;
+    tHeapAllocationsLeft = 1;  // the entry's node is had, the queue's growth fails
+    EXPECT_THROW(PostCoalescedMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(1)), std::bad_alloc);
+    tHeapAllocationsLeft = -1;
+    b.join();
+  }).join();
+  FlushPostedMessagesOnUIThread();
+  EXPECT_EQ(log.Entries().back(), "l:2");
   Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
   Tarn::Messaging::Terminate();
 }
