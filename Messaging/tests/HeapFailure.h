@@ -31,7 +31,11 @@ inline void* AllocateOrFail(std::size_t inSize) {
 
 }  // namespace messaging_test
 
-// The array forms the standard library provides call these.
+// Every form whose blocks these deletes free is replaced (a sanitizer's own
+// would not match them); the array forms pair with each other, or, without a
+// sanitizer, the standard library's call these.
 void* operator new(std::size_t inSize) { return messaging_test::AllocateOrFail(inSize); }
+void* operator new(std::size_t inSize, const std::nothrow_t&) noexcept { return std::malloc(inSize == 0 ? 1 : inSize); }
 void operator delete(void* inBlock) noexcept { std::free(inBlock); }
 void operator delete(void* inBlock, std::size_t) noexcept { std::free(inBlock); }
+void operator delete(void* inBlock, const std::nothrow_t&) noexcept { std::free(inBlock); }
