@@ -455,6 +455,10 @@ void TerminateFrom(const void* inCallSite) {
   // Station destructors run without the registry's lock; each looks itself
   // up and finds nothing.
   for (auto& element : doomed) StationRetirement::Delete(std::exchange(element.second.mStation, nullptr));
+  // So do the stations workers disposed of, which wait for a main-thread
+  // disposal that may never come now; those still in use stay retired.
+  RegistryLock lock("StationRegistry::Terminate");
+  DeleteAll(GetPendingStationList(), Sweep::kAll);
 }
 
 }  // namespace StationRegistry

@@ -9,15 +9,30 @@
 //
 // The world: a broadcaster of the harness's own (node 0), three registry
 // stations made by a factory that reports their lives (nodes 1-3), the idle
-// station (node 4), five listener slots of the four kinds (plain pointer,
-// boost::weak_ptr, std::weak_ptr, safe listener), an idle countdown timer.
-// Operations: listeners made, attached, detached, stopped and killed;
+// station (node 4), five listener slots of five kinds (plain pointer,
+// boost::weak_ptr, std::weak_ptr, safe listener, subscription), an idle
+// countdown timer, two cancel tokens.
+// Operations: listeners made, attached and detached (by the broadcaster, the
+// utilities, or registrations of Tarn::Attach made and reset), stopped and
+// killed; subscriptions made and reset, from their own handlers too;
 // broadcasting stopped and started; broadcasts, also nested from handlers;
 // stations attached as relays to the broadcaster or to lower stations (chains,
 // never cycles); register, retain, find, release and dispose; timers made,
-// armed and destroyed; the library terminated (and initialized again when the
-// step ends). Handlers run operations too, and some operations run on a
-// helper thread while the main thread waits (inside a handler as well).
+// armed and destroyed; posts of every kind (plain, coalesced under the type's
+// or a caller's key, cancellable, idle-time), cancels, runs of the pending
+// calls; the last Terminate, from the top, from handlers and from posted
+// calls. After a Terminate in a handler the library is initialized again
+// there, or on another thread that works as the main thread while the
+// handler's thread waits; after a step that terminated, here or on a new
+// thread that takes the rest of the sequence over (the main thread moves).
+// Handlers run operations too, and some operations run on a helper thread
+// while the main thread waits (inside a handler as well).
+//
+// Allocation failure: a quarter of the operations make their library call
+// with the n-th heap or small-block allocation failing. A call that throws
+// std::bad_alloc must leave the library as it was (the model goes back to
+// where it was before the operation, and everything above is checked against
+// it); a call that returns must have done all it said.
 //
 // The model numbers every registration; a running broadcast serves the newest
 // entry older than the one it served last and never one added after it
@@ -27,20 +42,28 @@
 // registration and back-link, every listener's life. A station must never be
 // deleted while a broadcast on it runs; one disposed of meanwhile goes when
 // that broadcast ends, and one a worker let go is gone once the main thread
-// has run its posted calls and disposed of a registered station. After the
-// final Terminate no station or listener may remain and every small block
-// must be back. Any contract report is a failure: the harness makes no bad
-// calls.
+// has run its posted calls and disposed of a registered station, or made the
+// last Terminate. Posts are checked as a run delivers them: in the order
+// queued, none cancelled, replaced or dropped, and each heard by every
+// listener of its station (and of the stations relaying it) as often as the
+// model says. After the final Terminate no station or listener may remain and
+// every small block must be back. Any contract report is a failure: the
+// harness makes no bad calls.
 //
-// RunConcurrent is the same library under real concurrency: a worker makes,
-// relays and lets go of stations and listeners while the main thread
-// broadcasts through them; no call may follow a removal that returned.
+// RunConcurrent is the same library under real concurrency: two workers make,
+// relay and let go of stations and listeners while the main thread broadcasts
+// through them; then a worker adds, posts and removes on a well-known station
+// while the main thread terminates and initializes, over and over. No call
+// may follow a removal that returned.
 //
 // Threading: one sequence at a time, from the thread that is to be the main
 // thread. A helper operation that does not return within 20 s (a deadlock),
-// and a station deleted while a broadcast on it runs (the library would go on
-// in freed memory), stop the process at once with the trace.
+// a station deleted while a broadcast on it runs (the library would go on in
+// freed memory), and a subscription's handler destroyed while it runs stop the
+// process at once with the trace. The statistics are for one thread at a time.
 #pragma once
+
+#include "HeapFailure.h"
 
 #include <TarnMessaging.h>
 
@@ -63,6 +86,7 @@
 namespace operations_harness {
 
 using kivcore::utility::ImmutableString;
+using kivcore::utility::SmallBlockAllocator;
 namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
 
@@ -74,17 +98,29 @@ struct Choices {
 };
 
 struct Ping : Tarn::MessageImpl<Ping> {};
+struct Posted : Tarn::MessageImpl<Posted> {
+  explicit Posted(int inNumber) : mNumber(inNumber) {}
+  int mNumber;
+};
+inline int PostNumber(const Tarn::Message& inMessage) {
+  return inMessage.GetMessageID() == Posted::StaticMessageID() ? static_cast<const Posted&>(inMessage).mNumber : 0;
+}
 
 constexpr int kSlots = 5, kNodes = 5, kIdle = 4, kMaxLevels = 3, kMaxHandlerActions = 200;
+// An operation's failing allocation is one of the first kFailPoints on the heap or in small-block storage.
+constexpr int kFailPoints = 6;
 // Entry.mWho of the timer, and of a weak or safe entry whose object died before its slot was reused; kSlots + n:
 // station n as a relay.
 constexpr int kTimer = kSlots + kNodes, kGone = -1;
-enum Way { kPlain, kBoost, kStd, kSafe };
+enum Way { kPlain, kBoost, kStd, kSafe, kSub };  // kSub: a subscription (Tarn::Subscribe), held by plain pointer
 
 class Harness;
 inline Harness* sHarness = nullptr;
 inline std::atomic<int> sLiveStations{0};
-void Called(int inSlot);
+// What the sequences ran so far: library calls made with an allocation failure drawn, those that threw, and the
+// times the main thread moved to another thread.
+inline struct Statistics { long long mFailingCalls = 0, mThrown = 0, mMoves = 0; } sStatistics;
+void Called(int inSlot, int inPost = 0);  // inPost: the number of the post delivered, 0: a broadcast
 void Destroyed(int inSlot);
 void StationLife(int inNode, Tarn::Station* inStation);  // null: deleted
 
@@ -93,10 +129,20 @@ template <class Base>
 struct Probe : Base {
   explicit Probe(int inSlot) : mSlot(inSlot) {}
   ~Probe() override { Destroyed(mSlot); }
-  void ListenToMessage(const Tarn::Message&) override { Called(mSlot); }
+  void ListenToMessage(const Tarn::Message& inMessage) override { Called(mSlot, PostNumber(inMessage)); }
   const int mSlot;
 };
 using PlainProbe = Probe<Tarn::Listener>;
+
+// A subscription's handler: the slot's object lives as long as the handler. It reads what it captured after the
+// call as well, which must still be there then, whatever the call did to its registration.
+struct Handler {
+  explicit Handler(int inSlot) : mSlot(std::make_unique<int>(inSlot)) {}
+  Handler(Handler&&) = default;
+  ~Handler() { mSlot ? Destroyed(*mSlot) : void(); }
+  void operator()(const Ping&) const { const int slot = *mSlot; Called(slot), *mSlot != slot ? Destroyed(kGone) : void(); }
+  std::unique_ptr<int> mSlot;
+};
 
 // Reports its life for node mNode (1-4); -1: counted only.
 struct TrackedStation : Tarn::Station {
@@ -132,11 +178,22 @@ struct Object {
   bool mOwned = false, mAlive = false, mListening = true, mDestroyed = false;
   int mHolds = 0;           // weak or safe deliveries in progress, each keeping it alive
   int mLinks[kNodes] = {};  // back-link records the listener holds, per node
+};
+
+// What the harness holds of a slot's listener: the object, and the registrations of Tarn::Attach per node, for
+// plain-pointer and for its own way, each with the life of the node it was made in.
+struct Handles {
   std::unique_ptr<PlainProbe> mPlain;
   boost::shared_ptr<PlainProbe> mBoost;
   std::shared_ptr<PlainProbe> mStd;
   Tarn::ISafeListenerRef mSafe;
   Tarn::Listener* mListener = nullptr;  // while owned; null for safe listeners
+  Tarn::Registration mAttached[kNodes][2];
+  int mLife[kNodes][2] = {};
+};
+
+struct Queued {
+  int mNumber, mNode, mKind, mKey;  // mKind: see Harness::Post; mKey: a coalesced post's caller key (-1: its type's), a cancellable post's token
 };
 
 struct Frame {
@@ -157,18 +214,23 @@ public:
     for (int node = 1; node < kIdle; ++node) mIDs[node] = Registry::UniqueStationID(), RegistryOp(node, 0, false);
   }
   ~Harness() {
-    kivcore::config::SetErrorHandler(std::move(mPreviousErrors));
+    kivcore::config::SetErrorHandler(std::move(mPreviousErrors)), sHarness = nullptr;
     kivcore::config::ErrorManager::SetExceptionHandler(std::move(mPreviousExceptions));
-    sHarness = nullptr;
   }
 
-  void Run(int inSteps) {
-    for (int step = 0; step < inSteps && mFailure.empty() && !mChoices.Exhausted(); ++step) {
+  // Runs at most inSteps steps from inStep, then Finish. A step that leaves the library terminated initializes it
+  // again, here or, now and then, on a new thread that runs the rest of the sequence: the main thread moves.
+  std::string Run(int inSteps, int inStep = 0) {
+    for (int step = inStep; step < inSteps && mFailure.empty() && !mChoices.Exhausted(); ++step) {
       Note("\n%d:", step);
       Act(0);
+      std::string failure;
+      if (!mMain && Pick(4) == 0)
+        return Note(" move"), ++sStatistics.mMoves, OnThread(true, [&] { Initialize(), Compare(), failure = Run(inSteps, step + 1); }), failure;
       if (!mMain) Initialize();
       Compare();
     }
+    return Finish();
   }
 
   // Lets everything go, terminates the library, and returns the first
@@ -197,37 +259,37 @@ public:
     Note(" [%d]", inSlot);
     mStale = false;
     const int actions = Pick(5) < 3 || mHandlerActions >= kMaxHandlerActions ? 0 : 1 + Pick(2);
-    for (int action = 0; action < actions && mFailure.empty(); ++action, ++mHandlerActions) Act(static_cast<int>(mLevels.size()));
+    for (int action = 0; action < actions && mFailure.empty(); ++action, ++mHandlerActions) Act(static_cast<int>(mLevels.size()), inSlot);
     mStale = true;
   }
-  void OnDestroyed(int inSlot) { mObjects[inSlot].mDestroyed = true; }
+  // A post was delivered: one the current run is to deliver, not before one delivered already. Its handler may
+  // make the last Terminate (outside broadcasts the model walks).
+  void OnPosted(int inSlot, int inPost) {
+    if (!mFailure.empty()) return;
+    const auto post = std::find_if(mRun.mPosts.begin(), mRun.mPosts.end(), [&](const Queued& inOne) { return inOne.mNumber == inPost; });
+    const std::size_t at = static_cast<std::size_t>(post - mRun.mPosts.begin());
+    if (post == mRun.mPosts.end()) return Fail("post " + std::to_string(inPost) + " delivered: cancelled, replaced, dropped or not due");
+    if (at < mRun.mAt) return Fail("post " + std::to_string(inPost) + " delivered after a later one");
+    mRun.mAt = at, ++mRun.mHeard[at * kSlots + inSlot];
+    Note(" <%d>%d", inSlot, inPost);
+    if (mLevels.empty() && mMain && Pick(8) == 0) Terminate();
+  }
+  void OnDestroyed(int inSlot) { inSlot == kGone ? Fatal("a subscription's handler was destroyed while it ran") : void(mObjects[inSlot].mDestroyed = true); }
   void OnStation(int inNode, Tarn::Station* inStation) {
     const Node& node = mNodes[inNode];
     // Inside the library, after the last handler it called, the model has yet to walk the rest of the innermost
     // broadcast (and the utilities' release at its end): a station may go only if nobody else is to be called.
     // A relay retired meanwhile goes as its own outermost broadcast ends, while the walk that reached it goes on:
     // fine if the model, walking on to the next call, has left every frame of this station behind.
-    bool walkedPast = false;
-    if (inStation == nullptr && mStale && mFailure.empty()) {
-      const std::vector<Frame> frames = mFrames;
-      const std::vector<Level> levels = mLevels;
-      std::vector<Node> nodes(std::begin(mNodes), std::end(mNodes));
-      struct Held { bool mAlive; int mHolds; int mLinks[kNodes]; };
-      std::vector<Held> held;
-      for (const Object& object : mObjects) held.push_back(Held{object.mAlive, object.mHolds, {}}), std::copy(std::begin(object.mLinks), std::end(object.mLinks), held.back().mLinks);
-      const bool timer = mTimerListening;
-      if (Next() >= 0) {
-        if (node.mFrames > 0) Fatal("a station was deleted while a broadcast on it runs");
-        mFrames = frames, mLevels = levels, mTimerListening = timer, walkedPast = true;
-        std::copy(nodes.begin(), nodes.end(), std::begin(mNodes));
-        for (int slot = 0; slot < kSlots; ++slot)
-          mObjects[slot].mAlive = held[slot].mAlive, mObjects[slot].mHolds = held[slot].mHolds,
-          std::copy(std::begin(held[slot].mLinks), std::end(held[slot].mLinks), mObjects[slot].mLinks);
-      }
+    if (inStation == nullptr) {
+      const bool walk = mStale && mFailure.empty();
+      const Snapshot before = walk ? Save() : Snapshot();
+      const bool more = walk && Next() >= 0;
+      if (node.mFrames > 0) Fatal("a station was deleted while a broadcast on it runs");
+      if (more) Restore(before);
+      if (node.mMade && !node.mDoomed) Fail("a station was deleted that the registry should keep");
     }
     if (inStation != nullptr && mStations[inNode] != nullptr) Fail("two stations of one ID alive");
-    if (inStation == nullptr && node.mFrames > 0 && !walkedPast) Fatal("a station was deleted while a broadcast on it runs");
-    if (inStation == nullptr && node.mMade && !node.mDoomed) Fail("a station was deleted that the registry should keep");
     mStations[inNode] = inStation;
   }
   Tarn::Station* Factory(const ImmutableString& inStationID) {
@@ -252,71 +314,139 @@ private:
     mMain = mNodes[kIdle].mRegistered = true;
   }
 
-  // Runs inCall on a helper thread while this thread waits, or here.
+  // Runs inCall on a helper thread while this thread waits, or here. Here, the library call meets the allocation
+  // failure its operation drew, if any (the heap's or small-block storage's n-th allocation): the call throws
+  // std::bad_alloc and leaves the library as it was (Act then restores the model), or returns having done it all.
   template <class Call>
   void OnThread(bool inHelper, Call inCall) {
-    if (!inHelper) return inCall();
-    auto done = std::async(std::launch::async, inCall);
-    if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready)
-      std::fprintf(stderr, "operations harness: a helper operation hangs%s\n", mTrace.c_str()), std::abort();
-    done.get();
-  }
-
-  // One operation, from the top (inLevel 0) or from a handler.
-  void Act(int inLevel) {
-    // Low slots come more often, so that operations meet on the same listener.
-    const int slot = std::min(Pick(kSlots), Pick(kSlots)), node = Pick(kNodes), op = Pick(13), choice = Pick(8);
-    const bool helper = mMain && Pick(4) == 0;
-    switch (op) {
-      case 0: return Create(slot);
-      case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
-      case 4: return Kill(slot, helper);
-      case 5: return Listen(slot, choice < 5);
-      case 6: return SetBroadcasting(node, choice < 5);
-      case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
-      case 9: return Relay(node, choice % kIdle, choice < 5);
-      case 10: case 11: return RegistryOp(node, choice % 5, helper);
-      default: return TimerOp(choice);
+    if (inHelper) {
+      auto done = std::async(std::launch::async, inCall);
+      if (done.wait_for(std::chrono::seconds(20)) != std::future_status::ready)
+        std::fprintf(stderr, "operations harness: a helper operation hangs%s\n", mTrace.c_str()), std::abort();
+      return done.get();
     }
+    const int failAt = std::exchange(mFailAt, -1);
+    if (failAt < 0) return inCall();
+    failAt < kFailPoints ? messaging_test::FailHeapAfter(failAt) : SmallBlockAllocator::SetFailAfter(failAt - kFailPoints);
+    try {
+      inCall();
+    } catch (const std::bad_alloc&) {
+      mThrew = true;
+    }
+    messaging_test::FailHeapAfter(-1), SmallBlockAllocator::SetFailAfter(-1);
+    ++sStatistics.mFailingCalls, sStatistics.mThrown += mThrew;
+    Note(mThrew ? " (bad_alloc at %d)" : " (done despite %d)", failAt);
   }
 
-  void Create(int inSlot) {
+  // One operation, from the top (inLevel 0) or from the handler of slot inCalled; a quarter of them with an
+  // allocation failure.
+  void Act(int inLevel, int inCalled = -1) {
+    // Low slots, and in a handler its own slot, come more often, so that operations meet on the same listener.
+    const int slot = inCalled >= 0 && Pick(3) == 0 ? inCalled : std::min(Pick(kSlots), Pick(kSlots));
+    const int node = Pick(kNodes), op = Pick(16), choice = Pick(8);
+    const bool helper = mMain && Pick(4) == 0;
+    const int failAt = Pick(4) == 0 ? Pick(2 * kFailPoints) : -1;
+    Snapshot before = failAt >= 0 ? Save() : Snapshot();
+    mFailAt = failAt;
+    [&] {
+      switch (op) {
+        case 0: return Create(slot, node);
+        case 1: case 2: case 3: return AddOrRemove(slot, node, op != 3, choice, helper);
+        case 4: return Kill(slot, helper);
+        case 5: return Listen(slot, choice < 5);
+        case 6: return SetBroadcasting(node, choice < 5);
+        case 7: case 8: return inLevel < kMaxLevels ? Broadcast(node) : void();
+        case 9: return Relay(node, choice % kIdle, choice < 5);
+        case 10: case 11: return RegistryOp(node, choice % 5, helper);
+        case 12: return mMain ? TimerOp(choice) : Revive(inLevel, choice);
+        // Not to the idle station: any broadcast there runs the idle-time posts first.
+        case 13: return mMain ? Post(1 + node % 3, choice % 4, helper) : void();
+        case 14: return !mMain ? void() : choice < 5 ? Flush() : Cancel(choice % 2, helper);
+        default: return !mMain ? Revive(inLevel, choice) : inLevel > 0 ? Terminate() : TimerOp(choice);  // mostly from handlers
+      }
+    }();
+    mFailAt = -1;
+    if (!std::exchange(mThrew, false)) return;
+    // A station the failed call made stays, as a registered station made by a lookup would.
+    for (int made = 1; made < kNodes; ++made) before.mNodes[made].mMade |= mStations[made] != nullptr;
+    Restore(before);
+  }
+
+  // After a Terminate from a handler: the library initialized again here, or on another thread that, as the main
+  // thread, operates (broadcasts too) while this one waits in its handler, and terminates the library again.
+  void Revive(int inLevel, int inChoice) {
+    // A station of the old life still broadcasting would meet its successor; the model keeps one per ID.
+    for (int node = 1; node < kNodes; ++node)
+      if (mNodes[node].mFrames > 0) return;
+    if (inChoice < 4) return Note(" init"), Initialize();
+    Note(" elsewhere{"), ++sStatistics.mMoves;
+    OnThread(true, [&] {
+      Initialize();
+      for (int action = Pick(3); action >= 0 && mFailure.empty(); --action) Act(inLevel);
+      if (mMain) Terminate();
+    });
+    Note("}");
+  }
+
+  void Create(int inSlot, int inNode) {
     Object& object = mObjects[inSlot];
+    Handles& handles = mHandles[inSlot];
     if (object.mAlive) return;
     for (Node& node : mNodes)
       for (Entry& entry : node.mEntries) entry.mWho = entry.mWho == inSlot ? kGone : entry.mWho;
-    object = Object();
-    object.mKind = Pick(4);
+    object = Object(), handles.mListener = nullptr;
+    object.mKind = Pick(5);
     object.mOwned = object.mAlive = true;
     Note(" new%d.%d", inSlot, object.mKind);
     switch (object.mKind) {
-      case kPlain: object.mListener = (object.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
-      case kBoost: object.mListener = (object.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
-      case kStd: object.mListener = (object.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
-      default: object.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot));
+      case kPlain: handles.mListener = (handles.mPlain = std::make_unique<PlainProbe>(inSlot)).get(); break;
+      case kBoost: handles.mListener = (handles.mBoost = boost::make_shared<PlainProbe>(inSlot)).get(); break;
+      case kStd: handles.mListener = (handles.mStd = std::make_shared<PlainProbe>(inSlot)).get(); break;
+      case kSafe: handles.mSafe = Tarn::ISafeListenerRef(new Probe<Tarn::SafeListenerBase>(inSlot)); break;
+      default: Subscribe(inSlot, inNode == kIdle ? 0 : inNode);  // idle messages are not pings
     }
   }
 
+  // A subscription is made attached, and gone at once when its station ID is not registered.
+  void Subscribe(int inSlot, int inNode) {
+    Note("@%d", inNode);
+    Model(inNode, inSlot, kSub, true, true);
+    if (!Reach(inNode)) mObjects[inSlot].mOwned = false, Die(inSlot);
+    Tarn::Registration& made = mHandles[inSlot].mAttached[0][0];
+    OnThread(false, [&] { made = inNode == 0 ? Tarn::Subscribe<Ping>(mB0, Handler(inSlot)) : Tarn::Subscribe<Ping>(mIDs[inNode], Handler(inSlot)); });
+  }
+
+  // Added or removed by the broadcaster's or the utilities' call, or by a registration of Tarn::Attach: made, or
+  // reset (which removes nothing once the station it was made in is gone).
   void AddOrRemove(int inSlot, int inNode, bool inAdd, int inChoice, bool inHelper) {
     Object& object = mObjects[inSlot];
-    if (!object.mOwned) return;
+    if (!object.mOwned || object.mKind == kSub) return;
     // Objects owned by a shared pointer are sometimes registered by plain pointer: a second entry.
     const int way = (object.mKind == kBoost || object.mKind == kStd) && inChoice < 3 ? kPlain : object.mKind;
+    Tarn::Registration& attached = mHandles[inSlot].mAttached[inNode][way != kPlain];
+    int& life = mHandles[inSlot].mLife[inNode][way != kPlain];
+    const bool registration = Pick(3) == 0 && (inAdd || attached);
     // A worker's removal of a listener the main thread is delivering to waits for that delivery, and here the
     // main thread waits for the worker.
     if (!inAdd && inHelper && Delivering(inSlot, way)) return;
     // Only the harness's broadcaster, which never dies, is left a back-link by a removal that does not unlink.
-    const bool unlink = inNode != 0 || inChoice < 6;
+    const bool unlink = registration || inNode != 0 || inChoice < 6;
     Note(inAdd ? " add%d.%d@%d" : " rm%d.%d@%d", inSlot, way, inNode);
-    Note(unlink ? "%s" : "(keep link)%s", inHelper ? "h" : "");
-    Model(inNode, inSlot, way, inAdd, unlink);
+    Note(registration ? "(attach)%s" : unlink ? "%s" : "(keep link)%s", inHelper ? "h" : "");
+    if (inAdd || !registration || life == mLives[inNode]) Model(inNode, inSlot, way, inAdd, unlink);
     OnThread(inHelper, [&] {
-      WithListener(object, way, [&](const auto& inListener) { Call(inNode, inAdd, unlink, inListener); });
+      if (registration && !inAdd) return attached.Reset();
+      WithListener(mHandles[inSlot], way, [&](const auto& inListener) {
+        if (!registration) return Call(inNode, inAdd, unlink, inListener);
+        Tarn::Registration made = inNode == 0 ? Tarn::Attach(mB0, inListener) : Tarn::Attach(mIDs[inNode], inListener);
+        // The earlier registration is given up, not reset: it would remove the entry just made.
+        attached.Release(), attached = std::move(made), life = mLives[inNode];
+      });
     });
   }
 
   template <class Use>
-  static void WithListener(Object& ioObject, int inWay, Use inUse) {
+  static void WithListener(Handles& ioObject, int inWay, Use inUse) {
     switch (inWay) {
       case kPlain: return inUse(ioObject.mListener);
       case kBoost: return inUse(boost::weak_ptr<Tarn::Listener>(ioObject.mBoost));
@@ -335,20 +465,29 @@ private:
 
   void Kill(int inSlot, bool inHelper) {
     Object& object = mObjects[inSlot];
-    // Destroying a listener while a plain delivery to it runs is the owner's fault, not the library's.
-    if (!object.mOwned || Delivering(inSlot, kPlain)) return;
+    // Destroying a listener while a plain delivery to it runs is the owner's fault, not the library's. A
+    // subscription reset on a worker waits for its delivery on the main thread, while here the main thread waits.
+    const bool sub = object.mKind == kSub;
+    if (!object.mOwned || Delivering(inSlot, sub ? (inHelper ? kSub : -1) : kPlain)) return;
     Note(inHelper ? " kill%dh" : " kill%d", inSlot);
     object.mOwned = false;
+    // A subscription is detached at once, and its handler destroyed once no call of it runs.
+    for (Node& node : mNodes) Erase(node.mEntries, [&](const Entry& inEntry) { return sub && inEntry.mWho == inSlot; });
     if (object.mHolds == 0) Die(inSlot);
-    OnThread(inHelper, [&] { object.mPlain.reset(), object.mBoost.reset(), object.mStd.reset(), object.mSafe = nullptr; });
+    Handles& handles = mHandles[inSlot];
+    // Given up first: a plain listener detaches itself as it dies, a weak or safe entry stays for a broadcast to prune.
+    for (auto& attached : handles.mAttached) sub ? void() : (attached[0].Release(), attached[1].Release());
+    OnThread(inHelper, [&] {
+      handles.mAttached[0][0].Reset(), handles.mPlain.reset(), handles.mBoost.reset(), handles.mStd.reset(), handles.mSafe = nullptr;
+    });
   }
 
   void Listen(int inSlot, bool inOn) {
-    Object& object = mObjects[inSlot];
-    if (!object.mOwned || object.mListener == nullptr) return;
+    Tarn::Listener* listener = mHandles[inSlot].mListener;
+    if (!mObjects[inSlot].mOwned || listener == nullptr) return;
     Note(inOn ? " listen%d" : " deaf%d", inSlot);
-    object.mListening = inOn;
-    inOn ? object.mListener->StartListening() : object.mListener->StopListening();
+    mObjects[inSlot].mListening = inOn;
+    inOn ? listener->StartListening() : listener->StopListening();
   }
 
   void SetBroadcasting(int inNode, bool inOn) {
@@ -364,11 +503,13 @@ private:
     const bool retained = inNode != 0 && Reach(inNode);
     if (retained) ++mNodes[inNode].mRetains;
     mLevels.push_back(Level{mFrames.size(), retained ? inNode : 0});
-    if (mMain && (inNode == 0 || retained) && mNodes[inNode].mBroadcasting) Push(inNode);
+    const bool delivers = mMain && (inNode == 0 || retained) && mNodes[inNode].mBroadcasting;
+    if (delivers) Push(inNode);
     const bool stale = std::exchange(mStale, true);
     if (inNode == 0) mB0.BroadcastMessage(Ping());
-    else if (inNode == kIdle) Utils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage());
-    else Utils::BroadcastMessage(mIDs[inNode], Ping());
+    else if (inNode != kIdle) Utils::BroadcastMessage(mIDs[inNode], Ping());
+    // The idle-time posts waiting are delivered first; those its handlers make wait for the next.
+    else RunPosts(delivers ? &mPosts[1] : nullptr, [] { Utils::BroadcastMessage(Tarn::kStation_Idle, Tarn::ApplicationIdleMessage()); });
     mStale = stale;
     const int missed = mFailure.empty() ? Next() : -1;
     if (missed >= 0) Fail("a broadcast ended without calling slot " + std::to_string(missed));
@@ -415,27 +556,26 @@ private:
     OnThread(inHelper, [&] {
       switch (inOp) {
         case 0: return Registry::RegisterStation(id, &MakeTracked);
-        case 1: got = Registry::RetainStation(id); return;
-        case 2: got = Registry::FindStation(id); return;
+        case 1: case 2: got = inOp == 1 ? Registry::RetainStation(id) : Registry::FindStation(id); return;
         case 3: return Registry::ReleaseStation(id);
         default: return Registry::DisposeStation(id);
       }
     });
-    if (got != ((inOp == 1 || inOp == 2) && node.mRegistered ? mStations[inNode] : nullptr)) Fail("the registry returned another station");
-    if (inHelper) Drain();
+    if (!mThrew && got != ((inOp == 1 || inOp == 2) && node.mRegistered ? mStations[inNode] : nullptr)) Fail("the registry returned another station");
+    if (inHelper) Flush();
     Settle();
   }
 
   void TimerOp(int inChoice) {
     if (!mMain || inChoice == 0) return mMain ? Terminate() : void();
     if (!mTimer) {
-      Note(" timer"), mTimer = std::make_unique<Tarn::IdleCountdownTimer>();
+      Note(" timer"), OnThread(false, [&] { mTimer = std::make_unique<Tarn::IdleCountdownTimer>(); });
     } else if (inChoice < 5) {
       // Duration 0: it fires at the first idle message that reaches it.
       Note(" arm");
       if (!mTimerListening && Reach(kIdle)) mNodes[kIdle].mEntries.push_back(Entry{mToken++, kTimer, kPlain});
       mTimerListening = mTimerListening || Reach(kIdle);
-      mTimer->ArmTimer();
+      OnThread(false, [&] { mTimer->ArmTimer(); });
     } else {
       DestroyTimer();
     }
@@ -449,9 +589,76 @@ private:
     mTimer.reset(), Settle();
   }
 
+  // Posts: plain (inKind 0), coalesced (1) under the type's key or a caller key, cancellable (2) under one of two
+  // tokens, and idle-time (3), to a station. A coalesced post takes the place of one waiting under the same key.
+  void Post(int inNode, int inKind, bool inHelper) {
+    static const char* const kKinds[] = {" post%d@%d", " coalesce%d@%d", " cancellable%d@%d", " idle%d@%d"};
+    const int number = mPostNumber++, key = inKind == 2 ? Pick(2) : inKind == 1 ? Pick(3) - 1 : 0;
+    Note(kKinds[inKind], number, inNode), Note(inHelper ? "h#%d" : "#%d", key);
+    std::vector<Queued>& queue = mPosts[inKind == 3];
+    const auto same = std::find_if(queue.begin(), queue.end(), [&](const Queued& inPost) { return inKind == 1 && inPost.mKind == 1 && inPost.mNode == inNode && inPost.mKey == key; });
+    if (same != queue.end()) same->mNumber = number;
+    else if (inKind != 2 || !mCancelled[key]) queue.push_back(Queued{number, inNode, inKind, key});
+    OnThread(inHelper, [&] {
+      const ImmutableString& id = mIDs[inNode];
+      switch (inKind) {
+        case 0: return Utils::PostMessageToUIThread(id, Posted(number), true);
+        case 1: return key < 0 ? Utils::PostCoalescedMessageToUIThread(id, Posted(number)) : Utils::PostCoalescedMessageToUIThread(id, Posted(number), key);
+        case 2: return Utils::PostMessageToUIThread(id, Posted(number), mTokens[key]);
+        default: return Utils::PostMessageAtIdleTime(id, Posted(number));
+      }
+    });
+  }
+
+  // A token cancelled drops its posts, and every later one; now and then it is replaced by a new token.
+  void Cancel(int inToken, bool inHelper) {
+    Note(inHelper ? " cancel#%dh" : " cancel#%d", inToken);
+    mPosts[0].erase(std::remove_if(mPosts[0].begin(), mPosts[0].end(), [&](const Queued& inPost) { return inPost.mKind == 2 && inPost.mKey == inToken; }), mPosts[0].end());
+    mCancelled[inToken] = true;
+    OnThread(inHelper, [&] { mTokens[inToken].Cancel(); });
+    if (Pick(2) == 0) mTokens[inToken] = Tarn::PostCancelToken(), mCancelled[inToken] = false;
+  }
+
+  // What a main thread does for workers: runs the pending calls (the posts), deletes the stations they disposed of.
+  void Flush() {
+    Note(" flush");
+    RunPosts(&mPosts[0], [this] { Utils::FlushPostedMessagesOnUIThread(), mMain ? Drain() : void(); });
+  }
+
+  // inRun delivers the posts of ioDue (none if null), in order: each to every listener of its station, and of the
+  // stations relaying it, as the model has them now, unless a Terminate drops them.
+  template <class Deliver>
+  void RunPosts(std::vector<Queued>* ioDue, Deliver inRun) {
+    PostRun run;
+    if (ioDue != nullptr) run.mPosts = std::exchange(*ioDue, {});
+    for (const Queued& post : run.mPosts)
+      for (int slot = 0; slot < kSlots; ++slot) run.mExpected.push_back(Count(post.mNode, slot));
+    run.mHeard.assign(run.mExpected.size(), 0);
+    const PostRun outer = std::exchange(mRun, run);
+    inRun();
+    for (std::size_t at = 0; at < mRun.mHeard.size() && !mRun.mTerminated && mFailure.empty(); ++at)
+      if (mRun.mHeard[at] != mRun.mExpected[at])
+        Fail("post " + std::to_string(mRun.mPosts[at / kSlots].mNumber) + " heard " + std::to_string(mRun.mHeard[at]) + " times by slot " + std::to_string(at % kSlots) + "; the model expects " + std::to_string(mRun.mExpected[at]));
+    mRun = outer;
+  }
+
+  // How often a broadcast on inNode now reaches inSlot with a post (subscriptions take pings only). A relay
+  // relays while it lives, registered or not.
+  int Count(int inNode, int inSlot, bool inRelay = false) {
+    if (!mMain || !(inRelay || Reach(inNode)) || !mNodes[inNode].mBroadcasting) return 0;
+    int count = 0;
+    for (const Entry& entry : mNodes[inNode].mEntries) {
+      const Object& object = mObjects[inSlot];
+      if (entry.mWho == inSlot) count += entry.mWay == kPlain ? object.mListening : entry.mWay != kSub && object.mAlive;
+      if (entry.mWho >= kSlots && entry.mWho < kTimer) count += Count(entry.mWho - kSlots, inSlot, true);
+    }
+    return count;
+  }
+
   void Terminate() {
     DestroyTimer();
     Note(" terminate");
+    mPosts[0].clear(), mPosts[1].clear(), mRun.mTerminated = true;
     for (int node = 1; node < kNodes; ++node) Doom(node);
     mMain = false, Tarn::Messaging::Terminate(), Settle();
   }
@@ -488,7 +695,7 @@ private:
   void Die(int inSlot) {
     mObjects[inSlot].mAlive = false;
     for (int node = 0; node < kNodes; ++node)
-      mObjects[inSlot].mLinks[node] = 0, Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && inEntry.mWay == kPlain; });
+      mObjects[inSlot].mLinks[node] = 0, Erase(mNodes[node].mEntries, [&](const Entry& inEntry) { return inEntry.mWho == inSlot && (inEntry.mWay == kPlain || inEntry.mWay == kSub); });
   }
 
   void Doom(int inNode) {
@@ -504,7 +711,7 @@ private:
 
   // A station deleted: it leaves the broadcasters it relays, its listeners lose it.
   void Delete(int inNode) {
-    mNodes[inNode] = Node();
+    mNodes[inNode] = Node(), ++mLives[inNode];
     for (Object& object : mObjects) object.mLinks[inNode] = 0;
     for (Node& node : mNodes) Erase(node.mEntries, [&](const Entry& inEntry) { return inEntry.mWho == kSlots + inNode; });
   }
@@ -565,10 +772,11 @@ private:
     for (int slot = 0; slot < kSlots; ++slot) {
       Object& object = mObjects[slot];
       if (object.mKind >= 0 && object.mDestroyed == object.mAlive) Fail("slot " + std::to_string(slot) + " lives against the model");
-      for (int node = 0; node < kNodes && object.mOwned && object.mListener != nullptr; ++node) {
+      Tarn::Listener* listener = mHandles[slot].mListener;
+      for (int node = 0; node < kNodes && object.mOwned && listener != nullptr; ++node) {
         Tarn::Broadcaster* broadcaster = node == 0 ? &mB0 : mStations[node];
-        if (broadcaster != nullptr && (broadcaster->HasListener(object.mListener) != HasEntry(node, slot, kPlain) ||
-                                       object.mListener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0)))
+        if (broadcaster != nullptr && (broadcaster->HasListener(listener) != HasEntry(node, slot, kPlain) ||
+                                       listener->HasBroadcaster(broadcaster) != (object.mLinks[node] > 0)))
           Fail("registration or back-link of slot " + std::to_string(slot) + " at " + std::to_string(node));
       }
     }
@@ -587,6 +795,44 @@ private:
   // release it (0: none).
   struct Level { std::size_t mBase; int mRetained; };
   std::vector<Level> mLevels;  // per broadcast begun by the harness
+  int mLives[kNodes] = {};  // stations of the node deleted so far
+  std::vector<Queued> mPosts[2];  // waiting for the next run of pending calls, and for the next idle broadcast
+  // The run of posts in progress: the posts, the one delivered last, and per post and slot the calls heard and due.
+  struct PostRun {
+    std::vector<Queued> mPosts;
+    std::size_t mAt = 0;
+    std::vector<int> mHeard, mExpected;
+    bool mTerminated = false;
+  } mRun;
+  int mPostNumber = 1;
+  Tarn::PostCancelToken mTokens[2];
+  bool mCancelled[2] = {};
+  // The model, as an operation whose call throws std::bad_alloc must leave it.
+  struct Snapshot {
+    std::vector<Node> mNodes;
+    std::vector<Object> mObjects;
+    std::vector<Frame> mFrames;
+    std::vector<Level> mLevels;
+    std::vector<int> mLives;
+    bool mTimerListening = false;
+    std::vector<Queued> mPosts[2];
+    bool mCancelled[2] = {};
+  };
+  Snapshot Save() const {
+    return Snapshot{{std::begin(mNodes), std::end(mNodes)}, {std::begin(mObjects), std::end(mObjects)}, mFrames, mLevels,
+                    {std::begin(mLives), std::end(mLives)}, mTimerListening, {mPosts[0], mPosts[1]}, {mCancelled[0], mCancelled[1]}};
+  }
+  void Restore(const Snapshot& inSnapshot) {
+    std::copy(inSnapshot.mNodes.begin(), inSnapshot.mNodes.end(), mNodes);
+    std::copy(inSnapshot.mObjects.begin(), inSnapshot.mObjects.end(), mObjects);
+    std::copy(inSnapshot.mLives.begin(), inSnapshot.mLives.end(), mLives);
+    mFrames = inSnapshot.mFrames, mLevels = inSnapshot.mLevels, mTimerListening = inSnapshot.mTimerListening;
+    mPosts[0] = inSnapshot.mPosts[0], mPosts[1] = inSnapshot.mPosts[1];
+    std::copy(std::begin(inSnapshot.mCancelled), std::end(inSnapshot.mCancelled), mCancelled);
+  }
+  int mFailAt = -1;      // the allocation failure the current operation drew: see OnThread; -1: none
+  bool mThrew = false;   // the current operation's library call threw std::bad_alloc
+  Handles mHandles[kSlots];
   bool mStale = false;         // the library runs the innermost broadcast past the last call the model walked to
   int mToken = 1, mHandlerActions = 0;
   bool mMain = true, mTimerListening = false;  // mMain: the library is initialized (this thread is its main thread)
@@ -594,7 +840,7 @@ private:
   Tarn::Broadcaster mB0;  // last: its listeners are gone before it
 };
 
-inline void Called(int inSlot) { sHarness->OnCall(inSlot); }
+inline void Called(int inSlot, int inPost) { inPost > 0 ? sHarness->OnPosted(inSlot, inPost) : sHarness->OnCall(inSlot); }
 inline void Destroyed(int inSlot) { sHarness != nullptr ? sHarness->OnDestroyed(inSlot) : void(); }
 inline void StationLife(int inNode, Tarn::Station* inStation) {
   if (inNode >= 0 && sHarness != nullptr) sHarness->OnStation(inNode, inStation);
@@ -606,69 +852,89 @@ inline std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator:
 // One sequence of at most inSteps operations; returns the failure, or an empty string.
 inline std::string RunSequence(Choices& ioChoices, int inSteps) {
   const std::size_t baseline = BlocksInUse();
-  const std::string failure = [&] {
-    Harness harness(ioChoices);
-    harness.Run(inSteps);
-    return harness.Finish();
-  }();
+  const std::string failure = Harness(ioChoices).Run(inSteps);
   return failure.empty() && BlocksInUse() != baseline ? "small blocks leaked" : failure;
 }
 
-// For RunConcurrent: a call after the listener's removal returned is a fault.
+// For RunConcurrent: a call after the listener's removal returned is a fault. A drainer deletes, from its handler,
+// the stations workers let go, perhaps the relay it is called through.
 // Destroyed on the worker while the main thread may be delivering to it, so it detaches while still whole, as the
 // listener contract asks of such a class.
 struct Watcher : Tarn::Listener {
+  explicit Watcher(bool inDrains = false) : mDrains(inDrains) {}
   ~Watcher() override { DetachFromBroadcasters(); }
-  void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0; }
+  void ListenToMessage(const Tarn::Message&) override { sLateCalls += mRemoved ? 1 : 0, ++mCalls, mDrains ? Drain() : void(); }
   std::atomic<bool> mRemoved{false};
+  std::atomic<int> mCalls{0};
+  const bool mDrains;
   static inline std::atomic<int> sLateCalls{0};
 };
 
-// A worker tears down while the main thread broadcasts. Each round the worker makes a station, attaches it as a
-// relay to a broadcaster the main thread broadcasts on, gives it a listener (which also hears a well-known station),
-// removes or destroys the listener, and lets the station go by disposal and last release. Meanwhile the main thread
-// broadcasts on both, drains, and now and then disposes of the well-known station and registers it again.
-// Returns the failure, or an empty string.
+// Two workers tear down while the main thread broadcasts. Each round a worker makes a station, attaches it as a
+// relay to a broadcaster the main thread broadcasts on, gives it the drainer and a listener (which also hears a
+// well-known station), removes or destroys the listener, and lets the station go by disposal and last release, in
+// either order. Meanwhile the main thread broadcasts on both, drains, and now and then disposes of the well-known
+// station and registers it again. Then a worker adds, posts to and removes listeners of the well-known station while
+// the main thread makes the last Terminate and initializes again, over and over. Returns the failure, or "".
 inline std::string RunConcurrent(int inRounds, std::uint32_t inSeed) {
   const std::size_t baseline = BlocksInUse();
   const int lateCalls = Watcher::sLateCalls;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+  auto check = [&] { std::chrono::steady_clock::now() > deadline ? std::fprintf(stderr, "operations harness: a worker hangs\n"), std::abort() : void(); };
+  std::string failure;
   Tarn::Messaging::Initialize();
   {
     Tarn::Broadcaster parent;
-    std::atomic<bool> done{false};
-    auto worker = std::async(std::launch::async, [&] {
-      std::minstd_rand random(inSeed);
+    Watcher drainer(true);
+    std::atomic<int> working{2};
+    auto tearDown = [&](std::uint32_t inWorkerSeed) {
+      std::minstd_rand random(inWorkerSeed);
       for (int round = 0; round < inRounds; ++round) {
         const ImmutableString id = Registry::UniqueStationID();
         Registry::RegisterStation(id, &MakeCounted);
-        parent.AddListener(Registry::RetainStation(id));
+        Tarn::Station* station = Registry::RetainStation(id);
+        parent.AddListener(station), station->AddListener(&drainer);
         auto watcher = std::make_unique<Watcher>();
-        for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::AddListener(*station, watcher.get());
+        for (const ImmutableString* id : {&id, &Tarn::kStation_StatusBar}) Utils::AddListener(*id, watcher.get());
         if (random() % 2 == 0) {
-          for (const ImmutableString* station : {&id, &Tarn::kStation_StatusBar}) Utils::RemoveListener(*station, watcher.get());
+          for (const ImmutableString* id : {&id, &Tarn::kStation_StatusBar}) Utils::RemoveListener(*id, watcher.get());
           watcher->mRemoved = true;
         }
         if (random() % 2 == 0) watcher.reset();  // destroyed while attached, or once removed
-        Registry::DisposeStation(id);
-        Registry::ReleaseStation(id);  // the last: the station goes while the main thread may be relaying through it
+        // The last release deletes the station, or the main thread does once it was queued: while it may be relaying.
+        random() % 2 == 0 ? (Registry::DisposeStation(id), Registry::ReleaseStation(id)) : (Registry::ReleaseStation(id), Registry::DisposeStation(id));
       }
-      done = true;
-    });
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
-    for (int round = 0; !done; ++round) {
+      --working;
+    };
+    auto first = std::async(std::launch::async, tearDown, inSeed), second = std::async(std::launch::async, tearDown, inSeed + 1);
+    for (int round = 0; working > 0; ++round, check()) {
       parent.BroadcastMessage(Ping());
       Utils::BroadcastMessage(Tarn::kStation_StatusBar, Ping());
       Drain();
       if (round % 16 == 0) Registry::DisposeStation(Tarn::kStation_StatusBar), Registry::RegisterStation(Tarn::kStation_StatusBar, nullptr);
-      if (std::chrono::steady_clock::now() > deadline) std::fprintf(stderr, "operations harness: the worker hangs\n"), std::abort();
     }
-    worker.get();
+    first.get(), second.get();
     Drain();
+    if (parent.HasListeners()) failure = "a deleted relay is still attached";
+    if (drainer.mCalls == 0) failure = "no broadcast went through a relay";
   }
+  std::atomic<bool> done{false};
+  auto worker = std::async(std::launch::async, [&] {
+    for (int round = 0; round < inRounds; ++round) {
+      Watcher watcher;
+      Utils::AddListener(Tarn::kStation_StatusBar, &watcher);
+      Utils::PostMessageToUIThread(Tarn::kStation_StatusBar, Ping(), true);
+      Utils::RemoveListener(Tarn::kStation_StatusBar, &watcher);
+      watcher.mRemoved = true;
+    }
+    done = true;
+  });
+  for (; !done; check()) Utils::BroadcastMessage(Tarn::kStation_StatusBar, Ping()), Drain(), Tarn::Messaging::Terminate(), Tarn::Messaging::Initialize();
+  worker.get();
   Tarn::Messaging::Terminate();
   if (Watcher::sLateCalls != lateCalls) return "a listener was called after its removal returned";
   if (sLiveStations != 0) return "stations outlived Terminate";
-  return BlocksInUse() != baseline ? "small blocks leaked" : "";
+  return !failure.empty() ? failure : BlocksInUse() != baseline ? "small blocks leaked" : "";
 }
 
 }  // namespace operations_harness

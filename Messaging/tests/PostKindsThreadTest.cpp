@@ -1,6 +1,7 @@
-// Coalesced, cancellable and idle-time posts: each kind against a model on
-// seeded sequences, what handlers do to their own post, and the races of
-// workers posting while the main thread drains and tokens are cancelled.
+// Coalesced, cancellable and idle-time posts: what handlers do to their own
+// post, and the races of workers posting while the main thread drains and
+// tokens are cancelled. Each kind against a model on seeded sequences: the
+// operations harness (OperationsHarness.h).
 #include "TestSupport.h"
 
 #include <TarnMessaging.h>
@@ -20,88 +21,9 @@ using Tarn::kStation_StatusBar;
 std::size_t BlocksInUse() { return kivcore::utility::SmallBlockAllocator::GetStatistics().blocksInUse; }
 int ValueOf(const Tarn::Message& inMessage) { return inMessage.Is<NumberMessage>() ? inMessage.As<NumberMessage>()->mValue : -1; }
 
-enum Kind { kPlain, kCoalesced, kCancellable, kIdleTime };
-struct Post { int mValue, mStation, mKind, mKey; };  // mKey: the coalescing key (-1: the type's) or the token
-
 // Initialize on the constructing thread, which becomes the main thread. The
 // listeners of a test, made after it, detach themselves as they go.
 struct Library { Library() { Tarn::Messaging::Initialize(); } ~Library() { Tarn::Messaging::Terminate(); } };
-
-// Seeded random sequences of posts of every kind (plain, coalesced under a
-// type or a caller key, cancellable under one of two tokens, idle-time), made
-// on the main thread or a worker, mixed with cancels on either thread,
-// flushes, idle broadcasts on a stopped or running idle station, and restarts
-// of the library; checked after every step against a model of what each
-// listener has heard and of how many copies are still alive.
-TEST(PostKindsThreadTest, EveryKindOfPostDeliversAndFreesWhatAModelSaysOnSeededSequences) {
-  const ImmutableString* stations[] = {&Tarn::kStation_StatusBar, &Tarn::kStation_Repeat, &Tarn::kStation_Idle};
-  const std::size_t before = BlocksInUse();
-  for (unsigned seed = 1; seed <= 40; ++seed) {
-    std::mt19937 random(seed);
-    const auto pick = [&random](int inBound) { return std::uniform_int_distribution<int>(0, inBound - 1)(random); };
-    CallLog log;
-    RecordingListener listeners[] = {RecordingListener("s0", &log), RecordingListener("s1", &log), RecordingListener("idle", &log)};
-    std::size_t base = 0;
-    const auto start = [&] {
-      Tarn::Messaging::Initialize();
-      for (int s = 0; s < 3; ++s) AddListener(*stations[s], &listeners[s]);
-      base = BlocksInUse();
-    };
-    start();
-    std::vector<Post> queued, idle;
-    std::vector<std::string> heard;
-    Tarn::PostCancelToken tokens[2];
-    bool cancelled[2] = {false, false}, idleStopped = false;
-    const auto hear = [&](const Post& inPost) { heard.push_back("s" + std::to_string(inPost.mStation) + ":" + std::to_string(inPost.mValue)); };
-    const auto onSomeThread = [&](const std::function<void()>& inCall) { pick(2) == 0 ? inCall() : std::thread(inCall).join(); };
-    for (int step = 0; step < 120; ++step) {
-      const int kind = pick(4), key = pick(3) - 1, token = pick(2);
-      const Post post{step, pick(2), kind, kind == kCancellable ? token : key};
-      const NumberMessage message(step);  // posted to *stations[post.mStation]
-      const ImmutableString& station = *stations[post.mStation];
-      const std::function<void()> posts[] = {
-          [&] { PostMessageToUIThread(station, message, true); },
-          [&] { key < 0 ? PostCoalescedMessageToUIThread(station, message) : PostCoalescedMessageToUIThread(station, message, static_cast<std::uint64_t>(key)); },
-          [&] { PostMessageToUIThread(station, message, tokens[token]); },
-          [&] { PostMessageAtIdleTime(station, message); }};
-      const auto same = std::find_if(queued.begin(), queued.end(), [&](const Post& inQueued) { return kind == kCoalesced && inQueued.mKind == kind && inQueued.mStation == post.mStation && inQueued.mKey == key; });
-      switch (pick(9)) {
-        case 0: case 1: case 2: case 3:
-          onSomeThread(posts[kind]);
-          if (same != queued.end()) same->mValue = step;
-          else if (kind == kIdleTime) idle.push_back(post);
-          else if (kind != kCancellable || !cancelled[token]) queued.push_back(post);
-          break;
-        case 4:
-          onSomeThread([&] { tokens[token].Cancel(); });
-          cancelled[token] = true;
-          queued.erase(std::remove_if(queued.begin(), queued.end(), [token](const Post& inQueued) { return inQueued.mKind == kCancellable && inQueued.mKey == token; }), queued.end());
-          if (pick(2) == 0) tokens[token] = Tarn::PostCancelToken(), cancelled[token] = false;
-          break;
-        case 5:
-          FlushPostedMessagesOnUIThread(), std::for_each(queued.begin(), queued.end(), hear), queued.clear();
-          break;
-        case 6:
-          BroadcastMessage(Tarn::kStation_Idle, PingMessage());
-          if (!idleStopped) std::for_each(idle.begin(), idle.end(), hear), idle.clear(), heard.push_back("idle:ping");
-          break;
-        case 7:
-          (idleStopped = !idleStopped) ? StopBroadcasting(Tarn::kStation_Idle) : StartBroadcasting(Tarn::kStation_Idle);
-          break;
-        case 8:
-          if (pick(4) != 0) break;
-          Tarn::Messaging::Terminate();  // the queued posts find no station; the idle-time ones are dropped
-          ASSERT_EQ(before, BlocksInUse()) << "seed " << seed << " step " << step << ": a copy outlived Terminate";
-          queued.clear(), idle.clear(), idleStopped = false, start();
-          break;
-      }
-      ASSERT_EQ(heard, log.Entries()) << "seed " << seed << " step " << step;
-      ASSERT_EQ(base + queued.size() + idle.size(), BlocksInUse()) << "seed " << seed << " step " << step << ": copies alive";
-    }
-    Tarn::Messaging::Terminate();
-    ASSERT_EQ(before, BlocksInUse()) << "seed " << seed;
-  }
-}
 
 // What handlers do to the post being delivered: a coalesced post of the same
 // key is queued anew (not merged into the delivery under way, and not lost);

@@ -107,4 +107,15 @@ TEST_F(StationTest, AStationWhoseIDWasRegisteredAnewWithAFailingFactoryIsDeleted
   EXPECT_EQ(failures.Messages(), std::vector<std::string>{"factory"});
 }
 
+// A station a worker disposed of waits for a main-thread disposal; the last
+// Terminate once left it alive, with its listeners, into the next life.
+TEST_F(StationTest, AStationAWorkerDisposedOfGoesWithTheLastTerminate) {
+  Tarn::Messaging::Initialize();
+  const ImmutableString id = MakeCounted();
+  RunOnWorker([&] { Registry::DisposeStation(id); });
+  EXPECT_EQ(StationLog::Destructions(), 0);
+  Tarn::Messaging::Terminate();
+  EXPECT_EQ(StationLog::Destructions(), 1) << "a station a worker disposed of outlived the last Terminate";
+}
+
 }  // namespace
