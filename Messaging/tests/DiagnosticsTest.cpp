@@ -206,7 +206,8 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
   EXPECT_EQ(listener.Calls(), 1);
 
   // A posted "quit" ends the library: the delivery's own hold on the station
-  // is not the host's to balance.
+  // is not the host's to balance, nor is a station made and let go.
+  EXPECT_FALSE(Utils::HasListeners(Tarn::kStation_Repeat));
   Utils::RetainStation(station);
   listener.SetAction([](const Tarn::Message&) { Tarn::Messaging::Terminate(); });
   Utils::PostMessageToUIThread(station, messaging_test::PingMessage(), true);
