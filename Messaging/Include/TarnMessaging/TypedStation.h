@@ -66,7 +66,8 @@ private:
 };
 
 namespace Detail {
-// The check every typed call makes; one place for its wording.
+/// The compile-time check every typed call makes: T is a message type naming
+/// itself, and one of Ts. One place for the wording of both refusals.
 template <class T, class... Ts>
 constexpr void RequireCarried() noexcept {
   static_assert(IsMessageType<T>::value, TARN_MESSAGE_TYPE_REQUIRED);
