@@ -1,5 +1,6 @@
 // Wire-enabled message types shared by the remote suites, their child
-// program and the decoder's fuzz target.
+// program and the decoder's fuzz target, and a bounded run of the main
+// thread's pending calls.
 #pragma once
 
 #include <TarnMessaging/MessageImpl.h>
@@ -31,5 +32,28 @@ struct Tick : Tarn::MessageImpl<Tick> {
   std::int32_t mSender = 0;
 };
 TARN_WIRE_MESSAGE(Tick, "test.tick", 1, mNumber, mSender)
+
+}  // namespace remote_test
+
+#include <TarnMessaging/StationUtils.h>
+
+#include <kivcore/MainThread.h>
+
+#include <chrono>
+
+namespace remote_test {
+
+// Runs the main thread's pending calls, where imported messages are
+// delivered, until inDone() holds or inTimeout passes; whether it held.
+template <class Predicate>
+bool PumpUntil(Predicate inDone, std::chrono::milliseconds inTimeout = std::chrono::seconds(10)) {
+  const auto deadline = std::chrono::steady_clock::now() + inTimeout;
+  const auto adaptor = kivcore::threads::GetRegisteredMainThread();
+  while (!inDone()) {
+    if (std::chrono::steady_clock::now() >= deadline || adaptor == nullptr) return inDone();
+    if (adaptor->WaitForPendingCalls(10)) Tarn::StationUtils::FlushPostedMessagesOnUIThread();
+  }
+  return true;
+}
 
 }  // namespace remote_test

@@ -1,0 +1,177 @@
+/// @file
+/// Tarn::Remote::Node: a process's end of stations shared with other
+/// processes. A node exports stations (what is broadcast on them goes to the
+/// processes that import them) and imports stations of other nodes (what
+/// their processes broadcast is broadcast here too, on the main thread).
+///
+/// @code{.cpp}
+///   // The host process:
+///   Tarn::Remote::Node node(Tarn::Remote::NodeOptions("host"));
+///   node.Export(kStation_Jobs);                          // its endpoint: node.GetEndpoint()
+///   // A plug-in process:
+///   Tarn::Remote::Node plugin(Tarn::Remote::NodeOptions("plugin"));
+///   plugin.Import(kStation_Jobs, Tarn::Remote::Node::DefaultEndpoint("host"));
+///   Tarn::Registration r = Tarn::Subscribe<Progress>(kStation_Jobs, [](const Progress& inProgress) { ... });
+/// @endcode
+///
+/// Only wire-enabled message types travel (WireMessage.h); a node ignores
+/// the others. A station may be exported by one node and imported by it
+/// from another at once (two-way): a message a node delivers from an import
+/// is not exported again, so nothing echoes back to where it came from.
+///
+/// Guarantees, per origin (a sending node) and station: messages arrive in
+/// the order they were broadcast, each at most once. Every loss is detected
+/// by sequence numbers and reported on the station as a RemoteLoss with the
+/// number lost, before the next message that arrives: a message dropped by
+/// the exporter's queue or by a socket's high-water mark, and a message
+/// refused by the decoder (unknown wire name or version, malformed). The
+/// first message heard from an origin starts its count: what it broadcast
+/// before the import was connected is not reported. Not guaranteed: delivery
+/// of what is broadcast before an importer is connected (wait for an
+/// ImportersChanged on the exporting side), and order between origins.
+///
+/// Endpoints: by default a node publishes on an ipc:// endpoint named after
+/// it, in a directory that only this user may enter (mode 0700, owned by
+/// the user): $XDG_RUNTIME_DIR/tarn-remote, or /tmp/tarn-remote-UID without
+/// one. A directory of another owner or mode is refused.
+///
+/// Threading: one I/O thread per node owns every socket; sockets are never
+/// touched by another thread. Export, Import, GetStats and the accessors may
+/// be called from any thread. A broadcast on an exported station (on the
+/// main thread, as every broadcast) encodes the message and hands it to the
+/// I/O thread through a bounded queue; it never blocks on the I/O thread or
+/// the network: when the queue is full the message is dropped and counted
+/// (NodeStats::mExportDropped), and importers report the gap. Imported
+/// messages, ImportersChanged and RemoteLoss reports are handed to the main
+/// thread's queue of pending calls (kivcore's AsyncCallFromMainThread) and
+/// broadcast on the station there, so handlers run on the importer's main
+/// thread, through whatever event-loop integration runs that queue.
+///
+/// Ownership and lifetime: the node owns its sockets, its thread and the
+/// listeners it attaches to exported stations. The destructor detaches those
+/// listeners (waiting, off the main thread, as RemoveListener does), sends
+/// what the export queue holds, waits up to NodeOptions::mLingerMilliseconds
+/// for it to leave, and joins the I/O thread. Imported messages already
+/// handed to the main thread are still delivered after the node is gone.
+#pragma once
+
+#include <TarnMessaging/MessageImpl.h>
+#include <TarnMessaging/Remote/Export.h>
+#include <TarnMessaging/Remote/WireCodec.h>
+
+#include <kivcore/ImmutableString.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <utility>
+
+namespace Tarn::Remote {
+
+/// How a node is set up. Every field has a usable default.
+struct NodeOptions {
+  NodeOptions() = default;
+  /// Options with mName set and every other field at its default.
+  explicit NodeOptions(std::string inName) : mName(std::move(inName)) {}
+
+  /// Names the node's default endpoint (DefaultEndpoint); letters, digits,
+  /// '-', '_' and '.' only. Empty: "tarn-" and the process ID.
+  std::string mName;
+  /// Where exported stations are published; empty: DefaultEndpoint(mName).
+  /// "ipc://PATH" or "tcp://HOST:PORT".
+  std::string mEndpoint;
+  /// Encoded messages waiting for the I/O thread; more are dropped.
+  std::size_t mQueueCapacity = 4096;
+  /// Messages a socket holds for one peer before it drops (ZeroMQ's
+  /// high-water marks): per importer when sending, per exporter when receiving.
+  /// @{
+  int mSendHighWaterMark = 10000;
+  int mReceiveHighWaterMark = 10000;
+  /// @}
+  /// How long the destructor waits for queued messages to leave.
+  int mLingerMilliseconds = 200;
+  /// The codec of this node's messages; null: MakeMsgPackCodec().
+  std::shared_ptr<const WireCodec> mCodec;
+};
+
+/// A node's counters since it was made; each is read on its own (relaxed).
+struct NodeStats {
+  std::uint64_t mExported = 0;        ///< messages handed to the socket
+  std::uint64_t mExportDropped = 0;   ///< dropped because the export queue was full
+  std::uint64_t mImported = 0;        ///< messages decoded and handed to the main thread
+  std::uint64_t mLost = 0;            ///< messages of other nodes found missing by sequence number
+  std::uint64_t mUnknown = 0;         ///< refused: unknown wire name or version
+  std::uint64_t mMalformed = 0;       ///< refused: bytes that are not a message
+  std::uint64_t mDuplicates = 0;      ///< dropped: a sequence number already seen
+  std::uint64_t mImportErrors = 0;    ///< imports whose endpoint could not be connected
+};
+
+/// Reported on a station for every loss an importing node detects, before
+/// the next message of that origin.
+struct RemoteLoss : MessageImpl<RemoteLoss> {
+  enum class Reason : std::int32_t {
+    kGap,             ///< sequence numbers skipped: lost on the way (a queue or a high-water mark)
+    kUnknownType,     ///< a wire name not registered here (mWireName)
+    kUnknownVersion,  ///< a version of mWireName other than this process's
+    kMalformed,       ///< bytes that are not a message
+  };
+  Reason mReason = Reason::kGap;
+  std::uint64_t mOrigin = 0;  ///< the sending node; 0 when not even the envelope could be read
+  std::uint64_t mCount = 0;   ///< messages lost
+  std::string mWireName;      ///< for kUnknownType and kUnknownVersion
+};
+
+/// Broadcast on an exported station, on the exporting node's main thread,
+/// when the number of importers subscribed to it changes.
+struct ImportersChanged : MessageImpl<ImportersChanged> {
+  std::uint32_t mImporters = 0;
+};
+
+/// One process's end of stations shared with other processes; see the file
+/// comment. Not copyable.
+class TARN_REMOTE_API Node {
+public:
+  /// Starts the I/O thread and binds the node's endpoint. Throws
+  /// std::runtime_error naming the endpoint when it cannot be bound, or when
+  /// the default endpoint's directory is unsafe; nothing is left running then.
+  explicit Node(NodeOptions inOptions = NodeOptions());
+  /// See Ownership and lifetime above.
+  ~Node();
+  Node(const Node&) = delete;
+  Node& operator=(const Node&) = delete;
+
+  /// Exports the station: what is broadcast on it from now on goes to its
+  /// importers. Exporting a station again does nothing. A station ID that is
+  /// not registered is reported as StationUtils::AddListener reports it.
+  /// Precondition: !inStationID.empty().
+  void Export(const kivcore::utility::ImmutableString& inStationID);
+
+  /// Imports the station from the node publishing at inEndpoint: what that
+  /// node's process broadcasts on it is broadcast here on the main thread.
+  /// Returns at once; the I/O thread connects (and reconnects) on its own.
+  /// Importing the same station from the same endpoint again does nothing.
+  /// Preconditions: !inStationID.empty(), inEndpoint starts with "ipc://" or
+  /// "tcp://".
+  void Import(const kivcore::utility::ImmutableString& inStationID, const std::string& inEndpoint);
+
+  /// The endpoint exported stations are published on, for importers.
+  const std::string& GetEndpoint() const noexcept;
+  /// This node's origin ID: random, never 0, different for every node.
+  std::uint64_t GetOrigin() const noexcept;
+  /// The node's counters now.
+  NodeStats GetStats() const noexcept;
+
+  /// "ipc://" and the path of inName in the private endpoint directory
+  /// (see Endpoints above), which is made if missing. Throws
+  /// std::runtime_error when the directory cannot be made or is not private,
+  /// or when the path is too long for a socket address.
+  /// Precondition: inName is a valid NodeOptions::mName and not empty.
+  static std::string DefaultEndpoint(const std::string& inName);
+
+private:
+  class Impl;
+  std::unique_ptr<Impl> mImpl;
+};
+
+}  // namespace Tarn::Remote

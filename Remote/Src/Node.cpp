@@ -1,0 +1,517 @@
+// Tarn::Remote::Node: exports through a bounded queue to one I/O thread that
+// owns every socket; imports decoded there and broadcast on the main thread.
+#include <TarnMessaging/Remote/Node.h>
+
+#include "Endpoint.h"
+#include "RemoteContract.h"
+
+#include <TarnMessaging/Listener.h>
+#include <TarnMessaging/StationUtils.h>
+
+#include <kivcore/MainThread.h>
+
+#include <zmq.hpp>
+
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <deque>
+#include <future>
+#include <map>
+#include <mutex>
+#include <random>
+#include <set>
+#include <stdexcept>
+#include <thread>
+#include <utility>
+#include <vector>
+
+namespace Tarn::Remote {
+
+using kivcore::utility::ImmutableString;
+
+namespace {
+
+// A station's topic on the wire: its ID and a terminating NUL, so that the
+// publisher's prefix filter cannot match "jobs" to "jobs.done".
+std::string TopicOf(const ImmutableString& inStationID) {
+  std::string topic(inStationID.c_str(), inStationID.size());
+  topic.push_back('\0');
+  return topic;
+}
+
+// Sequence counts kept per (origin, station) before the oldest are
+// forgotten: a bound on what restarting peers cost an importer. A forgotten
+// origin starts its count again with its next message.
+constexpr std::size_t kMaxTrackedOrigins = 4096;
+
+std::uint64_t NewOrigin() {
+  std::random_device device;
+  std::uint64_t origin = 0;
+  while (origin == 0) {
+    origin = (static_cast<std::uint64_t>(device()) << 32) ^ device() ^
+             static_cast<std::uint64_t>(::getpid()) ^
+             static_cast<std::uint64_t>(std::chrono::steady_clock::now().time_since_epoch().count());
+  }
+  return origin;
+}
+
+}  // namespace
+
+class Node::Impl {
+public:
+  explicit Impl(NodeOptions inOptions);
+  ~Impl();
+
+  void Export(const ImmutableString& inStationID);
+  void Import(const ImmutableString& inStationID, const std::string& inEndpoint);
+  NodeStats GetStats() const noexcept;
+
+  const std::string& Endpoint() const noexcept { return mEndpoint; }
+  std::uint64_t Origin() const noexcept { return mOrigin; }
+
+private:
+  // State that outlives the node in the calls it hands to the main thread.
+  struct MainThreadState {
+    // The imported message being broadcast by this node on the main
+    // thread, if any: the export listeners leave it alone, so that it does
+    // not go back out (two-way without echo). Main thread only.
+    const Message* mDelivering = nullptr;
+  };
+
+  // Attached to an exported station by plain pointer; hears its broadcasts
+  // on the main thread.
+  class ExportListener final : public Listener {
+  public:
+    ExportListener(Impl& ioImpl, const ImmutableString& inStationID)
+        : mImpl(ioImpl), mStationID(inStationID), mTopic(std::make_shared<const std::string>(TopicOf(inStationID))) {}
+    // Detached while whole: a broadcast on the main thread may be calling it.
+    ~ExportListener() override { DetachFromBroadcasters(); }
+    void ListenToMessage(const Message& inMessage) override { mImpl.Enqueue(*this, inMessage); }
+
+    Impl& mImpl;
+    const ImmutableString mStationID;
+    const std::shared_ptr<const std::string> mTopic;
+    std::uint64_t mSequence = 0;  // the last sequence number given; main thread only
+  };
+
+  struct Outgoing {
+    std::shared_ptr<const std::string> mTopic;
+    std::string mBytes;
+  };
+
+  struct Command {
+    enum class Kind { kExport, kImport } mKind;
+    ImmutableString mStationID;
+    std::string mEndpoint;
+  };
+
+  // One subscribing socket per endpoint imported from, with the stations
+  // it carries. I/O thread only.
+  struct ImportSocket {
+    zmq::socket_t mSocket;
+    std::map<std::string, ImmutableString> mStations;  // by topic
+  };
+
+  void Enqueue(ExportListener& ioListener, const Message& inMessage);
+  void Wake() noexcept;
+  void Run(std::promise<void>& outBound) noexcept;
+  void RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher);
+  void Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoing);
+  void Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommands);
+  void HearSubscriptions(zmq::socket_t& ioPublisher);
+  void HearImports(ImportSocket& ioImport);
+  void Receive(const ImmutableString& inStationID, const zmq::message_t& inBody);
+  void Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,
+              std::uint64_t inCount, const std::string& inWireName);
+  void Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage);
+
+  const NodeOptions mOptions;
+  const std::shared_ptr<const WireCodec> mCodec;
+  const std::uint64_t mOrigin;
+  std::string mEndpoint;  // fixed once the constructor returns
+  const std::shared_ptr<MainThreadState> mMainThreadState = std::make_shared<MainThreadState>();
+  int mWakeDescriptor = -1;  // an eventfd: written by any thread, read by the I/O thread
+
+  struct Counters {
+    std::atomic<std::uint64_t> mExported{0}, mExportDropped{0}, mImported{0}, mLost{0}, mUnknown{0},
+        mMalformed{0}, mDuplicates{0}, mImportErrors{0};
+  } mCounters;
+
+  mutable std::mutex mQueueMutex;
+  std::deque<Outgoing> mQueue;      // guarded by mQueueMutex; at most mOptions.mQueueCapacity
+  std::vector<Command> mCommands;   // guarded by mQueueMutex
+  bool mStopping = false;           // guarded by mQueueMutex
+
+  std::mutex mExportsMutex;
+  std::map<ImmutableString, std::unique_ptr<ExportListener>> mExports;  // guarded by mExportsMutex
+
+  // I/O thread only.
+  std::set<std::string> mExportedTopics;
+  std::map<std::string, std::uint32_t> mImporters;  // subscriptions per topic
+  std::map<std::string, ImportSocket> mImports;     // by endpoint
+  std::map<std::pair<std::uint64_t, std::string>, std::uint64_t> mLastSequence;  // by (origin, topic)
+
+  std::thread mThread;
+};
+
+Node::Impl::Impl(NodeOptions inOptions)
+    : mOptions(std::move(inOptions)),
+      mCodec(mOptions.mCodec != nullptr ? mOptions.mCodec : std::shared_ptr<const WireCodec>(MakeMsgPackCodec())),
+      mOrigin(NewOrigin()) {
+  const std::string name = mOptions.mName.empty() ? "tarn-" + std::to_string(::getpid()) : mOptions.mName;
+  TARN_REMOTE_CONTRACT_CHECK(IsValidNodeName(name), "Tarn::Remote::Node::Node");
+  mEndpoint = !mOptions.mEndpoint.empty() ? mOptions.mEndpoint : Node::DefaultEndpoint(name);
+  mWakeDescriptor = ::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
+  if (mWakeDescriptor < 0) throw std::runtime_error(std::string("Tarn::Remote: eventfd: ") + std::strerror(errno));
+  std::promise<void> bound;
+  std::future<void> boundResult = bound.get_future();
+  mThread = std::thread([this, &bound] { Run(bound); });
+  try {
+    boundResult.get();
+  } catch (...) {
+    mThread.join();  // the thread ends on its own when binding failed
+    ::close(mWakeDescriptor);
+    throw;
+  }
+}
+
+Node::Impl::~Impl() {
+  {
+    // No broadcast reaches the queue once the listeners are gone.
+    std::lock_guard<std::mutex> lock(mExportsMutex);
+    mExports.clear();
+  }
+  {
+    std::lock_guard<std::mutex> lock(mQueueMutex);
+    mStopping = true;
+  }
+  Wake();
+  mThread.join();
+  ::close(mWakeDescriptor);
+}
+
+void Node::Impl::Export(const ImmutableString& inStationID) {
+  TARN_REMOTE_CONTRACT_CHECK(!inStationID.empty(), "Tarn::Remote::Node::Export");
+  if (inStationID.empty()) return;
+  ExportListener* listener = nullptr;
+  {
+    std::lock_guard<std::mutex> lock(mExportsMutex);
+    std::unique_ptr<ExportListener>& slot = mExports[inStationID];
+    if (slot != nullptr) return;
+    slot = std::make_unique<ExportListener>(*this, inStationID);
+    listener = slot.get();
+  }
+  {
+    std::lock_guard<std::mutex> lock(mQueueMutex);
+    mCommands.push_back(Command{Command::Kind::kExport, inStationID, std::string()});
+  }
+  Wake();
+  // Attached outside our locks: AddListener may report an unregistered
+  // station to the host's handlers.
+  StationUtils::AddListener(inStationID, listener);
+}
+
+void Node::Impl::Import(const ImmutableString& inStationID, const std::string& inEndpoint) {
+  const bool known = inEndpoint.rfind("ipc://", 0) == 0 || inEndpoint.rfind("tcp://", 0) == 0;
+  TARN_REMOTE_CONTRACT_CHECK(!inStationID.empty(), "Tarn::Remote::Node::Import");
+  TARN_REMOTE_CONTRACT_CHECK(known, "Tarn::Remote::Node::Import");
+  if (inStationID.empty() || !known) return;
+  {
+    std::lock_guard<std::mutex> lock(mQueueMutex);
+    mCommands.push_back(Command{Command::Kind::kImport, inStationID, inEndpoint});
+  }
+  Wake();
+}
+
+NodeStats Node::Impl::GetStats() const noexcept {
+  NodeStats stats;
+  stats.mExported = mCounters.mExported.load(std::memory_order_relaxed);
+  stats.mExportDropped = mCounters.mExportDropped.load(std::memory_order_relaxed);
+  stats.mImported = mCounters.mImported.load(std::memory_order_relaxed);
+  stats.mLost = mCounters.mLost.load(std::memory_order_relaxed);
+  stats.mUnknown = mCounters.mUnknown.load(std::memory_order_relaxed);
+  stats.mMalformed = mCounters.mMalformed.load(std::memory_order_relaxed);
+  stats.mDuplicates = mCounters.mDuplicates.load(std::memory_order_relaxed);
+  stats.mImportErrors = mCounters.mImportErrors.load(std::memory_order_relaxed);
+  return stats;
+}
+
+// Main thread, inside a broadcast on the station: encode, queue, never wait.
+void Node::Impl::Enqueue(ExportListener& ioListener, const Message& inMessage) {
+  if (&inMessage == mMainThreadState->mDelivering) return;
+  const WireType* type = FindWireType(inMessage.GetMessageID());
+  if (type == nullptr) return;
+  // The number is taken before the queue may drop the message, so that
+  // importers see the drop as a gap.
+  const Envelope envelope{mOrigin, ++ioListener.mSequence};
+  Outgoing outgoing{ioListener.mTopic, std::string()};
+  try {
+    mCodec->Encode(envelope, *type, inMessage, outgoing.mBytes);
+  } catch (const std::bad_alloc&) {
+    mCounters.mExportDropped.fetch_add(1, std::memory_order_relaxed);
+    return;
+  }
+  bool wasEmpty = false;
+  {
+    std::lock_guard<std::mutex> lock(mQueueMutex);
+    if (mQueue.size() >= mOptions.mQueueCapacity) {
+      mCounters.mExportDropped.fetch_add(1, std::memory_order_relaxed);
+      return;
+    }
+    wasEmpty = mQueue.empty();
+    mQueue.push_back(std::move(outgoing));
+  }
+  // The I/O thread takes the whole queue each time it wakes, so only the
+  // first message into an empty queue needs to wake it.
+  if (wasEmpty) Wake();
+}
+
+void Node::Impl::Wake() noexcept {
+  const std::uint64_t one = 1;
+  // EAGAIN means the counter is already far from zero: the thread is awake.
+  [[maybe_unused]] const ssize_t written = ::write(mWakeDescriptor, &one, sizeof(one));
+}
+
+void Node::Impl::Run(std::promise<void>& outBound) noexcept {
+  // The context is made first and destroyed last: its destruction waits,
+  // up to each socket's linger, for what they still hold to leave.
+  zmq::context_t context(1);
+  bool announced = false;
+  try {
+    zmq::socket_t publisher(context, zmq::socket_type::xpub);
+    publisher.set(zmq::sockopt::sndhwm, mOptions.mSendHighWaterMark);
+    publisher.set(zmq::sockopt::linger, mOptions.mLingerMilliseconds);
+    // Every subscription and unsubscription comes up, one per importer, so
+    // that importers can be counted.
+    publisher.set(zmq::sockopt::xpub_verboser, 1);
+    try {
+      publisher.bind(mEndpoint);
+    } catch (const zmq::error_t& inError) {
+      announced = true;
+      outBound.set_exception(std::make_exception_ptr(
+          std::runtime_error("Tarn::Remote: cannot bind " + mEndpoint + ": " + inError.what())));
+      return;
+    }
+    outBound.set_value();
+    announced = true;
+    RunLoop(context, publisher);
+  } catch (...) {
+    // Before the bind, the constructor throws this; after it, only storage
+    // running out ends up here, and the node's thread stops.
+    if (!announced) outBound.set_exception(std::current_exception());
+  }
+  mImports.clear();
+}
+
+void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) {
+  std::vector<zmq::pollitem_t> items;
+  std::vector<ImportSocket*> polled;
+  for (;;) {
+    items.clear();
+    polled.clear();
+    items.push_back(zmq::pollitem_t{nullptr, mWakeDescriptor, ZMQ_POLLIN, 0});
+    items.push_back(zmq::pollitem_t{ioPublisher.handle(), 0, ZMQ_POLLIN, 0});
+    for (auto& [endpoint, import] : mImports) {
+      items.push_back(zmq::pollitem_t{import.mSocket.handle(), 0, ZMQ_POLLIN, 0});
+      polled.push_back(&import);
+    }
+    zmq::poll(items.data(), items.size(), std::chrono::milliseconds(-1));
+
+    if ((items[0].revents & ZMQ_POLLIN) != 0) {
+      std::uint64_t count = 0;
+      [[maybe_unused]] const ssize_t got = ::read(mWakeDescriptor, &count, sizeof(count));
+      std::deque<Outgoing> outgoing;
+      std::vector<Command> commands;
+      bool stopping = false;
+      {
+        std::lock_guard<std::mutex> lock(mQueueMutex);
+        outgoing.swap(mQueue);
+        commands.swap(mCommands);
+        stopping = mStopping;
+      }
+      Obey(ioContext, commands);
+      Send(ioPublisher, outgoing);
+      if (stopping) return;
+    }
+    if ((items[1].revents & ZMQ_POLLIN) != 0) HearSubscriptions(ioPublisher);
+    for (std::size_t i = 0; i < polled.size(); ++i) {
+      if ((items[i + 2].revents & ZMQ_POLLIN) != 0) HearImports(*polled[i]);
+    }
+  }
+}
+
+void Node::Impl::Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoing) {
+  for (Outgoing& outgoing : ioOutgoing) {
+    // A publishing socket never blocks: a peer over its high-water mark
+    // loses the message, and sees the gap.
+    ioPublisher.send(zmq::buffer(*outgoing.mTopic), zmq::send_flags::sndmore | zmq::send_flags::dontwait);
+    ioPublisher.send(zmq::buffer(outgoing.mBytes), zmq::send_flags::dontwait);
+    mCounters.mExported.fetch_add(1, std::memory_order_relaxed);
+  }
+}
+
+void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommands) {
+  for (Command& command : ioCommands) {
+    const std::string topic = TopicOf(command.mStationID);
+    if (command.mKind == Command::Kind::kExport) {
+      mExportedTopics.insert(topic);
+      continue;
+    }
+    auto found = mImports.find(command.mEndpoint);
+    if (found == mImports.end()) {
+      try {
+        zmq::socket_t socket(ioContext, zmq::socket_type::sub);
+        socket.set(zmq::sockopt::rcvhwm, mOptions.mReceiveHighWaterMark);
+        socket.set(zmq::sockopt::linger, 0);
+        socket.connect(command.mEndpoint);
+        found = mImports.emplace(command.mEndpoint, ImportSocket{std::move(socket), {}}).first;
+      } catch (const zmq::error_t&) {
+        mCounters.mImportErrors.fetch_add(1, std::memory_order_relaxed);
+        continue;
+      }
+    }
+    if (found->second.mStations.emplace(topic, command.mStationID).second) {
+      found->second.mSocket.set(zmq::sockopt::subscribe, topic);
+    }
+  }
+}
+
+void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {
+  zmq::message_t frame;
+  while (ioPublisher.recv(frame, zmq::recv_flags::dontwait)) {
+    // A subscription frame: 1 (subscribe) or 0 (unsubscribe), then the topic.
+    if (frame.size() < 2) continue;
+    const char* data = static_cast<const char*>(frame.data());
+    const std::string topic(data + 1, frame.size() - 1);
+    if (mExportedTopics.count(topic) == 0 || topic.back() != '\0') continue;
+    std::uint32_t& importers = mImporters[topic];
+    if (data[0] == 1) {
+      ++importers;
+    } else if (data[0] == 0 && importers > 0) {
+      --importers;
+    } else {
+      continue;
+    }
+    ImportersChanged changed;
+    changed.mImporters = importers;
+    Deliver(ImmutableString::CreateDynamic(std::string_view(topic.data(), topic.size() - 1)),
+            std::make_shared<const ImportersChanged>(changed));
+  }
+}
+
+void Node::Impl::HearImports(ImportSocket& ioImport) {
+  zmq::message_t topic;
+  zmq::message_t body;
+  // A batch at a time, so that one busy exporter does not starve the
+  // others or the export queue.
+  for (int batch = 0; batch < 256; ++batch) {
+    if (!ioImport.mSocket.recv(topic, zmq::recv_flags::dontwait)) return;
+    bool wellFormed = topic.more();
+    if (wellFormed) {
+      (void)ioImport.mSocket.recv(body, zmq::recv_flags::none);  // the parts of a message arrive together
+    }
+    while (body.more()) {
+      wellFormed = false;
+      (void)ioImport.mSocket.recv(body, zmq::recv_flags::none);
+    }
+    const auto station = ioImport.mStations.find(topic.to_string());
+    if (station == ioImport.mStations.end()) {
+      // Not a station imported from here: no station to report it on.
+      mCounters.mMalformed.fetch_add(1, std::memory_order_relaxed);
+      continue;
+    }
+    if (!wellFormed) {
+      mCounters.mMalformed.fetch_add(1, std::memory_order_relaxed);
+      Report(station->second, RemoteLoss::Reason::kMalformed, 0, 1, std::string());
+      continue;
+    }
+    Receive(station->second, body);
+  }
+}
+
+// I/O thread: decode, account for the sequence, hand to the main thread.
+void Node::Impl::Receive(const ImmutableString& inStationID, const zmq::message_t& inBody) {
+  Decoded decoded = mCodec->Decode(inBody.data(), inBody.size());
+  if (decoded.mHasEnvelope) {
+    const Envelope& envelope = decoded.mEnvelope;
+    if (envelope.mOrigin == mOrigin || envelope.mSequence == 0) {
+      // Our own message come back, or no sequence at all: never delivered.
+      mCounters.mDuplicates.fetch_add(1, std::memory_order_relaxed);
+      return;
+    }
+    if (mLastSequence.size() >= kMaxTrackedOrigins) mLastSequence.clear();
+    std::uint64_t& last = mLastSequence[{envelope.mOrigin, std::string(inStationID.c_str(), inStationID.size())}];
+    if (last != 0 && envelope.mSequence <= last) {
+      mCounters.mDuplicates.fetch_add(1, std::memory_order_relaxed);
+      return;
+    }
+    if (last != 0 && envelope.mSequence > last + 1) {
+      const std::uint64_t lost = envelope.mSequence - last - 1;
+      mCounters.mLost.fetch_add(lost, std::memory_order_relaxed);
+      Report(inStationID, RemoteLoss::Reason::kGap, envelope.mOrigin, lost, std::string());
+    }
+    last = envelope.mSequence;
+  }
+  switch (decoded.mStatus) {
+    case DecodeStatus::kDecoded:
+      mCounters.mImported.fetch_add(1, std::memory_order_relaxed);
+      Deliver(inStationID, std::shared_ptr<const Message>(std::move(decoded.mMessage)));
+      return;
+    case DecodeStatus::kUnknownType:
+    case DecodeStatus::kUnknownVersion:
+      mCounters.mUnknown.fetch_add(1, std::memory_order_relaxed);
+      Report(inStationID,
+             decoded.mStatus == DecodeStatus::kUnknownType ? RemoteLoss::Reason::kUnknownType
+                                                           : RemoteLoss::Reason::kUnknownVersion,
+             decoded.mEnvelope.mOrigin, 1, decoded.mWireName);
+      return;
+    case DecodeStatus::kMalformed:
+      mCounters.mMalformed.fetch_add(1, std::memory_order_relaxed);
+      Report(inStationID, RemoteLoss::Reason::kMalformed, decoded.mHasEnvelope ? decoded.mEnvelope.mOrigin : 0, 1,
+             std::string());
+      return;
+  }
+}
+
+void Node::Impl::Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,
+                        std::uint64_t inCount, const std::string& inWireName) {
+  auto report = std::make_shared<RemoteLoss>();
+  report->mReason = inReason;
+  report->mOrigin = inOrigin;
+  report->mCount = inCount;
+  report->mWireName = inWireName;
+  Deliver(inStationID, std::move(report));
+}
+
+// Reports and messages take the same queue, so that a report comes before
+// the message that revealed the loss.
+void Node::Impl::Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage) {
+  std::shared_ptr<MainThreadState> state = mMainThreadState;
+  kivcore::threads::AsyncCallFromMainThread(
+      [state, inStationID, inMessage] {
+        struct Marked {
+          MainThreadState& mState;
+          const Message* mOuter;
+          ~Marked() { mState.mDelivering = mOuter; }
+        } marked{*state, state->mDelivering};
+        state->mDelivering = inMessage.get();
+        StationUtils::BroadcastMessage(inStationID, *inMessage);
+      },
+      0);
+}
+
+Node::Node(NodeOptions inOptions) : mImpl(std::make_unique<Impl>(std::move(inOptions))) {}
+Node::~Node() = default;
+void Node::Export(const ImmutableString& inStationID) { mImpl->Export(inStationID); }
+void Node::Import(const ImmutableString& inStationID, const std::string& inEndpoint) {
+  mImpl->Import(inStationID, inEndpoint);
+}
+const std::string& Node::GetEndpoint() const noexcept { return mImpl->Endpoint(); }
+std::uint64_t Node::GetOrigin() const noexcept { return mImpl->Origin(); }
+NodeStats Node::GetStats() const noexcept { return mImpl->GetStats(); }
+
+}  // namespace Tarn::Remote

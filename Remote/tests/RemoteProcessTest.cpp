@@ -1,0 +1,174 @@
+// Stations across processes: this process against a child (RemotePeer.cpp)
+// on the other side of a node, every wait bounded, the child killed if it
+// outlives its test.
+#include "RemoteTestMessages.h"
+
+#include <TarnMessaging.h>
+#include <TarnMessaging/Remote/Node.h>
+
+#include <gtest/gtest.h>
+
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace {
+
+using kivcore::utility::ImmutableString;
+using remote_test::PumpUntil;
+using remote_test::Tick;
+using Tarn::Remote::RemoteLoss;
+
+// The child program, started with arguments; its exit status, waited for
+// with a deadline, else it is killed.
+class Peer {
+public:
+  explicit Peer(std::vector<std::string> inArguments) {
+    inArguments.insert(inArguments.begin(), TARN_REMOTE_PEER);
+    std::vector<char*> argv;
+    for (std::string& argument : inArguments) argv.push_back(argument.data());
+    argv.push_back(nullptr);
+    mPid = ::fork();
+    if (mPid == 0) {
+      ::execv(argv[0], argv.data());
+      ::_exit(127);
+    }
+  }
+  ~Peer() {
+    if (mPid > 0) {
+      ::kill(mPid, SIGKILL);
+      ::waitpid(mPid, nullptr, 0);
+    }
+  }
+  // The exit status, or -1 when the child has not exited within 10 s.
+  int Wait() {
+    int status = 0;
+    for (int round = 0; round < 1000; ++round) {
+      if (::waitpid(mPid, &status, WNOHANG) == mPid) {
+        mPid = -1;
+        return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+      }
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return -1;
+  }
+
+private:
+  pid_t mPid = -1;
+};
+
+class RemoteProcess : public ::testing::Test {
+protected:
+  void SetUp() override {
+    Tarn::Messaging::Initialize();
+    for (const char* station : {"test.remote", "test.twoway", "test.raw"}) {
+      Tarn::StationRegistry::RegisterStation(ImmutableString::CreateStatic(station), nullptr);
+    }
+  }
+  void TearDown() override { Tarn::Messaging::Terminate(); }
+  static std::string Endpoint(const char* inRole) {
+    return Tarn::Remote::Node::DefaultEndpoint("test-" + std::to_string(::getpid()) + "-" + inRole);
+  }
+};
+
+TEST_F(RemoteProcess, ABurstThroughAFullExportQueueArrivesInOrderAndEveryLossIsReported) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  const std::string exporter = Endpoint("burst");
+  Tarn::Remote::Node node(Tarn::Remote::NodeOptions("test-" + std::to_string(::getpid()) + "-importer"));
+  std::vector<std::uint64_t> numbers;
+  std::uint64_t lost = 0;
+  const Tarn::Registration ticks =
+      Tarn::Subscribe<Tick>(station, [&](const Tick& inTick) { numbers.push_back(inTick.mNumber); });
+  const Tarn::Registration losses = Tarn::Subscribe<RemoteLoss>(station, [&](const RemoteLoss& inLoss) {
+    EXPECT_EQ(inLoss.mReason, RemoteLoss::Reason::kGap);
+    lost += inLoss.mCount;
+  });
+  node.Import(station, exporter);
+  constexpr std::uint64_t kCount = 3000;
+  // An export queue of two against a burst: most of it is dropped.
+  Peer peer({"burst", exporter, std::to_string(kCount), "2"});
+  ASSERT_TRUE(PumpUntil([&] { return !numbers.empty() && numbers.back() == kCount + 1; }));
+  EXPECT_EQ(peer.Wait(), 0);
+  for (std::size_t i = 1; i < numbers.size(); ++i) ASSERT_LT(numbers[i - 1], numbers[i]) << "at " << i;
+  EXPECT_GT(lost, 0u);
+  EXPECT_EQ(numbers.size() + lost, kCount + 1) << "every message delivered or reported lost, none twice";
+  EXPECT_EQ(node.GetStats().mLost, lost);
+}
+
+TEST_F(RemoteProcess, AStationSharedBothWaysCarriesEachMessageOnceAndNothingEchoes) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.twoway");
+  const std::string own = Endpoint("parent");
+  const std::string child = Endpoint("child");
+  Tarn::Remote::NodeOptions options;
+  options.mEndpoint = own;
+  Tarn::Remote::Node node(options);
+  std::uint32_t importers = 0;
+  std::vector<Tick> heard;
+  const Tarn::Registration counted = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
+      station, [&](const Tarn::Remote::ImportersChanged& inChanged) { importers = inChanged.mImporters; });
+  const Tarn::Registration ticks = Tarn::Subscribe<Tick>(station, [&](const Tick& inTick) { heard.push_back(inTick); });
+  node.Export(station);
+  node.Import(station, child);
+  constexpr std::uint64_t kCount = 200;
+  Peer peer({"twoway", child, own, std::to_string(kCount)});
+  const auto heardFrom = [&](std::int32_t inSender) {
+    std::vector<std::uint64_t> numbers;
+    for (const Tick& tick : heard) {
+      if (tick.mSender == inSender) numbers.push_back(tick.mNumber);
+    }
+    return numbers;
+  };
+  ASSERT_TRUE(PumpUntil([&] { return importers > 0 && !heardFrom(3).empty(); }));
+  for (std::uint64_t number = 1; number <= kCount; ++number) {
+    Tick tick;
+    tick.mNumber = number;
+    Tarn::StationUtils::BroadcastMessage(station, tick);
+  }
+  ASSERT_TRUE(PumpUntil([&] { return !heardFrom(2).empty(); }));
+  EXPECT_EQ(peer.Wait(), 0);
+  std::vector<std::uint64_t> expected;
+  for (std::uint64_t number = 1; number <= kCount; ++number) expected.push_back(number);
+  EXPECT_EQ(heardFrom(1), expected) << "each answer once, in order";
+  EXPECT_EQ(heardFrom(0), expected) << "our own ticks heard once, locally: none came back";
+  EXPECT_EQ(heardFrom(2), std::vector<std::uint64_t>{0}) << "echoes the child heard";
+  EXPECT_EQ(node.GetStats().mDuplicates, 0u);
+}
+
+TEST_F(RemoteProcess, UnknownMalformedRepeatedAndMissingInputIsReportedNeverDelivered) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.raw");
+  const std::string exporter = Endpoint("raw");
+  Tarn::Remote::Node node(Tarn::Remote::NodeOptions("test-" + std::to_string(::getpid()) + "-rawimporter"));
+  std::vector<std::uint64_t> numbers;
+  std::vector<RemoteLoss> reports;
+  const Tarn::Registration ticks =
+      Tarn::Subscribe<Tick>(station, [&](const Tick& inTick) { numbers.push_back(inTick.mNumber); });
+  const Tarn::Registration losses =
+      Tarn::Subscribe<RemoteLoss>(station, [&](const RemoteLoss& inLoss) { reports.push_back(inLoss); });
+  node.Import(station, exporter);
+  Peer peer({"raw", exporter});
+  ASSERT_TRUE(PumpUntil([&] { return !numbers.empty() && numbers.back() == 8; }));
+  EXPECT_EQ(peer.Wait(), 0);
+  EXPECT_EQ(numbers, (std::vector<std::uint64_t>{1, 7, 8}));
+  using Reason = RemoteLoss::Reason;
+  const std::vector<std::pair<Reason, std::uint64_t>> expected{
+      {Reason::kUnknownType, 77}, {Reason::kUnknownVersion, 77}, {Reason::kMalformed, 77},
+      {Reason::kMalformed, 0},    {Reason::kMalformed, 0},       {Reason::kGap, 77}};
+  ASSERT_EQ(reports.size(), expected.size());
+  for (std::size_t i = 0; i < expected.size(); ++i) {
+    EXPECT_EQ(reports[i].mReason, expected[i].first) << i;
+    EXPECT_EQ(reports[i].mOrigin, expected[i].second) << i;
+  }
+  EXPECT_EQ(reports[0].mWireName, "test.nobody");
+  EXPECT_EQ(reports[1].mWireName, "test.tick");
+  EXPECT_EQ(reports[5].mCount, 2u);
+  const Tarn::Remote::NodeStats stats = node.GetStats();
+  EXPECT_EQ(stats.mDuplicates, 2u);
+  EXPECT_EQ(stats.mUnknown, 2u);
+  EXPECT_EQ(stats.mMalformed, 3u);
+}
+
+}  // namespace
