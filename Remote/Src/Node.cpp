@@ -123,6 +123,7 @@ private:
   void Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoing);
   void Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommands);
   void HearSubscriptions(zmq::socket_t& ioPublisher);
+  void AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters);
   void HearImports(ImportSocket& ioImport);
   void Receive(const ImmutableString& inStationID, const zmq::message_t& inBody);
   void Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,
@@ -358,7 +359,11 @@ void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommand
   for (Command& command : ioCommands) {
     const std::string topic = TopicOf(command.mStationID);
     if (command.mKind == Command::Kind::kExport) {
-      mExportedTopics.insert(topic);
+      // Importers may have subscribed before the export was known here.
+      const auto counted = mImporters.find(topic);
+      if (mExportedTopics.insert(topic).second && counted != mImporters.end() && counted->second > 0) {
+        AnnounceImporters(command.mStationID, counted->second);
+      }
       continue;
     }
     auto found = mImports.find(command.mEndpoint);
@@ -387,20 +392,29 @@ void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {
     if (frame.size() < 2) continue;
     const char* data = static_cast<const char*>(frame.data());
     const std::string topic(data + 1, frame.size() - 1);
-    if (mExportedTopics.count(topic) == 0 || topic.back() != '\0') continue;
+    if (topic.back() != '\0' || (data[0] != 0 && data[0] != 1)) continue;
+    // Counted for every topic, exported yet or not: an importer may
+    // subscribe before the export command reaches this thread. Topics no
+    // importer holds any more are forgotten, so that the map stays bounded
+    // by what importers hold.
     std::uint32_t& importers = mImporters[topic];
     if (data[0] == 1) {
       ++importers;
-    } else if (data[0] == 0 && importers > 0) {
+    } else if (importers > 0) {
       --importers;
-    } else {
-      continue;
     }
-    ImportersChanged changed;
-    changed.mImporters = importers;
-    Deliver(ImmutableString::CreateDynamic(std::string_view(topic.data(), topic.size() - 1)),
-            std::make_shared<const ImportersChanged>(changed));
+    const std::uint32_t now = importers;
+    if (now == 0) mImporters.erase(topic);
+    if (mExportedTopics.count(topic) != 0) {
+      AnnounceImporters(ImmutableString::CreateDynamic(std::string_view(topic.data(), topic.size() - 1)), now);
+    }
   }
+}
+
+void Node::Impl::AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters) {
+  auto changed = std::make_shared<ImportersChanged>();
+  changed->mImporters = inImporters;
+  Deliver(inStationID, std::move(changed));
 }
 
 void Node::Impl::HearImports(ImportSocket& ioImport) {
