@@ -48,6 +48,12 @@ std::string TopicOf(const ImmutableString& inStationID) {
 // origin starts its count again with its next message.
 constexpr std::size_t kMaxTrackedOrigins = 4096;
 
+// The imported message being broadcast on the main thread, if any, by any
+// node of the process: export listeners leave it alone, so that it does not
+// go back out (two-way without echo), not even through another node of the
+// same process. Main thread only.
+const Message* sDelivering = nullptr;
+
 std::uint64_t NewOrigin() {
   std::random_device device;
   std::uint64_t origin = 0;
@@ -74,14 +80,6 @@ public:
   std::uint64_t Origin() const noexcept { return mOrigin; }
 
 private:
-  // State that outlives the node in the calls it hands to the main thread.
-  struct MainThreadState {
-    // The imported message being broadcast by this node on the main
-    // thread, if any: the export listeners leave it alone, so that it does
-    // not go back out (two-way without echo). Main thread only.
-    const Message* mDelivering = nullptr;
-  };
-
   // Attached to an exported station by plain pointer; hears its broadcasts
   // on the main thread.
   class ExportListener final : public Listener {
@@ -134,7 +132,6 @@ private:
   const std::shared_ptr<const WireCodec> mCodec;
   const std::uint64_t mOrigin;
   std::string mEndpoint;  // fixed once the constructor returns
-  const std::shared_ptr<MainThreadState> mMainThreadState = std::make_shared<MainThreadState>();
   int mWakeDescriptor = -1;  // an eventfd: written by any thread, read by the I/O thread
 
   struct Counters {
@@ -243,7 +240,7 @@ NodeStats Node::Impl::GetStats() const noexcept {
 
 // Main thread, inside a broadcast on the station: encode, queue, never wait.
 void Node::Impl::Enqueue(ExportListener& ioListener, const Message& inMessage) {
-  if (&inMessage == mMainThreadState->mDelivering) return;
+  if (&inMessage == sDelivering) return;
   const WireType* type = FindWireType(inMessage.GetMessageID());
   if (type == nullptr) return;
   // The number is taken before the queue may drop the message, so that
@@ -504,15 +501,15 @@ void Node::Impl::Report(const ImmutableString& inStationID, RemoteLoss::Reason i
 // Reports and messages take the same queue, so that a report comes before
 // the message that revealed the loss.
 void Node::Impl::Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage) {
-  std::shared_ptr<MainThreadState> state = mMainThreadState;
   kivcore::threads::AsyncCallFromMainThread(
-      [state, inStationID, inMessage] {
+      [inStationID, inMessage] {
+        // Restored on the way out, also by a throw: a handler may run the
+        // pending calls, and with them another delivery, from inside this one.
         struct Marked {
-          MainThreadState& mState;
-          const Message* mOuter;
-          ~Marked() { mState.mDelivering = mOuter; }
-        } marked{*state, state->mDelivering};
-        state->mDelivering = inMessage.get();
+          const Message* mOuter = sDelivering;
+          ~Marked() { sDelivering = mOuter; }
+        } marked;
+        sDelivering = inMessage.get();
         StationUtils::BroadcastMessage(inStationID, *inMessage);
       },
       0);

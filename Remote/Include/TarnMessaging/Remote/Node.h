@@ -17,7 +17,9 @@
 /// Only wire-enabled message types travel (WireMessage.h); a node ignores
 /// the others. A station may be exported by one node and imported by it
 /// from another at once (two-way): a message a node delivers from an import
-/// is not exported again, so nothing echoes back to where it came from.
+/// is not exported again, by any node of the process, so nothing echoes
+/// back to where it came from; a process does not relay one node's
+/// messages on to a third.
 ///
 /// Guarantees, per origin (a sending node) and station: messages arrive in
 /// the order they were broadcast, each at most once. Every loss is detected
