@@ -54,6 +54,10 @@ constexpr std::size_t kMaxTrackedOrigins = 4096;
 // same process. Main thread only.
 const Message* sDelivering = nullptr;
 
+// How often an importer tries again to reach an exporter it lost or has not
+// reached yet.
+constexpr int kReconnectMilliseconds = 50;
+
 std::uint64_t NewOrigin() {
   std::random_device device;
   std::uint64_t origin = 0;
@@ -107,11 +111,15 @@ private:
     std::string mEndpoint;
   };
 
+  // I/O thread only.
   // One subscribing socket per endpoint imported from, with the stations
-  // it carries. I/O thread only.
+  // it carries and the monitor that tells when its peer comes and goes.
   struct ImportSocket {
+    std::string mEndpoint;
     zmq::socket_t mSocket;
+    zmq::socket_t mMonitor;  // declared after mSocket, so closed before it
     std::map<std::string, ImmutableString> mStations;  // by topic
+    PeerState::State mState = PeerState::State::kConnecting;
   };
 
   void Enqueue(ExportListener& ioListener, const Message& inMessage);
@@ -123,6 +131,8 @@ private:
   void HearSubscriptions(zmq::socket_t& ioPublisher);
   void AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters);
   void HearImports(ImportSocket& ioImport);
+  void HearMonitor(ImportSocket& ioImport);
+  void AnnouncePeer(const ImportSocket& inImport, const ImmutableString& inStationID);
   void Receive(const ImmutableString& inStationID, const zmq::message_t& inBody);
   void Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,
               std::uint64_t inCount, const std::string& inWireName);
@@ -151,6 +161,7 @@ private:
   std::set<std::string> mExportedTopics;
   std::map<std::string, std::uint32_t> mImporters;  // subscriptions per topic
   std::map<std::string, ImportSocket> mImports;     // by endpoint
+  std::uint64_t mMonitors = 0;                      // monitors made, for their addresses
   std::map<std::pair<std::uint64_t, std::string>, std::uint64_t> mLastSequence;  // by (origin, topic)
 
   std::thread mThread;
@@ -315,6 +326,7 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) 
     items.push_back(zmq::pollitem_t{ioPublisher.handle(), 0, ZMQ_POLLIN, 0});
     for (auto& [endpoint, import] : mImports) {
       items.push_back(zmq::pollitem_t{import.mSocket.handle(), 0, ZMQ_POLLIN, 0});
+      items.push_back(zmq::pollitem_t{import.mMonitor.handle(), 0, ZMQ_POLLIN, 0});
       polled.push_back(&import);
     }
     zmq::poll(items.data(), items.size(), std::chrono::milliseconds(-1));
@@ -337,7 +349,8 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) 
     }
     if ((items[1].revents & ZMQ_POLLIN) != 0) HearSubscriptions(ioPublisher);
     for (std::size_t i = 0; i < polled.size(); ++i) {
-      if ((items[i + 2].revents & ZMQ_POLLIN) != 0) HearImports(*polled[i]);
+      if ((items[2 * i + 2].revents & ZMQ_POLLIN) != 0) HearImports(*polled[i]);
+      if ((items[2 * i + 3].revents & ZMQ_POLLIN) != 0) HearMonitor(*polled[i]);
     }
   }
 }
@@ -369,8 +382,22 @@ void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommand
         zmq::socket_t socket(ioContext, zmq::socket_type::sub);
         socket.set(zmq::sockopt::rcvhwm, mOptions.mReceiveHighWaterMark);
         socket.set(zmq::sockopt::linger, 0);
+        // A restarted exporter is found again within this, plus its start.
+        socket.set(zmq::sockopt::reconnect_ivl, kReconnectMilliseconds);
+        const std::string monitorAddress =
+            "inproc://tarn-remote-monitor-" + std::to_string(mOrigin) + "-" + std::to_string(++mMonitors);
+        if (zmq_socket_monitor(socket.handle(), monitorAddress.c_str(),
+                               ZMQ_EVENT_HANDSHAKE_SUCCEEDED | ZMQ_EVENT_DISCONNECTED) != 0) {
+          throw zmq::error_t();
+        }
+        zmq::socket_t monitor(ioContext, zmq::socket_type::pair);
+        monitor.set(zmq::sockopt::linger, 0);
+        monitor.connect(monitorAddress);
         socket.connect(command.mEndpoint);
-        found = mImports.emplace(command.mEndpoint, ImportSocket{std::move(socket), {}}).first;
+        found = mImports
+                    .emplace(command.mEndpoint,
+                             ImportSocket{command.mEndpoint, std::move(socket), std::move(monitor), {}})
+                    .first;
       } catch (const zmq::error_t&) {
         mCounters.mImportErrors.fetch_add(1, std::memory_order_relaxed);
         continue;
@@ -378,6 +405,7 @@ void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommand
     }
     if (found->second.mStations.emplace(topic, command.mStationID).second) {
       found->second.mSocket.set(zmq::sockopt::subscribe, topic);
+      AnnouncePeer(found->second, command.mStationID);
     }
   }
 }
@@ -442,6 +470,32 @@ void Node::Impl::HearImports(ImportSocket& ioImport) {
     }
     Receive(station->second, body);
   }
+}
+
+void Node::Impl::HearMonitor(ImportSocket& ioImport) {
+  zmq::message_t event;
+  zmq::message_t address;
+  while (ioImport.mMonitor.recv(event, zmq::recv_flags::dontwait)) {
+    // An event is two frames: its number and value (6 bytes), then the
+    // peer's address.
+    while (event.more() && ioImport.mMonitor.recv(address, zmq::recv_flags::none) && address.more()) {
+    }
+    if (event.size() < sizeof(std::uint16_t)) continue;
+    std::uint16_t number = 0;
+    std::memcpy(&number, event.data(), sizeof(number));
+    const PeerState::State state =
+        number == ZMQ_EVENT_HANDSHAKE_SUCCEEDED ? PeerState::State::kLive : PeerState::State::kLost;
+    if (state == ioImport.mState) continue;
+    ioImport.mState = state;
+    for (const auto& [topic, station] : ioImport.mStations) AnnouncePeer(ioImport, station);
+  }
+}
+
+void Node::Impl::AnnouncePeer(const ImportSocket& inImport, const ImmutableString& inStationID) {
+  auto state = std::make_shared<PeerState>();
+  state->mState = inImport.mState;
+  state->mEndpoint = inImport.mEndpoint;
+  Deliver(inStationID, std::move(state));
 }
 
 // I/O thread: decode, account for the sequence, hand to the main thread.

@@ -8,6 +8,9 @@
 //                                   of its own, then reports the echoes heard
 //   raw ENDPOINT                    a bare publishing socket sending test.raw
 //                                   input no node would send
+//   serve ENDPOINT TAG              exports test.remote, broadcasts a tick
+//                                   from TAG once imported, then waits to be
+//                                   killed
 // Every wait is bounded. Exit status 0 when the mode ran, 1 for bad
 // arguments, 2 when a wait ran out.
 #include "RemoteTestMessages.h"
@@ -89,6 +92,21 @@ int TwoWay(const std::string& inOwn, const std::string& inParent, std::uint64_t 
   return PumpUntil([&] { return Drained(node, answered + 2); }) ? 0 : 2;
 }
 
+int Serve(const std::string& inEndpoint, std::int32_t inTag) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  Tarn::Remote::NodeOptions options;
+  options.mEndpoint = inEndpoint;
+  Tarn::Remote::Node node(options);
+  std::uint32_t importers = 0;
+  const Tarn::Registration heard = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
+      station, [&](const Tarn::Remote::ImportersChanged& inChanged) { importers = inChanged.mImporters; });
+  node.Export(station);
+  if (!PumpUntil([&] { return importers > 0; })) return 2;
+  Tarn::StationUtils::BroadcastMessage(station, MakeTick(1, inTag));
+  PumpUntil([] { return false; }, std::chrono::seconds(20));
+  return 2;
+}
+
 int Raw(const std::string& inEndpoint) {
   using Tarn::Remote::WireType;
   zmq::context_t context(1);
@@ -146,6 +164,8 @@ int main(int inArgc, char** inArgv) {
     status = Burst(inArgv[2], std::strtoull(inArgv[3], nullptr, 10), std::strtoull(inArgv[4], nullptr, 10));
   } else if (mode == "twoway" && inArgc == 5) {
     status = TwoWay(inArgv[2], inArgv[3], std::strtoull(inArgv[4], nullptr, 10));
+  } else if (mode == "serve" && inArgc == 4) {
+    status = Serve(inArgv[2], std::atoi(inArgv[3]));
   } else if (mode == "raw" && inArgc == 3) {
     status = Raw(inArgv[2]);
   }

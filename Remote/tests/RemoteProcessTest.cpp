@@ -12,6 +12,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <string>
 #include <thread>
 #include <vector>
@@ -38,10 +39,12 @@ public:
       ::_exit(127);
     }
   }
-  ~Peer() {
+  ~Peer() { Kill(); }
+  void Kill() {
     if (mPid > 0) {
       ::kill(mPid, SIGKILL);
       ::waitpid(mPid, nullptr, 0);
+      mPid = -1;
     }
   }
   // The exit status, or -1 when the child has not exited within 10 s.
@@ -169,6 +172,43 @@ TEST_F(RemoteProcess, UnknownMalformedRepeatedAndMissingInputIsReportedNeverDeli
   EXPECT_EQ(stats.mDuplicates, 2u);
   EXPECT_EQ(stats.mUnknown, 2u);
   EXPECT_EQ(stats.mMalformed, 3u);
+}
+
+TEST_F(RemoteProcess, AnExporterKilledAndRestartedIsLiveAgainAndHeardWithoutAReportedLoss) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  const std::string exporter = Endpoint("restarted");
+  Tarn::Remote::Node node(Tarn::Remote::NodeOptions("test-" + std::to_string(::getpid()) + "-watcher"));
+  using State = Tarn::Remote::PeerState::State;
+  std::vector<State> states;
+  std::vector<std::int32_t> senders;
+  std::uint64_t lost = 0;
+  const Tarn::Registration peers = Tarn::Subscribe<Tarn::Remote::PeerState>(
+      station, [&](const Tarn::Remote::PeerState& inState) {
+        EXPECT_EQ(inState.mEndpoint, exporter);
+        states.push_back(inState.mState);
+      });
+  const Tarn::Registration ticks =
+      Tarn::Subscribe<Tick>(station, [&](const Tick& inTick) { senders.push_back(inTick.mSender); });
+  const Tarn::Registration losses =
+      Tarn::Subscribe<RemoteLoss>(station, [&](const RemoteLoss& inLoss) { lost += inLoss.mCount; });
+  node.Import(station, exporter);
+  {
+    Peer first({"serve", exporter, "1"});
+    ASSERT_TRUE(PumpUntil([&] { return senders.size() == 1; }));
+    first.Kill();
+  }
+  ASSERT_TRUE(PumpUntil([&] { return !states.empty() && states.back() == State::kLost; }));
+  const auto restarted = std::chrono::steady_clock::now();
+  Peer second({"serve", exporter, "2"});
+  ASSERT_TRUE(PumpUntil([&] { return !states.empty() && states.back() == State::kLive; }));
+  std::printf("live again %lld ms after the restart began\n",
+              static_cast<long long>(std::chrono::duration_cast<std::chrono::milliseconds>(
+                                         std::chrono::steady_clock::now() - restarted)
+                                         .count()));
+  ASSERT_TRUE(PumpUntil([&] { return senders.size() == 2; }));
+  EXPECT_EQ(senders, (std::vector<std::int32_t>{1, 2}));
+  EXPECT_EQ(states, (std::vector<State>{State::kConnecting, State::kLive, State::kLost, State::kLive}));
+  EXPECT_EQ(lost, 0u) << "a restarted exporter is a new origin: its count starts afresh";
 }
 
 }  // namespace

@@ -130,6 +130,17 @@ struct ImportersChanged : MessageImpl<ImportersChanged> {
   std::uint32_t mImporters = 0;
 };
 
+/// Broadcast on an imported station, on the importing node's main thread,
+/// when the connection to the node it is imported from changes: kConnecting
+/// when the import starts, kLive once connected (again), kLost when the
+/// connection is gone. A lost node is sought again every 50 ms, and a node
+/// restarted at the same endpoint is live again as soon as it has bound it.
+struct PeerState : MessageImpl<PeerState> {
+  enum class State : std::int32_t { kConnecting, kLive, kLost };
+  State mState = State::kConnecting;
+  std::string mEndpoint;  ///< the endpoint imported from
+};
+
 /// One process's end of stations shared with other processes; see the file
 /// comment. Not copyable.
 class TARN_REMOTE_API Node {
