@@ -18,6 +18,7 @@ constexpr char kSequence = 's';
 constexpr char kWireName = 'n';
 constexpr char kVersion = 'v';
 constexpr char kFields = 'f';
+constexpr char kSnapshot = 'k';
 
 // A packer stream appending to a string.
 class StringStream {
@@ -159,7 +160,7 @@ public:
     outBytes.clear();
     StringStream stream(outBytes);
     Packer packer(stream);
-    packer.pack_map(5);
+    packer.pack_map(inEnvelope.mSnapshot != 0 ? 6 : 5);
     PackKey(packer, &kOrigin, 1);
     packer.pack_uint64(inEnvelope.mOrigin);
     PackKey(packer, &kSequence, 1);
@@ -168,6 +169,10 @@ public:
     PackKey(packer, inType.mWireName, std::strlen(inType.mWireName));
     PackKey(packer, &kVersion, 1);
     packer.pack_uint32(inType.mVersion);
+    if (inEnvelope.mSnapshot != 0) {
+      PackKey(packer, &kSnapshot, 1);
+      packer.pack_uint64(inEnvelope.mSnapshot);
+    }
     PackKey(packer, &kFields, 1);
     PackingWriter writer(packer);
     inType.mWrite(inMessage, writer);
@@ -204,6 +209,7 @@ private:
     const msgpack::object* name = nullptr;
     const msgpack::object* version = nullptr;
     const msgpack::object* fields = nullptr;
+    const msgpack::object* snapshot = nullptr;
     for (std::uint32_t i = 0; i < root.via.map.size; ++i) {
       const msgpack::object_kv& entry = root.via.map.ptr[i];
       if (KeyIs(entry.key, &kOrigin, 1)) origin = &entry.val;
@@ -211,11 +217,16 @@ private:
       if (KeyIs(entry.key, &kWireName, 1)) name = &entry.val;
       if (KeyIs(entry.key, &kVersion, 1)) version = &entry.val;
       if (KeyIs(entry.key, &kFields, 1)) fields = &entry.val;
+      if (KeyIs(entry.key, &kSnapshot, 1)) snapshot = &entry.val;
     }
-    if (origin == nullptr || sequence == nullptr || !IsUnsigned(*origin) || !IsUnsigned(*sequence)) return;
+    if (origin == nullptr || sequence == nullptr || !IsUnsigned(*origin) || !IsUnsigned(*sequence) ||
+        (snapshot != nullptr && !IsUnsigned(*snapshot))) {
+      return;
+    }
     ioResult.mHasEnvelope = true;
     ioResult.mEnvelope.mOrigin = origin->via.u64;
     ioResult.mEnvelope.mSequence = sequence->via.u64;
+    ioResult.mEnvelope.mSnapshot = snapshot != nullptr ? snapshot->via.u64 : 0;
     if (name == nullptr || name->type != msgpack::type::STR || version == nullptr || !IsUnsigned(*version) ||
         version->via.u64 > std::numeric_limits<std::uint32_t>::max() || fields == nullptr ||
         fields->type != msgpack::type::MAP) {

@@ -15,6 +15,7 @@
 #include <sys/eventfd.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <cstring>
@@ -103,6 +104,22 @@ private:
   struct Outgoing {
     std::shared_ptr<const std::string> mTopic;
     std::string mBytes;
+    std::uint64_t mSequence = 0;
+    const WireType* mType = nullptr;
+    std::shared_ptr<const Message> mState;  // a copy, for a state-like type only
+  };
+
+  // What the I/O thread sent last on one exported station: the sequence
+  // number, and the latest value of each state-like type by wire name.
+  struct Sent {
+    std::uint64_t mSequence = 0;
+    std::map<std::string, std::pair<const WireType*, std::shared_ptr<const Message>>> mStates;
+  };
+
+  // What an importer knows of one origin on one station.
+  struct Track {
+    std::uint64_t mLast = 0;      // the last sequence number heard; 0: none yet
+    std::uint64_t mSnapshot = 0;  // the snapshot being taken in, until the next live message
   };
 
   struct Command {
@@ -129,6 +146,8 @@ private:
   void Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoing);
   void Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommands);
   void HearSubscriptions(zmq::socket_t& ioPublisher);
+  void SendSnapshot(zmq::socket_t& ioPublisher, const std::string& inTopic);
+  bool Admit(const ImmutableString& inStationID, const Envelope& inEnvelope);
   void AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters);
   void HearImports(ImportSocket& ioImport);
   void HearMonitor(ImportSocket& ioImport);
@@ -162,7 +181,9 @@ private:
   std::map<std::string, std::uint32_t> mImporters;  // subscriptions per topic
   std::map<std::string, ImportSocket> mImports;     // by endpoint
   std::uint64_t mMonitors = 0;                      // monitors made, for their addresses
-  std::map<std::pair<std::uint64_t, std::string>, std::uint64_t> mLastSequence;  // by (origin, topic)
+  std::map<std::pair<std::uint64_t, std::string>, Track> mTracks;  // by (origin, topic)
+  std::map<std::string, Sent> mSent;                               // by topic
+  std::uint64_t mSnapshots = 0;                                    // snapshots sent
 
   std::thread mThread;
 };
@@ -256,10 +277,12 @@ void Node::Impl::Enqueue(ExportListener& ioListener, const Message& inMessage) {
   if (type == nullptr) return;
   // The number is taken before the queue may drop the message, so that
   // importers see the drop as a gap.
-  const Envelope envelope{mOrigin, ++ioListener.mSequence};
-  Outgoing outgoing{ioListener.mTopic, std::string()};
+  const Envelope envelope{mOrigin, ++ioListener.mSequence, 0};
+  Outgoing outgoing{ioListener.mTopic, std::string(), envelope.mSequence, type, nullptr};
   try {
     mCodec->Encode(envelope, *type, inMessage, outgoing.mBytes);
+    // Kept whole, since a snapshot goes out under an envelope of its own.
+    if (type->mKind == WireKind::kState) outgoing.mState.reset(inMessage.Clone());
   } catch (const std::bad_alloc&) {
     mCounters.mExportDropped.fetch_add(1, std::memory_order_relaxed);
     return;
@@ -362,6 +385,23 @@ void Node::Impl::Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoi
     ioPublisher.send(zmq::buffer(*outgoing.mTopic), zmq::send_flags::sndmore | zmq::send_flags::dontwait);
     ioPublisher.send(zmq::buffer(outgoing.mBytes), zmq::send_flags::dontwait);
     mCounters.mExported.fetch_add(1, std::memory_order_relaxed);
+    Sent& sent = mSent[*outgoing.mTopic];
+    sent.mSequence = outgoing.mSequence;
+    if (outgoing.mState != nullptr) sent.mStates[outgoing.mType->mWireName] = {outgoing.mType, outgoing.mState};
+  }
+}
+
+// To every importer of the topic: a publisher cannot address one. Those
+// that heard the values already recognise the snapshot and drop it.
+void Node::Impl::SendSnapshot(zmq::socket_t& ioPublisher, const std::string& inTopic) {
+  const auto sent = mSent.find(inTopic);
+  if (sent == mSent.end() || sent->second.mStates.empty()) return;
+  const Envelope envelope{mOrigin, sent->second.mSequence, ++mSnapshots};
+  std::string bytes;
+  for (const auto& [name, state] : sent->second.mStates) {
+    mCodec->Encode(envelope, *state.first, *state.second, bytes);
+    ioPublisher.send(zmq::buffer(inTopic), zmq::send_flags::sndmore | zmq::send_flags::dontwait);
+    ioPublisher.send(zmq::buffer(bytes), zmq::send_flags::dontwait);
   }
 }
 
@@ -425,6 +465,7 @@ void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {
     std::uint32_t& importers = mImporters[topic];
     if (data[0] == 1) {
       ++importers;
+      SendSnapshot(ioPublisher, topic);
     } else if (importers > 0) {
       --importers;
     }
@@ -501,26 +542,7 @@ void Node::Impl::AnnouncePeer(const ImportSocket& inImport, const ImmutableStrin
 // I/O thread: decode, account for the sequence, hand to the main thread.
 void Node::Impl::Receive(const ImmutableString& inStationID, const zmq::message_t& inBody) {
   Decoded decoded = mCodec->Decode(inBody.data(), inBody.size());
-  if (decoded.mHasEnvelope) {
-    const Envelope& envelope = decoded.mEnvelope;
-    if (envelope.mOrigin == mOrigin || envelope.mSequence == 0) {
-      // Our own message come back, or no sequence at all: never delivered.
-      mCounters.mDuplicates.fetch_add(1, std::memory_order_relaxed);
-      return;
-    }
-    if (mLastSequence.size() >= kMaxTrackedOrigins) mLastSequence.clear();
-    std::uint64_t& last = mLastSequence[{envelope.mOrigin, std::string(inStationID.c_str(), inStationID.size())}];
-    if (last != 0 && envelope.mSequence <= last) {
-      mCounters.mDuplicates.fetch_add(1, std::memory_order_relaxed);
-      return;
-    }
-    if (last != 0 && envelope.mSequence > last + 1) {
-      const std::uint64_t lost = envelope.mSequence - last - 1;
-      mCounters.mLost.fetch_add(lost, std::memory_order_relaxed);
-      Report(inStationID, RemoteLoss::Reason::kGap, envelope.mOrigin, lost, std::string());
-    }
-    last = envelope.mSequence;
-  }
+  if (decoded.mHasEnvelope && !Admit(inStationID, decoded.mEnvelope)) return;
   switch (decoded.mStatus) {
     case DecodeStatus::kDecoded:
       mCounters.mImported.fetch_add(1, std::memory_order_relaxed);
@@ -540,6 +562,42 @@ void Node::Impl::Receive(const ImmutableString& inStationID, const zmq::message_
              std::string());
       return;
   }
+}
+
+// The sequence rules: whether a message of this envelope is taken in (or
+// reported as refused) rather than dropped, with a gap reported first.
+bool Node::Impl::Admit(const ImmutableString& inStationID, const Envelope& inEnvelope) {
+  if (inEnvelope.mOrigin == mOrigin || inEnvelope.mSequence == 0) {
+    // Our own message come back, or no sequence at all: never delivered.
+    mCounters.mDuplicates.fetch_add(1, std::memory_order_relaxed);
+    return false;
+  }
+  if (mTracks.size() >= kMaxTrackedOrigins) mTracks.clear();
+  Track& track = mTracks[{inEnvelope.mOrigin, std::string(inStationID.c_str(), inStationID.size())}];
+  const bool known = track.mLast != 0;
+  // A snapshot carries the last number sent before it: what lies between
+  // ours and it was missed, a live message one past ours is the next.
+  const std::uint64_t next = inEnvelope.mSnapshot != 0 ? inEnvelope.mSequence : inEnvelope.mSequence - 1;
+  if (inEnvelope.mSnapshot != 0) {
+    const bool continuing = known && inEnvelope.mSnapshot == track.mSnapshot;
+    if (!continuing && known && inEnvelope.mSequence <= track.mLast) {
+      return false;  // another importer's snapshot of what we heard already
+    }
+    track.mSnapshot = inEnvelope.mSnapshot;
+  } else {
+    if (known && inEnvelope.mSequence <= track.mLast) {
+      mCounters.mDuplicates.fetch_add(1, std::memory_order_relaxed);
+      return false;
+    }
+    track.mSnapshot = 0;
+  }
+  if (known && next > track.mLast) {
+    const std::uint64_t lost = next - track.mLast;
+    mCounters.mLost.fetch_add(lost, std::memory_order_relaxed);
+    Report(inStationID, RemoteLoss::Reason::kGap, inEnvelope.mOrigin, lost, std::string());
+  }
+  track.mLast = std::max(track.mLast, inEnvelope.mSequence);
+  return true;
 }
 
 void Node::Impl::Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,

@@ -11,6 +11,11 @@
 //   serve ENDPOINT TAG              exports test.remote, broadcasts a tick
 //                                   from TAG once imported, then waits to be
 //                                   killed
+//   state ENDPOINT                  exports test.remote, broadcasts statuses
+//                                   1, 2, 3 and says so on standard output
+//                                   before any importer comes, then tick N
+//                                   once N importers are there (N = 1, 2),
+//                                   then waits to be killed
 // Every wait is bounded. Exit status 0 when the mode ran, 1 for bad
 // arguments, 2 when a wait ran out.
 #include "RemoteTestMessages.h"
@@ -20,6 +25,7 @@
 
 #include <zmq.hpp>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <string>
@@ -107,6 +113,31 @@ int Serve(const std::string& inEndpoint, std::int32_t inTag) {
   return 2;
 }
 
+int State(const std::string& inEndpoint) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  Tarn::Remote::NodeOptions options;
+  options.mEndpoint = inEndpoint;
+  Tarn::Remote::Node node(options);
+  std::uint32_t importers = 0;
+  const Tarn::Registration heard = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
+      station, [&](const Tarn::Remote::ImportersChanged& inChanged) { importers = inChanged.mImporters; });
+  node.Export(station);
+  for (std::int32_t value = 1; value <= 3; ++value) {
+    remote_test::Status status;
+    status.mValue = value;
+    Tarn::StationUtils::BroadcastMessage(station, status);
+  }
+  if (!PumpUntil([&] { return Drained(node, 3); }) || importers != 0) return 2;
+  std::fputs("sent\n", stdout);
+  std::fflush(stdout);
+  for (std::uint32_t wanted = 1; wanted <= 2; ++wanted) {
+    if (!PumpUntil([&] { return importers >= wanted; })) return 2;
+    Tarn::StationUtils::BroadcastMessage(station, MakeTick(wanted, 1));
+  }
+  PumpUntil([] { return false; }, std::chrono::seconds(20));
+  return 2;
+}
+
 int Raw(const std::string& inEndpoint) {
   using Tarn::Remote::WireType;
   zmq::context_t context(1);
@@ -166,6 +197,8 @@ int main(int inArgc, char** inArgv) {
     status = TwoWay(inArgv[2], inArgv[3], std::strtoull(inArgv[4], nullptr, 10));
   } else if (mode == "serve" && inArgc == 4) {
     status = Serve(inArgv[2], std::atoi(inArgv[3]));
+  } else if (mode == "state" && inArgc == 3) {
+    status = State(inArgv[2]);
   } else if (mode == "raw" && inArgc == 3) {
     status = Raw(inArgv[2]);
   }

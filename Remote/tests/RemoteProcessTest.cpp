@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 
+#include <poll.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -25,7 +26,7 @@ using remote_test::Tick;
 using Tarn::Remote::RemoteLoss;
 
 // The child program, started with arguments; its exit status, waited for
-// with a deadline, else it is killed.
+// with a deadline, else it is killed. Its standard output is a pipe to us.
 class Peer {
 public:
   explicit Peer(std::vector<std::string> inArguments) {
@@ -33,13 +34,27 @@ public:
     std::vector<char*> argv;
     for (std::string& argument : inArguments) argv.push_back(argument.data());
     argv.push_back(nullptr);
+    int output[2];
+    if (::pipe(output) != 0) return;
     mPid = ::fork();
     if (mPid == 0) {
+      ::dup2(output[1], STDOUT_FILENO);
       ::execv(argv[0], argv.data());
       ::_exit(127);
     }
+    ::close(output[1]);
+    mOutput = output[0];
   }
-  ~Peer() { Kill(); }
+  ~Peer() {
+    Kill();
+    if (mOutput >= 0) ::close(mOutput);
+  }
+  // Whether the child wrote a byte within 10 s: its signal that it is ready.
+  bool WaitForSignal() {
+    pollfd readable{mOutput, POLLIN, 0};
+    char byte = 0;
+    return ::poll(&readable, 1, 10000) == 1 && ::read(mOutput, &byte, 1) == 1;
+  }
   void Kill() {
     if (mPid > 0) {
       ::kill(mPid, SIGKILL);
@@ -62,6 +77,7 @@ public:
 
 private:
   pid_t mPid = -1;
+  int mOutput = -1;
 };
 
 class RemoteProcess : public ::testing::Test {
@@ -211,4 +227,35 @@ TEST_F(RemoteProcess, AnExporterKilledAndRestartedIsLiveAgainAndHeardWithoutARep
   EXPECT_EQ(lost, 0u) << "a restarted exporter is a new origin: its count starts afresh";
 }
 
+TEST_F(RemoteProcess, AnImporterThatConnectsGetsTheLatestStateOnceAndOthersNoRepeat) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  const std::string exporter = Endpoint("state");
+  const std::string pid = std::to_string(::getpid());
+  std::vector<std::int32_t> statuses;
+  std::vector<std::uint64_t> ticks;
+  std::uint64_t lost = 0;
+  const Tarn::Registration status = Tarn::Subscribe<remote_test::Status>(
+      station, [&](const remote_test::Status& inStatus) { statuses.push_back(inStatus.mValue); });
+  const Tarn::Registration tick = Tarn::Subscribe<Tick>(station, [&](const Tick& inTick) { ticks.push_back(inTick.mNumber); });
+  const Tarn::Registration losses =
+      Tarn::Subscribe<RemoteLoss>(station, [&](const RemoteLoss& inLoss) { lost += inLoss.mCount; });
+  Peer peer({"state", exporter});
+  ASSERT_TRUE(peer.WaitForSignal()) << "the statuses have left the exporter";
+  Tarn::Remote::Node first(Tarn::Remote::NodeOptions("test-" + pid + "-first"));
+  first.Import(station, exporter);
+  ASSERT_TRUE(PumpUntil([&] { return ticks.size() == 1; }));
+  EXPECT_EQ(statuses, std::vector<std::int32_t>{3}) << "the latest value, before the next message";
+  // A second importer (another node, which delivers on the same station
+  // here): it takes the snapshot in, the first node drops it.
+  Tarn::Remote::Node second(Tarn::Remote::NodeOptions("test-" + pid + "-second"));
+  second.Import(station, exporter);
+  ASSERT_TRUE(PumpUntil([&] { return ticks.size() == 3; }));
+  EXPECT_EQ(statuses, (std::vector<std::int32_t>{3, 3}));
+  EXPECT_EQ(ticks, (std::vector<std::uint64_t>{1, 2, 2}));
+  EXPECT_EQ(lost, 0u) << "what was broadcast before an importer came is not its loss";
+  EXPECT_EQ(first.GetStats().mImported, 3u);
+  EXPECT_EQ(second.GetStats().mImported, 2u);
+}
+
 }  // namespace
+

@@ -33,6 +33,12 @@ struct Tick : Tarn::MessageImpl<Tick> {
 };
 TARN_WIRE_MESSAGE(Tick, "test.tick", 1, mNumber, mSender)
 
+// A state: only the latest value counts.
+struct Status : Tarn::MessageImpl<Status> {
+  std::int32_t mValue = 0;
+};
+TARN_WIRE_STATE(Status, "test.status", 1, mValue)
+
 }  // namespace remote_test
 
 #include <TarnMessaging/StationUtils.h>

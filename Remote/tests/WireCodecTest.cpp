@@ -57,11 +57,12 @@ TEST(WireCodec, FieldsTravelByNameSoPeersOfOtherDefinitionsDecodeWhatBothKnow) {
   sent.mPhase = remote_test::Phase::kDone;
   sent.mLabel = std::string("nul\0inside", 10);
   std::string bytes;
-  codec->Encode(Envelope{0xfeedfacecafebeefULL, 3}, Tarn::Remote::WireTypeOf<Progress>(), sent, bytes);
+  codec->Encode(Envelope{0xfeedfacecafebeefULL, 3, 2}, Tarn::Remote::WireTypeOf<Progress>(), sent, bytes);
   Tarn::Remote::Decoded got = codec->Decode(bytes.data(), bytes.size());
   ASSERT_EQ(got.mStatus, DecodeStatus::kDecoded);
   EXPECT_EQ(got.mEnvelope.mOrigin, 0xfeedfacecafebeefULL);
   EXPECT_EQ(got.mEnvelope.mSequence, 3u);
+  EXPECT_EQ(got.mEnvelope.mSnapshot, 2u);
   const Progress* progress = got.mMessage->As<Progress>();
   ASSERT_NE(progress, nullptr);
   EXPECT_EQ(progress->mDone, sent.mDone);

@@ -28,7 +28,15 @@
 /// the exporter's queue or by a socket's high-water mark, and a message
 /// refused by the decoder (unknown wire name or version, malformed). The
 /// first message heard from an origin starts its count: what it broadcast
-/// before the import was connected is not reported. Not guaranteed: delivery
+/// before the import was connected is not reported.
+///
+/// Snapshots: of each state-like type (TARN_WIRE_STATE), an exporting node
+/// keeps the latest value it sent on each station, and sends them again when
+/// an importer subscribes (first connection or reconnection), before any
+/// later message. The importer that subscribed takes them in (reporting as a
+/// gap what it missed before them, if it had heard that origin before);
+/// importers that heard everything already drop them, so no value is
+/// delivered twice to one node. Not guaranteed: delivery
 /// of what is broadcast before an importer is connected (wait for an
 /// ImportersChanged on the exporting side), and order between origins.
 ///

@@ -42,6 +42,10 @@ namespace Tarn::Remote {
 struct Envelope {
   std::uint64_t mOrigin = 0;    ///< the sending node's ID, random per node
   std::uint64_t mSequence = 0;  ///< 1 for the node's first message on the station, then one more each
+  /// For a latest value sent again to an importer that (re)connected: the
+  /// number of that sending, and mSequence is the last number the node sent
+  /// on the station; 0 for every other message.
+  std::uint64_t mSnapshot = 0;
 };
 
 /// The bounds a decoder holds untrusted input to.
@@ -85,7 +89,8 @@ public:
 };
 
 /// The MessagePack codec: an envelope map {"o": origin, "s": sequence,
-/// "n": wire name, "v": version, "f": fields}, and the fields as a map from
+/// "n": wire name, "v": version, "f": fields}, with "k": snapshot for a
+/// latest value sent again, and the fields as a map from
 /// each field's name to its value, so that peers match fields by name.
 TARN_REMOTE_API std::unique_ptr<WireCodec> MakeMsgPackCodec(const DecodeLimits& inLimits = DecodeLimits());
 

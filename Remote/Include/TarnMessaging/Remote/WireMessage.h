@@ -83,7 +83,14 @@ protected:
   ~FieldReader() = default;
 };
 
-/// The wire description of one message type, made by TARN_WIRE_MESSAGE.
+/// What a message type's values mean over time.
+enum class WireKind {
+  kEvent,  ///< each message counts: every one is delivered or reported lost
+  kState,  ///< the latest value is what counts: a node sends it again to an importer that (re)connects
+};
+
+/// The wire description of one message type, made by TARN_WIRE_MESSAGE or
+/// TARN_WIRE_STATE.
 struct WireType {
   const char* mWireName;                                   ///< stable across processes; a static string
   std::uint32_t mVersion;                                  ///< only equal versions decode
@@ -91,6 +98,7 @@ struct WireType {
   std::unique_ptr<Message> (*mCreate)();                   ///< a default-constructed message
   void (*mWrite)(const Message& inMessage, FieldWriter& ioWriter);  ///< inMessage is of this type
   void (*mRead)(Message& ioMessage, FieldReader& ioReader);         ///< ioMessage is of this type
+  WireKind mKind = WireKind::kEvent;                               ///< events unless declared a state
 };
 
 /// Adds inType to this process's wire registry and returns true. A wire
@@ -209,7 +217,17 @@ const WireType& WireTypeOf() {
 
 /// Declares the message type T wire-enabled under inWireName (a string
 /// literal) and inVersion, with the listed fields; see the file comment.
-#define TARN_WIRE_MESSAGE(T, inWireName, inVersion, ...)                                                         \
+#define TARN_WIRE_MESSAGE(T, inWireName, inVersion, ...) \
+  TARN_WIRE_DETAIL_DECLARE(T, inWireName, inVersion, ::Tarn::Remote::WireKind::kEvent, __VA_ARGS__)
+
+/// The same for a state-like type, whose latest value is what counts (a
+/// progress, a selection): an exporting node keeps the latest value it sent
+/// of each such type on each station, and sends it again to an importer that
+/// connects or reconnects (Node.h).
+#define TARN_WIRE_STATE(T, inWireName, inVersion, ...) \
+  TARN_WIRE_DETAIL_DECLARE(T, inWireName, inVersion, ::Tarn::Remote::WireKind::kState, __VA_ARGS__)
+
+#define TARN_WIRE_DETAIL_DECLARE(T, inWireName, inVersion, inKind, ...)                                          \
   inline const ::Tarn::Remote::WireType& TarnWireTypeOf(const T*) {                                              \
     static_assert(::Tarn::IsMessageType<T>::value, TARN_MESSAGE_TYPE_REQUIRED);                                  \
     static const ::Tarn::Remote::WireType sType{                                                                 \
@@ -222,7 +240,8 @@ const WireType& WireTypeOf() {
         [](::Tarn::Message& ioMessage, ::Tarn::Remote::FieldReader& ioReader) {                                  \
           T& message = static_cast<T&>(ioMessage);                                                               \
           TARN_WIRE_DETAIL_EACH(TARN_WIRE_DETAIL_READ, __VA_ARGS__)                                              \
-        }};                                                                                                      \
+        },                                                                                                       \
+        inKind};                                                                                                 \
     return sType;                                                                                                \
   }                                                                                                              \
   inline const bool kTarnWireRegistered_##T = ::Tarn::Remote::RegisterWireType(TarnWireTypeOf(static_cast<const T*>(nullptr)));
