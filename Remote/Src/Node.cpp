@@ -59,6 +59,12 @@ const Message* sDelivering = nullptr;
 // reached yet.
 constexpr int kReconnectMilliseconds = 50;
 
+// The topic of heartbeats, which every importer subscribes to: no station
+// ID starts with a control character.
+const std::string kHeartbeatTopic("\x01tarn.heartbeat", 16);
+
+using Clock = std::chrono::steady_clock;
+
 std::uint64_t NewOrigin() {
   std::random_device device;
   std::uint64_t origin = 0;
@@ -137,6 +143,7 @@ private:
     zmq::socket_t mMonitor;  // declared after mSocket, so closed before it
     std::map<std::string, ImmutableString> mStations;  // by topic
     PeerState::State mState = PeerState::State::kConnecting;
+    Clock::time_point mLastHeard;  // a message or a heartbeat, or the connection
   };
 
   void Enqueue(ExportListener& ioListener, const Message& inMessage);
@@ -151,6 +158,9 @@ private:
   void AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters);
   void HearImports(ImportSocket& ioImport);
   void HearMonitor(ImportSocket& ioImport);
+  void Beat(zmq::socket_t& ioPublisher, Clock::time_point inNow);
+  void Suspect(Clock::time_point inNow);
+  void ChangeState(ImportSocket& ioImport, PeerState::State inState);
   void AnnouncePeer(const ImportSocket& inImport, const ImmutableString& inStationID);
   void Receive(const ImmutableString& inStationID, const zmq::message_t& inBody);
   void Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,
@@ -184,6 +194,11 @@ private:
   std::map<std::pair<std::uint64_t, std::string>, Track> mTracks;  // by (origin, topic)
   std::map<std::string, Sent> mSent;                               // by topic
   std::uint64_t mSnapshots = 0;                                    // snapshots sent
+  Clock::time_point mNextBeat;                                     // when the next heartbeat is due
+  // Set by the main thread when it has run the call the last heartbeat
+  // posted: a heartbeat goes out only then, so a main thread that is stuck
+  // makes its importers suspect this node while its sockets are still fine.
+  const std::shared_ptr<std::atomic<bool>> mMainThreadAnswered = std::make_shared<std::atomic<bool>>(true);
 
   std::thread mThread;
 };
@@ -352,7 +367,12 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) 
       items.push_back(zmq::pollitem_t{import.mMonitor.handle(), 0, ZMQ_POLLIN, 0});
       polled.push_back(&import);
     }
-    zmq::poll(items.data(), items.size(), std::chrono::milliseconds(-1));
+    zmq::poll(items.data(), items.size(),
+              std::chrono::milliseconds(std::max(10, std::min(mOptions.mHeartbeatMilliseconds,
+                                                              mOptions.mSuspectAfterMilliseconds / 4))));
+    const Clock::time_point now = Clock::now();
+    Beat(ioPublisher, now);
+    Suspect(now);
 
     if ((items[0].revents & ZMQ_POLLIN) != 0) {
       std::uint64_t count = 0;
@@ -376,6 +396,30 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) 
       if ((items[2 * i + 3].revents & ZMQ_POLLIN) != 0) HearMonitor(*polled[i]);
     }
   }
+}
+
+void Node::Impl::Beat(zmq::socket_t& ioPublisher, Clock::time_point inNow) {
+  if (inNow < mNextBeat) return;
+  mNextBeat = inNow + std::chrono::milliseconds(mOptions.mHeartbeatMilliseconds);
+  if (!mMainThreadAnswered->exchange(false)) return;
+  ioPublisher.send(zmq::buffer(kHeartbeatTopic), zmq::send_flags::dontwait);
+  const std::shared_ptr<std::atomic<bool>> answered = mMainThreadAnswered;
+  kivcore::threads::AsyncCallFromMainThread([answered] { answered->store(true); }, 0);
+}
+
+void Node::Impl::Suspect(Clock::time_point inNow) {
+  const auto silence = std::chrono::milliseconds(mOptions.mSuspectAfterMilliseconds);
+  for (auto& [endpoint, import] : mImports) {
+    if (import.mState == PeerState::State::kLive && inNow - import.mLastHeard > silence) {
+      ChangeState(import, PeerState::State::kSuspect);
+    }
+  }
+}
+
+void Node::Impl::ChangeState(ImportSocket& ioImport, PeerState::State inState) {
+  if (inState == ioImport.mState) return;
+  ioImport.mState = inState;
+  for (const auto& [topic, station] : ioImport.mStations) AnnouncePeer(ioImport, station);
 }
 
 void Node::Impl::Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoing) {
@@ -434,9 +478,11 @@ void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommand
         monitor.set(zmq::sockopt::linger, 0);
         monitor.connect(monitorAddress);
         socket.connect(command.mEndpoint);
+        socket.set(zmq::sockopt::subscribe, kHeartbeatTopic);
         found = mImports
                     .emplace(command.mEndpoint,
-                             ImportSocket{command.mEndpoint, std::move(socket), std::move(monitor), {}})
+                             ImportSocket{command.mEndpoint, std::move(socket), std::move(monitor), {},
+                                          PeerState::State::kConnecting, Clock::now()})
                     .first;
       } catch (const zmq::error_t&) {
         mCounters.mImportErrors.fetch_add(1, std::memory_order_relaxed);
@@ -498,6 +544,10 @@ void Node::Impl::HearImports(ImportSocket& ioImport) {
       wellFormed = false;
       (void)ioImport.mSocket.recv(body, zmq::recv_flags::none);
     }
+    // Anything heard clears a suspicion: the exporter's main thread runs.
+    if (ioImport.mState == PeerState::State::kSuspect) ChangeState(ioImport, PeerState::State::kLive);
+    ioImport.mLastHeard = Clock::now();
+    if (topic.size() == kHeartbeatTopic.size() && topic.to_string() == kHeartbeatTopic) continue;
     const auto station = ioImport.mStations.find(topic.to_string());
     if (station == ioImport.mStations.end()) {
       // Not a station imported from here: no station to report it on.
@@ -524,11 +574,9 @@ void Node::Impl::HearMonitor(ImportSocket& ioImport) {
     if (event.size() < sizeof(std::uint16_t)) continue;
     std::uint16_t number = 0;
     std::memcpy(&number, event.data(), sizeof(number));
-    const PeerState::State state =
-        number == ZMQ_EVENT_HANDSHAKE_SUCCEEDED ? PeerState::State::kLive : PeerState::State::kLost;
-    if (state == ioImport.mState) continue;
-    ioImport.mState = state;
-    for (const auto& [topic, station] : ioImport.mStations) AnnouncePeer(ioImport, station);
+    ioImport.mLastHeard = Clock::now();
+    ChangeState(ioImport, number == ZMQ_EVENT_HANDSHAKE_SUCCEEDED ? PeerState::State::kLive
+                                                                  : PeerState::State::kLost);
   }
 }
 

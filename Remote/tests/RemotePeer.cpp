@@ -10,7 +10,8 @@
 //                                   input no node would send
 //   serve ENDPOINT TAG              exports test.remote, broadcasts a tick
 //                                   from TAG once imported, then waits to be
-//                                   killed
+//                                   killed (hang: with its main thread stuck,
+//                                   and heartbeats every 50 ms until then)
 //   state ENDPOINT                  exports test.remote, broadcasts statuses
 //                                   1, 2, 3 and says so on standard output
 //                                   before any importer comes, then tick N
@@ -29,6 +30,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
+#include <thread>
 
 namespace {
 
@@ -98,10 +100,11 @@ int TwoWay(const std::string& inOwn, const std::string& inParent, std::uint64_t 
   return PumpUntil([&] { return Drained(node, answered + 2); }) ? 0 : 2;
 }
 
-int Serve(const std::string& inEndpoint, std::int32_t inTag) {
+int Serve(const std::string& inEndpoint, std::int32_t inTag, bool inHang) {
   const ImmutableString station = ImmutableString::CreateStatic("test.remote");
   Tarn::Remote::NodeOptions options;
   options.mEndpoint = inEndpoint;
+  options.mHeartbeatMilliseconds = 50;
   Tarn::Remote::Node node(options);
   std::uint32_t importers = 0;
   const Tarn::Registration heard = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
@@ -109,7 +112,11 @@ int Serve(const std::string& inEndpoint, std::int32_t inTag) {
   node.Export(station);
   if (!PumpUntil([&] { return importers > 0; })) return 2;
   Tarn::StationUtils::BroadcastMessage(station, MakeTick(1, inTag));
-  PumpUntil([] { return false; }, std::chrono::seconds(20));
+  if (inHang) {
+    std::this_thread::sleep_for(std::chrono::seconds(20));  // the I/O thread runs on
+  } else {
+    PumpUntil([] { return false; }, std::chrono::seconds(20));
+  }
   return 2;
 }
 
@@ -195,8 +202,8 @@ int main(int inArgc, char** inArgv) {
     status = Burst(inArgv[2], std::strtoull(inArgv[3], nullptr, 10), std::strtoull(inArgv[4], nullptr, 10));
   } else if (mode == "twoway" && inArgc == 5) {
     status = TwoWay(inArgv[2], inArgv[3], std::strtoull(inArgv[4], nullptr, 10));
-  } else if (mode == "serve" && inArgc == 4) {
-    status = Serve(inArgv[2], std::atoi(inArgv[3]));
+  } else if ((mode == "serve" || mode == "hang") && inArgc == 4) {
+    status = Serve(inArgv[2], std::atoi(inArgv[3]), mode == "hang");
   } else if (mode == "state" && inArgc == 3) {
     status = State(inArgv[2]);
   } else if (mode == "raw" && inArgc == 3) {

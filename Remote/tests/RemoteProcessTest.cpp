@@ -227,6 +227,30 @@ TEST_F(RemoteProcess, AnExporterKilledAndRestartedIsLiveAgainAndHeardWithoutARep
   EXPECT_EQ(lost, 0u) << "a restarted exporter is a new origin: its count starts afresh";
 }
 
+TEST_F(RemoteProcess, AnExporterWhoseMainThreadIsStuckIsDeclaredSuspectInTime) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  const std::string exporter = Endpoint("hung");
+  Tarn::Remote::NodeOptions options("test-" + std::to_string(::getpid()) + "-suspecting");
+  options.mSuspectAfterMilliseconds = 400;
+  Tarn::Remote::Node node(options);
+  using State = Tarn::Remote::PeerState::State;
+  std::vector<State> states;
+  std::size_t ticks = 0;
+  const Tarn::Registration peers = Tarn::Subscribe<Tarn::Remote::PeerState>(
+      station, [&](const Tarn::Remote::PeerState& inState) { states.push_back(inState.mState); });
+  const Tarn::Registration tick = Tarn::Subscribe<Tick>(station, [&](const Tick&) { ++ticks; });
+  node.Import(station, exporter);
+  Peer peer({"hang", exporter, "1"});
+  ASSERT_TRUE(PumpUntil([&] { return ticks == 1; }));
+  const auto stuck = std::chrono::steady_clock::now();
+  ASSERT_TRUE(PumpUntil([&] { return states.back() == State::kSuspect; }));
+  EXPECT_LT(std::chrono::steady_clock::now() - stuck, std::chrono::milliseconds(400 + 100 + 400))
+      << "silence, the check's period, and slack for a loaded machine";
+  EXPECT_EQ(states.front(), State::kConnecting);
+  peer.Kill();
+  ASSERT_TRUE(PumpUntil([&] { return states.back() == State::kLost; }));
+}
+
 TEST_F(RemoteProcess, AnImporterThatConnectsGetsTheLatestStateOnceAndOthersNoRepeat) {
   const ImmutableString station = ImmutableString::CreateStatic("test.remote");
   const std::string exporter = Endpoint("state");

@@ -101,6 +101,13 @@ struct NodeOptions {
   /// @}
   /// How long the destructor waits for queued messages to leave.
   int mLingerMilliseconds = 200;
+  /// How often this node tells its importers that its main thread runs (a
+  /// heartbeat goes out only once the main thread has run the call the last
+  /// one posted).
+  int mHeartbeatMilliseconds = 500;
+  /// How long an import may hear nothing, heartbeats included, before its
+  /// exporter is declared suspect. Declared within this plus a quarter of it.
+  int mSuspectAfterMilliseconds = 3000;
   /// The codec of this node's messages; null: MakeMsgPackCodec().
   std::shared_ptr<const WireCodec> mCodec;
 };
@@ -140,11 +147,14 @@ struct ImportersChanged : MessageImpl<ImportersChanged> {
 
 /// Broadcast on an imported station, on the importing node's main thread,
 /// when the connection to the node it is imported from changes: kConnecting
-/// when the import starts, kLive once connected (again), kLost when the
-/// connection is gone. A lost node is sought again every 50 ms, and a node
-/// restarted at the same endpoint is live again as soon as it has bound it.
+/// when the import starts, kLive once connected (again), kSuspect when
+/// nothing came for NodeOptions::mSuspectAfterMilliseconds, not even a
+/// heartbeat (its main thread is stuck, or the process is stopped), kLive
+/// again when something comes, kLost when the connection is gone. A lost
+/// node is sought again every 50 ms, and a node restarted at the same
+/// endpoint is live again as soon as it has bound it.
 struct PeerState : MessageImpl<PeerState> {
-  enum class State : std::int32_t { kConnecting, kLive, kLost };
+  enum class State : std::int32_t { kConnecting, kLive, kSuspect, kLost };
   State mState = State::kConnecting;
   std::string mEndpoint;  ///< the endpoint imported from
 };
