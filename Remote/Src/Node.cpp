@@ -149,10 +149,12 @@ private:
   void Enqueue(ExportListener& ioListener, const Message& inMessage);
   void Wake() noexcept;
   void Run(std::promise<void>& outBound) noexcept;
-  void RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher);
+  void RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher, zmq::socket_t& ioAuthenticator);
   void Send(zmq::socket_t& ioPublisher, std::deque<Outgoing>& ioOutgoing);
   void Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommands);
   void HearSubscriptions(zmq::socket_t& ioPublisher);
+  void Authenticate(zmq::socket_t& ioHandler);
+  bool IsAllowed(const std::string& inAddress) const;
   void SendSnapshot(zmq::socket_t& ioPublisher, const std::string& inTopic);
   bool Admit(const ImmutableString& inStationID, const Envelope& inEnvelope);
   void AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters);
@@ -172,10 +174,11 @@ private:
   const std::uint64_t mOrigin;
   std::string mEndpoint;  // fixed once the constructor returns
   int mWakeDescriptor = -1;  // an eventfd: written by any thread, read by the I/O thread
+  std::vector<uid_t> mAllowedUsers;  // fixed by the constructor
 
   struct Counters {
     std::atomic<std::uint64_t> mExported{0}, mExportDropped{0}, mImported{0}, mLost{0}, mUnknown{0},
-        mMalformed{0}, mDuplicates{0}, mImportErrors{0};
+        mMalformed{0}, mDuplicates{0}, mImportErrors{0}, mRefusedPeers{0};
   } mCounters;
 
   mutable std::mutex mQueueMutex;
@@ -210,6 +213,8 @@ Node::Impl::Impl(NodeOptions inOptions)
   const std::string name = mOptions.mName.empty() ? "tarn-" + std::to_string(::getpid()) : mOptions.mName;
   TARN_REMOTE_CONTRACT_CHECK(IsValidNodeName(name), "Tarn::Remote::Node::Node");
   mEndpoint = !mOptions.mEndpoint.empty() ? mOptions.mEndpoint : Node::DefaultEndpoint(name);
+  mAllowedUsers = mOptions.mAllowedUsers;
+  if (mAllowedUsers.empty()) mAllowedUsers.push_back(::geteuid());
   mWakeDescriptor = ::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
   if (mWakeDescriptor < 0) throw std::runtime_error(std::string("Tarn::Remote: eventfd: ") + std::strerror(errno));
   std::promise<void> bound;
@@ -282,6 +287,7 @@ NodeStats Node::Impl::GetStats() const noexcept {
   stats.mMalformed = mCounters.mMalformed.load(std::memory_order_relaxed);
   stats.mDuplicates = mCounters.mDuplicates.load(std::memory_order_relaxed);
   stats.mImportErrors = mCounters.mImportErrors.load(std::memory_order_relaxed);
+  stats.mRefusedPeers = mCounters.mRefusedPeers.load(std::memory_order_relaxed);
   return stats;
 }
 
@@ -329,7 +335,14 @@ void Node::Impl::Run(std::promise<void>& outBound) noexcept {
   zmq::context_t context(1);
   bool announced = false;
   try {
+    // The authentication handler of this context: every importer's
+    // connection is put to it (the publisher names a domain) before any
+    // message reaches the importer.
+    zmq::socket_t authenticator(context, zmq::socket_type::rep);
+    authenticator.set(zmq::sockopt::linger, 0);
+    authenticator.bind("inproc://zeromq.zap.01");
     zmq::socket_t publisher(context, zmq::socket_type::xpub);
+    publisher.set(zmq::sockopt::zap_domain, "tarn.remote");
     publisher.set(zmq::sockopt::sndhwm, mOptions.mSendHighWaterMark);
     publisher.set(zmq::sockopt::linger, mOptions.mLingerMilliseconds);
     // Every subscription and unsubscription comes up, one per importer, so
@@ -345,7 +358,7 @@ void Node::Impl::Run(std::promise<void>& outBound) noexcept {
     }
     outBound.set_value();
     announced = true;
-    RunLoop(context, publisher);
+    RunLoop(context, publisher, authenticator);
   } catch (...) {
     // Before the bind, the constructor throws this; after it, only storage
     // running out ends up here, and the node's thread stops.
@@ -354,7 +367,7 @@ void Node::Impl::Run(std::promise<void>& outBound) noexcept {
   mImports.clear();
 }
 
-void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) {
+void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher, zmq::socket_t& ioAuthenticator) {
   std::vector<zmq::pollitem_t> items;
   std::vector<ImportSocket*> polled;
   for (;;) {
@@ -362,6 +375,7 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) 
     polled.clear();
     items.push_back(zmq::pollitem_t{nullptr, mWakeDescriptor, ZMQ_POLLIN, 0});
     items.push_back(zmq::pollitem_t{ioPublisher.handle(), 0, ZMQ_POLLIN, 0});
+    items.push_back(zmq::pollitem_t{ioAuthenticator.handle(), 0, ZMQ_POLLIN, 0});
     for (auto& [endpoint, import] : mImports) {
       items.push_back(zmq::pollitem_t{import.mSocket.handle(), 0, ZMQ_POLLIN, 0});
       items.push_back(zmq::pollitem_t{import.mMonitor.handle(), 0, ZMQ_POLLIN, 0});
@@ -391,9 +405,10 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher) 
       if (stopping) return;
     }
     if ((items[1].revents & ZMQ_POLLIN) != 0) HearSubscriptions(ioPublisher);
+    if ((items[2].revents & ZMQ_POLLIN) != 0) Authenticate(ioAuthenticator);
     for (std::size_t i = 0; i < polled.size(); ++i) {
-      if ((items[2 * i + 2].revents & ZMQ_POLLIN) != 0) HearImports(*polled[i]);
-      if ((items[2 * i + 3].revents & ZMQ_POLLIN) != 0) HearMonitor(*polled[i]);
+      if ((items[2 * i + 3].revents & ZMQ_POLLIN) != 0) HearImports(*polled[i]);
+      if ((items[2 * i + 4].revents & ZMQ_POLLIN) != 0) HearMonitor(*polled[i]);
     }
   }
 }
@@ -494,6 +509,45 @@ void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommand
       AnnouncePeer(found->second, command.mStationID);
     }
   }
+}
+
+// One request of the authentication protocol: version, request ID, domain,
+// address, routing ID, mechanism and the mechanism's credentials; answered
+// with version, request ID, status code and text, user ID and metadata.
+void Node::Impl::Authenticate(zmq::socket_t& ioHandler) {
+  std::vector<zmq::message_t> request;
+  do {
+    request.emplace_back();
+    if (!ioHandler.recv(request.back(), zmq::recv_flags::dontwait)) return;
+  } while (request.back().more() && request.size() < 16);
+  while (request.back().more()) (void)ioHandler.recv(request.back(), zmq::recv_flags::none);
+  const bool allowed = request.size() >= 6 && IsAllowed(request[3].to_string());
+  if (!allowed) mCounters.mRefusedPeers.fetch_add(1, std::memory_order_relaxed);
+  const std::string version = "1.0";
+  const std::string requestID = request.size() >= 2 ? request[1].to_string() : std::string();
+  const std::string code = allowed ? "200" : "400";
+  const std::string text = allowed ? "OK" : "not an allowed user";
+  ioHandler.send(zmq::buffer(version), zmq::send_flags::sndmore);
+  ioHandler.send(zmq::buffer(requestID), zmq::send_flags::sndmore);
+  ioHandler.send(zmq::buffer(code), zmq::send_flags::sndmore);
+  ioHandler.send(zmq::buffer(text), zmq::send_flags::sndmore);
+  ioHandler.send(zmq::str_buffer(""), zmq::send_flags::sndmore);
+  ioHandler.send(zmq::str_buffer(""), zmq::send_flags::none);
+}
+
+// A Unix socket peer's address ends in ":UID:GID:PID", which libzmq reads
+// from the socket (SO_PEERCRED); the kernel vouches for it. A peer without
+// one (over tcp) has nothing to check.
+bool Node::Impl::IsAllowed(const std::string& inAddress) const {
+  const std::size_t pid = inAddress.rfind(':');
+  const std::size_t gid = pid == std::string::npos || pid == 0 ? std::string::npos : inAddress.rfind(':', pid - 1);
+  const std::size_t uid = gid == std::string::npos || gid == 0 ? std::string::npos : inAddress.rfind(':', gid - 1);
+  if (uid == std::string::npos) return mOptions.mAcceptPeersWithoutCredentials;
+  const std::string text = inAddress.substr(uid + 1, gid - uid - 1);
+  if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos) return false;
+  const unsigned long user = std::stoul(text);
+  const std::vector<uid_t>& allowed = mAllowedUsers;
+  return std::find(allowed.begin(), allowed.end(), static_cast<uid_t>(user)) != allowed.end();
 }
 
 void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {

@@ -6,6 +6,8 @@
 //   twoway OWN PARENT COUNT         exports and imports test.twoway, answers
 //                                   each of the parent's COUNT ticks with one
 //                                   of its own, then reports the echoes heard
+//   import OWN ENDPOINT             imports test.remote; exit status 0 once
+//                                   live, 3 when not live within 500 ms
 //   raw ENDPOINT                    a bare publishing socket sending test.raw
 //                                   input no node would send
 //   serve ENDPOINT TAG              exports test.remote, broadcasts a tick
@@ -145,6 +147,18 @@ int State(const std::string& inEndpoint) {
   return 2;
 }
 
+int Import(const std::string& inOwn, const std::string& inEndpoint) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  Tarn::Remote::NodeOptions options;
+  options.mEndpoint = inOwn;
+  Tarn::Remote::Node node(options);
+  bool live = false;
+  const Tarn::Registration heard = Tarn::Subscribe<Tarn::Remote::PeerState>(
+      station, [&](const Tarn::Remote::PeerState& inState) { live = inState.mState == Tarn::Remote::PeerState::State::kLive; });
+  node.Import(station, inEndpoint);
+  return PumpUntil([&] { return live; }, std::chrono::milliseconds(500)) ? 0 : 3;
+}
+
 int Raw(const std::string& inEndpoint) {
   using Tarn::Remote::WireType;
   zmq::context_t context(1);
@@ -206,6 +220,8 @@ int main(int inArgc, char** inArgv) {
     status = Serve(inArgv[2], std::atoi(inArgv[3]), mode == "hang");
   } else if (mode == "state" && inArgc == 3) {
     status = State(inArgv[2]);
+  } else if (mode == "import" && inArgc == 4) {
+    status = Import(inArgv[2], inArgv[3]);
   } else if (mode == "raw" && inArgc == 3) {
     status = Raw(inArgv[2]);
   }

@@ -10,10 +10,13 @@
 
 #include <poll.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
+#include <cstdlib>
 #include <string>
 #include <thread>
 #include <vector>
@@ -29,7 +32,8 @@ using Tarn::Remote::RemoteLoss;
 // with a deadline, else it is killed. Its standard output is a pipe to us.
 class Peer {
 public:
-  explicit Peer(std::vector<std::string> inArguments) {
+  // As the user inUser (0: ours), which needs root.
+  explicit Peer(std::vector<std::string> inArguments, uid_t inUser = 0) {
     inArguments.insert(inArguments.begin(), TARN_REMOTE_PEER);
     std::vector<char*> argv;
     for (std::string& argument : inArguments) argv.push_back(argument.data());
@@ -39,6 +43,7 @@ public:
     mPid = ::fork();
     if (mPid == 0) {
       ::dup2(output[1], STDOUT_FILENO);
+      if (inUser != 0 && (::setgid(inUser) != 0 || ::setuid(inUser) != 0)) ::_exit(126);
       ::execv(argv[0], argv.data());
       ::_exit(127);
     }
@@ -279,6 +284,38 @@ TEST_F(RemoteProcess, AnImporterThatConnectsGetsTheLatestStateOnceAndOthersNoRep
   EXPECT_EQ(lost, 0u) << "what was broadcast before an importer came is not its loss";
   EXPECT_EQ(first.GetStats().mImported, 3u);
   EXPECT_EQ(second.GetStats().mImported, 2u);
+}
+
+TEST_F(RemoteProcess, AnImporterOfAnotherUserIsRefused) {
+  if (::geteuid() != 0) GTEST_SKIP() << "starting a child as another user needs root";
+  constexpr uid_t kNobody = 65534;
+  // A directory open to all, so that only the node's own check stands
+  // between the other user and the station.
+  const std::string directory = "/tmp/tarn-remote-open-" + std::to_string(::getpid());
+  ASSERT_EQ(::mkdir(directory.c_str(), 0777), 0);
+  ::chmod(directory.c_str(), 0777);
+  const std::string exporter = "ipc://" + directory + "/exporter";
+  std::uint32_t importers = 0;  // the most at once
+  {
+    Tarn::Remote::NodeOptions options;
+    options.mEndpoint = exporter;
+    Tarn::Remote::Node node(options);
+    ::chmod((directory + "/exporter").c_str(), 0777);
+    const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+    const Tarn::Registration counted = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
+        station, [&](const Tarn::Remote::ImportersChanged& inChanged) {
+          importers = std::max(importers, inChanged.mImporters);
+        });
+    node.Export(station);
+    Peer other({"import", "ipc://" + directory + "/other", exporter}, kNobody);
+    EXPECT_EQ(other.Wait(), 3) << "not live";
+    EXPECT_GT(node.GetStats().mRefusedPeers, 0u);
+    Peer same({"import", "ipc://" + directory + "/same", exporter});
+    EXPECT_EQ(same.Wait(), 0) << "live";
+    PumpUntil([&] { return importers > 0; });
+  }
+  EXPECT_EQ(importers, 1u) << "at most one importer at a time: only the one of our user subscribed";
+  std::system(("rm -rf " + directory).c_str());
 }
 
 }  // namespace

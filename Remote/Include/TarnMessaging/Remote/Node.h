@@ -40,10 +40,17 @@
 /// of what is broadcast before an importer is connected (wait for an
 /// ImportersChanged on the exporting side), and order between origins.
 ///
-/// Endpoints: by default a node publishes on an ipc:// endpoint named after
-/// it, in a directory that only this user may enter (mode 0700, owned by
-/// the user): $XDG_RUNTIME_DIR/tarn-remote, or /tmp/tarn-remote-UID without
-/// one. A directory of another owner or mode is refused.
+/// Endpoints and peers: by default a node publishes on an ipc:// endpoint
+/// named after it, in a directory that only this user may enter (mode 0700,
+/// owned by the user): $XDG_RUNTIME_DIR/tarn-remote, or /tmp/tarn-remote-UID
+/// without one. A directory of another owner or mode is refused. Whatever
+/// the endpoint, every connection to it is authenticated before it hears
+/// anything: over a Unix socket the kernel tells the peer's user
+/// (SO_PEERCRED, through ZeroMQ's authentication handler), which must be in
+/// NodeOptions::mAllowedUsers (by default this process's user only); a peer
+/// without credentials (over tcp) is refused unless
+/// NodeOptions::mAcceptPeersWithoutCredentials. Refusals are counted
+/// (NodeStats::mRefusedPeers).
 ///
 /// Threading: one I/O thread per node owns every socket; sockets are never
 /// touched by another thread. Export, Import, GetStats and the accessors may
@@ -76,6 +83,9 @@
 #include <memory>
 #include <string>
 #include <utility>
+#include <vector>
+
+#include <sys/types.h>
 
 namespace Tarn::Remote {
 
@@ -108,6 +118,11 @@ struct NodeOptions {
   /// How long an import may hear nothing, heartbeats included, before its
   /// exporter is declared suspect. Declared within this plus a quarter of it.
   int mSuspectAfterMilliseconds = 3000;
+  /// The users whose processes may import from this node, by user ID;
+  /// empty: this process's effective user only.
+  std::vector<uid_t> mAllowedUsers;
+  /// Whether a peer whose user cannot be known (over tcp) may import.
+  bool mAcceptPeersWithoutCredentials = false;
   /// The codec of this node's messages; null: MakeMsgPackCodec().
   std::shared_ptr<const WireCodec> mCodec;
 };
@@ -122,6 +137,7 @@ struct NodeStats {
   std::uint64_t mMalformed = 0;       ///< refused: bytes that are not a message
   std::uint64_t mDuplicates = 0;      ///< dropped: a sequence number already seen
   std::uint64_t mImportErrors = 0;    ///< imports whose endpoint could not be connected
+  std::uint64_t mRefusedPeers = 0;    ///< connections to this node's endpoint refused: not an allowed user
 };
 
 /// Reported on a station for every loss an importing node detects, before
