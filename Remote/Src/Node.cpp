@@ -84,7 +84,7 @@ public:
   ~Impl();
 
   void Export(const ImmutableString& inStationID);
-  void Import(const ImmutableString& inStationID, const std::string& inEndpoint);
+  void Import(const ImmutableString& inStationID, const std::string& inEndpoint, const std::string& inServerKey);
   NodeStats GetStats() const noexcept;
 
   const std::string& Endpoint() const noexcept { return mEndpoint; }
@@ -132,6 +132,7 @@ private:
     enum class Kind { kExport, kImport } mKind;
     ImmutableString mStationID;
     std::string mEndpoint;
+    std::string mServerKey;  // CURVE, when not empty
   };
 
   // I/O thread only.
@@ -257,7 +258,7 @@ void Node::Impl::Export(const ImmutableString& inStationID) {
   }
   {
     std::lock_guard<std::mutex> lock(mQueueMutex);
-    mCommands.push_back(Command{Command::Kind::kExport, inStationID, std::string()});
+    mCommands.push_back(Command{Command::Kind::kExport, inStationID, std::string(), std::string()});
   }
   Wake();
   // Attached outside our locks: AddListener may report an unregistered
@@ -265,14 +266,17 @@ void Node::Impl::Export(const ImmutableString& inStationID) {
   StationUtils::AddListener(inStationID, listener);
 }
 
-void Node::Impl::Import(const ImmutableString& inStationID, const std::string& inEndpoint) {
+void Node::Impl::Import(const ImmutableString& inStationID, const std::string& inEndpoint,
+                        const std::string& inServerKey) {
   const bool known = inEndpoint.rfind("ipc://", 0) == 0 || inEndpoint.rfind("tcp://", 0) == 0;
+  const bool curve = inServerKey.empty() || (inServerKey.size() == 40 && !mOptions.mCurveSecretKey.empty());
   TARN_REMOTE_CONTRACT_CHECK(!inStationID.empty(), "Tarn::Remote::Node::Import");
   TARN_REMOTE_CONTRACT_CHECK(known, "Tarn::Remote::Node::Import");
-  if (inStationID.empty() || !known) return;
+  TARN_REMOTE_CONTRACT_CHECK(curve, "Tarn::Remote::Node::Import");
+  if (inStationID.empty() || !known || !curve) return;
   {
     std::lock_guard<std::mutex> lock(mQueueMutex);
-    mCommands.push_back(Command{Command::Kind::kImport, inStationID, inEndpoint});
+    mCommands.push_back(Command{Command::Kind::kImport, inStationID, inEndpoint, inServerKey});
   }
   Wake();
 }
@@ -343,6 +347,10 @@ void Node::Impl::Run(std::promise<void>& outBound) noexcept {
     authenticator.bind("inproc://zeromq.zap.01");
     zmq::socket_t publisher(context, zmq::socket_type::xpub);
     publisher.set(zmq::sockopt::zap_domain, "tarn.remote");
+    if (!mOptions.mCurveSecretKey.empty()) {
+      publisher.set(zmq::sockopt::curve_server, 1);
+      publisher.set(zmq::sockopt::curve_secretkey, mOptions.mCurveSecretKey);
+    }
     publisher.set(zmq::sockopt::sndhwm, mOptions.mSendHighWaterMark);
     publisher.set(zmq::sockopt::linger, mOptions.mLingerMilliseconds);
     // Every subscription and unsubscription comes up, one per importer, so
@@ -350,6 +358,7 @@ void Node::Impl::Run(std::promise<void>& outBound) noexcept {
     publisher.set(zmq::sockopt::xpub_verboser, 1);
     try {
       publisher.bind(mEndpoint);
+      mEndpoint = publisher.get(zmq::sockopt::last_endpoint);  // read by the constructor once told
     } catch (const zmq::error_t& inError) {
       announced = true;
       outBound.set_exception(std::make_exception_ptr(
@@ -483,6 +492,11 @@ void Node::Impl::Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommand
         socket.set(zmq::sockopt::linger, 0);
         // A restarted exporter is found again within this, plus its start.
         socket.set(zmq::sockopt::reconnect_ivl, kReconnectMilliseconds);
+        if (!command.mServerKey.empty()) {
+          socket.set(zmq::sockopt::curve_serverkey, command.mServerKey);
+          socket.set(zmq::sockopt::curve_publickey, mOptions.mCurvePublicKey);
+          socket.set(zmq::sockopt::curve_secretkey, mOptions.mCurveSecretKey);
+        }
         const std::string monitorAddress =
             "inproc://tarn-remote-monitor-" + std::to_string(mOrigin) + "-" + std::to_string(++mMonitors);
         if (zmq_socket_monitor(socket.handle(), monitorAddress.c_str(),
@@ -521,7 +535,16 @@ void Node::Impl::Authenticate(zmq::socket_t& ioHandler) {
     if (!ioHandler.recv(request.back(), zmq::recv_flags::dontwait)) return;
   } while (request.back().more() && request.size() < 16);
   while (request.back().more()) (void)ioHandler.recv(request.back(), zmq::recv_flags::none);
-  const bool allowed = request.size() >= 6 && IsAllowed(request[3].to_string());
+  bool allowed = false;
+  if (request.size() >= 7 && request[5].to_string() == "CURVE" && request[6].size() == 32) {
+    // The client's long-term public key, proven by the handshake.
+    char text[41] = {};
+    zmq_z85_encode(text, static_cast<const std::uint8_t*>(request[6].data()), 32);
+    const std::vector<std::string>& keys = mOptions.mAllowedCurveKeys;
+    allowed = std::find(keys.begin(), keys.end(), std::string(text)) != keys.end();
+  } else if (request.size() >= 6 && request[5].to_string() == "NULL") {
+    allowed = IsAllowed(request[3].to_string());
+  }
   if (!allowed) mCounters.mRefusedPeers.fetch_add(1, std::memory_order_relaxed);
   const std::string version = "1.0";
   const std::string requestID = request.size() >= 2 ? request[1].to_string() : std::string();
@@ -729,11 +752,23 @@ void Node::Impl::Deliver(const ImmutableString& inStationID, std::shared_ptr<con
       0);
 }
 
+std::pair<std::string, std::string> Node::MakeCurveKeyPair() {
+  char publicKey[41] = {};
+  char secretKey[41] = {};
+  if (zmq_curve_keypair(publicKey, secretKey) != 0) {
+    throw std::runtime_error("Tarn::Remote: libzmq cannot make CURVE keys (built without CURVE)");
+  }
+  return {publicKey, secretKey};
+}
+
 Node::Node(NodeOptions inOptions) : mImpl(std::make_unique<Impl>(std::move(inOptions))) {}
 Node::~Node() = default;
 void Node::Export(const ImmutableString& inStationID) { mImpl->Export(inStationID); }
 void Node::Import(const ImmutableString& inStationID, const std::string& inEndpoint) {
-  mImpl->Import(inStationID, inEndpoint);
+  mImpl->Import(inStationID, inEndpoint, std::string());
+}
+void Node::Import(const ImmutableString& inStationID, const std::string& inEndpoint, const std::string& inServerKey) {
+  mImpl->Import(inStationID, inEndpoint, inServerKey);
 }
 const std::string& Node::GetEndpoint() const noexcept { return mImpl->Endpoint(); }
 std::uint64_t Node::GetOrigin() const noexcept { return mImpl->Origin(); }

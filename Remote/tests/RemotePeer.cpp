@@ -6,8 +6,10 @@
 //   twoway OWN PARENT COUNT         exports and imports test.twoway, answers
 //                                   each of the parent's COUNT ticks with one
 //                                   of its own, then reports the echoes heard
-//   import OWN ENDPOINT             imports test.remote; exit status 0 once
-//                                   live, 3 when not live within 500 ms
+//   import OWN ENDPOINT [PUBLIC SECRET SERVER]
+//                                   imports test.remote (over CURVE with the
+//                                   keys given); exit status 0 once a tick
+//                                   came, 3 when not live within 500 ms
 //   raw ENDPOINT                    a bare publishing socket sending test.raw
 //                                   input no node would send
 //   serve ENDPOINT TAG              exports test.remote, broadcasts a tick
@@ -147,16 +149,27 @@ int State(const std::string& inEndpoint) {
   return 2;
 }
 
-int Import(const std::string& inOwn, const std::string& inEndpoint) {
+int Import(char** inArguments, bool inCurve) {
   const ImmutableString station = ImmutableString::CreateStatic("test.remote");
   Tarn::Remote::NodeOptions options;
-  options.mEndpoint = inOwn;
+  options.mEndpoint = inArguments[0];
+  if (inCurve) {
+    options.mCurvePublicKey = inArguments[2];
+    options.mCurveSecretKey = inArguments[3];
+  }
   Tarn::Remote::Node node(options);
   bool live = false;
+  bool ticked = false;
   const Tarn::Registration heard = Tarn::Subscribe<Tarn::Remote::PeerState>(
       station, [&](const Tarn::Remote::PeerState& inState) { live = inState.mState == Tarn::Remote::PeerState::State::kLive; });
-  node.Import(station, inEndpoint);
-  return PumpUntil([&] { return live; }, std::chrono::milliseconds(500)) ? 0 : 3;
+  const Tarn::Registration tick = Tarn::Subscribe<Tick>(station, [&](const Tick&) { ticked = true; });
+  if (inCurve) {
+    node.Import(station, inArguments[1], inArguments[4]);
+  } else {
+    node.Import(station, inArguments[1]);
+  }
+  if (!PumpUntil([&] { return live; }, std::chrono::milliseconds(500))) return 3;
+  return PumpUntil([&] { return ticked; }) ? 0 : 2;
 }
 
 int Raw(const std::string& inEndpoint) {
@@ -220,8 +233,8 @@ int main(int inArgc, char** inArgv) {
     status = Serve(inArgv[2], std::atoi(inArgv[3]), mode == "hang");
   } else if (mode == "state" && inArgc == 3) {
     status = State(inArgv[2]);
-  } else if (mode == "import" && inArgc == 4) {
-    status = Import(inArgv[2], inArgv[3]);
+  } else if (mode == "import" && (inArgc == 4 || inArgc == 7)) {
+    status = Import(inArgv + 2, inArgc == 7);
   } else if (mode == "raw" && inArgc == 3) {
     status = Raw(inArgv[2]);
   }

@@ -311,11 +311,41 @@ TEST_F(RemoteProcess, AnImporterOfAnotherUserIsRefused) {
     EXPECT_EQ(other.Wait(), 3) << "not live";
     EXPECT_GT(node.GetStats().mRefusedPeers, 0u);
     Peer same({"import", "ipc://" + directory + "/same", exporter});
-    EXPECT_EQ(same.Wait(), 0) << "live";
-    PumpUntil([&] { return importers > 0; });
+    ASSERT_TRUE(PumpUntil([&] { return importers > 0; }));
+    Tarn::StationUtils::BroadcastMessage(station, Tick());
+    EXPECT_EQ(same.Wait(), 0) << "heard";
   }
   EXPECT_EQ(importers, 1u) << "at most one importer at a time: only the one of our user subscribed";
   std::system(("rm -rf " + directory).c_str());
+}
+
+TEST_F(RemoteProcess, OverTcpWithCurveOnlyAPeerWithAnAllowedKeyHearsTheStation) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  const auto [serverPublic, serverSecret] = Tarn::Remote::Node::MakeCurveKeyPair();
+  const auto [allowedPublic, allowedSecret] = Tarn::Remote::Node::MakeCurveKeyPair();
+  const auto [strangerPublic, strangerSecret] = Tarn::Remote::Node::MakeCurveKeyPair();
+  Tarn::Remote::NodeOptions options;
+  options.mEndpoint = "tcp://127.0.0.1:*";
+  options.mCurvePublicKey = serverPublic;
+  options.mCurveSecretKey = serverSecret;
+  options.mAllowedCurveKeys = {allowedPublic};
+  Tarn::Remote::Node node(options);
+  ASSERT_EQ(node.GetEndpoint().rfind("tcp://127.0.0.1:", 0), 0u);
+  EXPECT_NE(node.GetEndpoint(), options.mEndpoint) << "the port taken";
+  std::uint32_t importers = 0;
+  const Tarn::Registration counted = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
+      station, [&](const Tarn::Remote::ImportersChanged& inChanged) { importers = inChanged.mImporters; });
+  node.Export(station);
+  const auto importer = [&](const char* inRole, const std::string& inPublic, const std::string& inSecret) {
+    return std::vector<std::string>{"import", Endpoint(inRole), node.GetEndpoint(), inPublic, inSecret, serverPublic};
+  };
+  Peer stranger(importer("stranger", strangerPublic, strangerSecret));
+  EXPECT_EQ(stranger.Wait(), 3) << "not live";
+  EXPECT_GT(node.GetStats().mRefusedPeers, 0u);
+  Peer allowed(importer("allowed", allowedPublic, allowedSecret));
+  ASSERT_TRUE(PumpUntil([&] { return importers > 0; }));
+  Tarn::StationUtils::BroadcastMessage(station, Tick());
+  EXPECT_EQ(allowed.Wait(), 0) << "heard";
 }
 
 }  // namespace

@@ -47,8 +47,11 @@
 /// the endpoint, every connection to it is authenticated before it hears
 /// anything: over a Unix socket the kernel tells the peer's user
 /// (SO_PEERCRED, through ZeroMQ's authentication handler), which must be in
-/// NodeOptions::mAllowedUsers (by default this process's user only); a peer
-/// without credentials (over tcp) is refused unless
+/// NodeOptions::mAllowedUsers (by default this process's user only). Across
+/// machines, over tcp, give the node a CURVE key pair: its connections are
+/// then encrypted, and a peer must present a key of
+/// NodeOptions::mAllowedCurveKeys. A tcp peer without CURVE has no
+/// credentials and is refused unless
 /// NodeOptions::mAcceptPeersWithoutCredentials. Refusals are counted
 /// (NodeStats::mRefusedPeers).
 ///
@@ -121,8 +124,20 @@ struct NodeOptions {
   /// The users whose processes may import from this node, by user ID;
   /// empty: this process's effective user only.
   std::vector<uid_t> mAllowedUsers;
-  /// Whether a peer whose user cannot be known (over tcp) may import.
+  /// Whether a peer whose user cannot be known (over tcp, without CURVE)
+  /// may import.
   bool mAcceptPeersWithoutCredentials = false;
+  /// This node's CURVE key pair (Node::MakeCurveKeyPair, Z85 text), for
+  /// tcp across machines: with it, this node's endpoint encrypts and
+  /// authenticates every connection (a peer must know mCurvePublicKey and be
+  /// among mAllowedCurveKeys), and its imports given a server key present
+  /// this pair. Empty: no CURVE.
+  /// @{
+  std::string mCurvePublicKey;
+  std::string mCurveSecretKey;
+  /// @}
+  /// The public keys (Z85) of the peers that may import over CURVE.
+  std::vector<std::string> mAllowedCurveKeys;
   /// The codec of this node's messages; null: MakeMsgPackCodec().
   std::shared_ptr<const WireCodec> mCodec;
 };
@@ -201,8 +216,19 @@ public:
   /// Preconditions: !inStationID.empty(), inEndpoint starts with "ipc://" or
   /// "tcp://".
   void Import(const kivcore::utility::ImmutableString& inStationID, const std::string& inEndpoint);
+  /// The same from a node whose endpoint uses CURVE, with that node's public
+  /// key (Z85); this node presents its own key pair, which must be set.
+  /// Preconditions as above, and inServerKey.size() == 40,
+  /// !NodeOptions::mCurveSecretKey.empty().
+  void Import(const kivcore::utility::ImmutableString& inStationID, const std::string& inEndpoint,
+              const std::string& inServerKey);
 
-  /// The endpoint exported stations are published on, for importers.
+  /// A new CURVE key pair, public then secret, as Z85 text (40 characters
+  /// each). Throws std::runtime_error when libzmq was built without CURVE.
+  static std::pair<std::string, std::string> MakeCurveKeyPair();
+
+  /// The endpoint exported stations are published on, for importers (a tcp
+  /// endpoint bound to port 0 or "*" names the port taken).
   const std::string& GetEndpoint() const noexcept;
   /// This node's origin ID: random, never 0, different for every node.
   std::uint64_t GetOrigin() const noexcept;
