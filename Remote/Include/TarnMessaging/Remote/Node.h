@@ -158,13 +158,14 @@ struct NodeStats {
 /// Reported on a station for every loss an importing node detects, before
 /// the next message of that origin.
 struct RemoteLoss : MessageImpl<RemoteLoss> {
+  /// Why messages were lost.
   enum class Reason : std::int32_t {
     kGap,             ///< sequence numbers skipped: lost on the way (a queue or a high-water mark)
     kUnknownType,     ///< a wire name not registered here (mWireName)
     kUnknownVersion,  ///< a version of mWireName other than this process's
     kMalformed,       ///< bytes that are not a message
   };
-  Reason mReason = Reason::kGap;
+  Reason mReason = Reason::kGap;  ///< why
   std::uint64_t mOrigin = 0;  ///< the sending node; 0 when not even the envelope could be read
   std::uint64_t mCount = 0;   ///< messages lost
   std::string mWireName;      ///< for kUnknownType and kUnknownVersion
@@ -173,7 +174,7 @@ struct RemoteLoss : MessageImpl<RemoteLoss> {
 /// Broadcast on an exported station, on the exporting node's main thread,
 /// when the number of importers subscribed to it changes.
 struct ImportersChanged : MessageImpl<ImportersChanged> {
-  std::uint32_t mImporters = 0;
+  std::uint32_t mImporters = 0;  ///< importers subscribed to the station now
 };
 
 /// Broadcast on an imported station, on the importing node's main thread,
@@ -185,8 +186,9 @@ struct ImportersChanged : MessageImpl<ImportersChanged> {
 /// node is sought again every 50 ms, and a node restarted at the same
 /// endpoint is live again as soon as it has bound it.
 struct PeerState : MessageImpl<PeerState> {
+  /// The connection's state, as described above.
   enum class State : std::int32_t { kConnecting, kLive, kSuspect, kLost };
-  State mState = State::kConnecting;
+  State mState = State::kConnecting;  ///< the state entered
   std::string mEndpoint;  ///< the endpoint imported from
 };
 
@@ -218,8 +220,8 @@ public:
   void Import(const kivcore::utility::ImmutableString& inStationID, const std::string& inEndpoint);
   /// The same from a node whose endpoint uses CURVE, with that node's public
   /// key (Z85); this node presents its own key pair, which must be set.
-  /// Preconditions as above, and inServerKey.size() == 40,
-  /// !NodeOptions::mCurveSecretKey.empty().
+  /// Preconditions as above, inServerKey.size() == 40, and a CURVE key pair
+  /// in this node's options.
   void Import(const kivcore::utility::ImmutableString& inStationID, const std::string& inEndpoint,
               const std::string& inServerKey);
 

@@ -66,11 +66,11 @@ enum class DecodeStatus {
 
 /// The result of WireCodec::Decode.
 struct Decoded {
-  DecodeStatus mStatus = DecodeStatus::kMalformed;
+  DecodeStatus mStatus = DecodeStatus::kMalformed;  ///< what the bytes were
   bool mHasEnvelope = false;  ///< mEnvelope was read (every status but some kMalformed)
-  Envelope mEnvelope;
+  Envelope mEnvelope;         ///< the sender and sequence, when mHasEnvelope
   std::string mWireName;      ///< empty when it was not read
-  std::uint32_t mVersion = 0;
+  std::uint32_t mVersion = 0;  ///< the version read with mWireName
   std::unique_ptr<Message> mMessage;  ///< set for kDecoded only
 };
 

@@ -56,12 +56,17 @@ namespace Tarn::Remote {
 /// order, after Begin with the number of fields.
 class TARN_REMOTE_API FieldWriter {
 public:
+  /// First, with the number of fields that follow.
   virtual void Begin(std::size_t inFieldCount) = 0;
+  /// One field, by its name (a static string) and value: a signed integer
+  /// or enum, an unsigned integer, a floating-point number, a bool, a string.
+  /// @{
   virtual void Signed(const char* inName, std::int64_t inValue) = 0;
   virtual void Unsigned(const char* inName, std::uint64_t inValue) = 0;
   virtual void Real(const char* inName, double inValue) = 0;
   virtual void Boolean(const char* inName, bool inValue) = 0;
   virtual void Text(const char* inName, const std::string& inValue) = 0;
+  /// @}
 
 protected:
   ~FieldWriter() = default;
@@ -73,11 +78,15 @@ protected:
 /// reader refuse the whole message.
 class TARN_REMOTE_API FieldReader {
 public:
+  /// One field, by its name: sets ioValue from the input when the input has
+  /// the field, within [inMin, inMax] for integers.
+  /// @{
   virtual void Signed(const char* inName, std::int64_t& ioValue, std::int64_t inMin, std::int64_t inMax) = 0;
   virtual void Unsigned(const char* inName, std::uint64_t& ioValue, std::uint64_t inMax) = 0;
   virtual void Real(const char* inName, double& ioValue) = 0;
   virtual void Boolean(const char* inName, bool& ioValue) = 0;
   virtual void Text(const char* inName, std::string& ioValue) = 0;
+  /// @}
 
 protected:
   ~FieldReader() = default;
@@ -115,6 +124,7 @@ TARN_REMOTE_API const WireType* FindWireType(const char* inWireName, std::size_t
 TARN_REMOTE_API const WireType* FindWireType(MessageID inMessageID) noexcept;
 /// @}
 
+/// @cond
 namespace Detail {
 
 template <class F>
@@ -175,6 +185,7 @@ std::unique_ptr<Message> CreateWireMessage() {
 }
 
 }  // namespace Detail
+/// @endcond
 
 /// The wire description of T, which TARN_WIRE_MESSAGE declared.
 template <class T>
@@ -184,6 +195,7 @@ const WireType& WireTypeOf() {
 
 }  // namespace Tarn::Remote
 
+/// @cond
 // The field list, one macro call per field (up to 16).
 #define TARN_WIRE_DETAIL_X(x) x
 #define TARN_WIRE_DETAIL_PICK(_1, _2, _3, _4, _5, _6, _7, _8, _9, _10, _11, _12, _13, _14, _15, _16, N, ...) N
@@ -214,6 +226,7 @@ const WireType& WireTypeOf() {
   TARN_WIRE_DETAIL_X(TARN_WIRE_DETAIL_PICK(__VA_ARGS__, 16, 15, 14, 13, 12, 11, 10, 9, 8, 7, 6, 5, 4, 3, 2, 1))
 #define TARN_WIRE_DETAIL_WRITE(f) ::Tarn::Remote::Detail::WriteField(ioWriter, #f, message.f);
 #define TARN_WIRE_DETAIL_READ(f) ::Tarn::Remote::Detail::ReadField(ioReader, #f, message.f);
+/// @endcond
 
 /// Declares the message type T wire-enabled under inWireName (a string
 /// literal) and inVersion, with the listed fields; see the file comment.
@@ -227,6 +240,7 @@ const WireType& WireTypeOf() {
 #define TARN_WIRE_STATE(T, inWireName, inVersion, ...) \
   TARN_WIRE_DETAIL_DECLARE(T, inWireName, inVersion, ::Tarn::Remote::WireKind::kState, __VA_ARGS__)
 
+/// @cond
 #define TARN_WIRE_DETAIL_DECLARE(T, inWireName, inVersion, inKind, ...)                                          \
   inline const ::Tarn::Remote::WireType& TarnWireTypeOf(const T*) {                                              \
     static_assert(::Tarn::IsMessageType<T>::value, TARN_MESSAGE_TYPE_REQUIRED);                                  \
@@ -245,3 +259,4 @@ const WireType& WireTypeOf() {
     return sType;                                                                                                \
   }                                                                                                              \
   inline const bool kTarnWireRegistered_##T = ::Tarn::Remote::RegisterWireType(TarnWireTypeOf(static_cast<const T*>(nullptr)));
+/// @endcond
