@@ -168,7 +168,15 @@ private:
   void Receive(const ImmutableString& inStationID, const zmq::message_t& inBody);
   void Report(const ImmutableString& inStationID, RemoteLoss::Reason inReason, std::uint64_t inOrigin,
               std::uint64_t inCount, const std::string& inWireName);
-  void Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage);
+  // kBounded: imported messages and loss reports, which a main thread that
+  // falls behind may not hold without bound; kAlways: state changes, rare.
+  enum class Bound { kBounded, kAlways };
+  void Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage,
+               Bound inBound = Bound::kBounded);
+
+  // Reports, before anything else of theirs, the messages dropped because
+  // the main thread was behind, once it has room again.
+  void ReportDropped();
 
   const NodeOptions mOptions;
   const std::shared_ptr<const WireCodec> mCodec;
@@ -203,6 +211,10 @@ private:
   // posted: a heartbeat goes out only then, so a main thread that is stuck
   // makes its importers suspect this node while its sockets are still fine.
   const std::shared_ptr<std::atomic<bool>> mMainThreadAnswered = std::make_shared<std::atomic<bool>>(true);
+  // Imported messages and reports handed to the main thread and not yet
+  // run: incremented here, decremented by the calls themselves.
+  const std::shared_ptr<std::atomic<std::size_t>> mBacklog = std::make_shared<std::atomic<std::size_t>>(0);
+  std::map<ImmutableString, std::uint64_t> mDropped;  // since the last report, by station; I/O thread only
 
   std::thread mThread;
 };
@@ -396,6 +408,7 @@ void Node::Impl::RunLoop(zmq::context_t& ioContext, zmq::socket_t& ioPublisher, 
     const Clock::time_point now = Clock::now();
     Beat(ioPublisher, now);
     Suspect(now);
+    ReportDropped();
 
     if ((items[0].revents & ZMQ_POLLIN) != 0) {
       std::uint64_t count = 0;
@@ -603,7 +616,7 @@ void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {
 void Node::Impl::AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters) {
   auto changed = std::make_shared<ImportersChanged>();
   changed->mImporters = inImporters;
-  Deliver(inStationID, std::move(changed));
+  Deliver(inStationID, std::move(changed), Bound::kAlways);
 }
 
 void Node::Impl::HearImports(ImportSocket& ioImport) {
@@ -661,7 +674,7 @@ void Node::Impl::AnnouncePeer(const ImportSocket& inImport, const ImmutableStrin
   auto state = std::make_shared<PeerState>();
   state->mState = inImport.mState;
   state->mEndpoint = inImport.mEndpoint;
-  Deliver(inStationID, std::move(state));
+  Deliver(inStationID, std::move(state), Bound::kAlways);
 }
 
 // I/O thread: decode, account for the sequence, hand to the main thread.
@@ -737,19 +750,48 @@ void Node::Impl::Report(const ImmutableString& inStationID, RemoteLoss::Reason i
 
 // Reports and messages take the same queue, so that a report comes before
 // the message that revealed the loss.
-void Node::Impl::Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage) {
+void Node::Impl::Deliver(const ImmutableString& inStationID, std::shared_ptr<const Message> inMessage,
+                         Bound inBound) {
+  std::shared_ptr<std::atomic<std::size_t>> backlog;
+  if (inBound == Bound::kBounded) {
+    if (mBacklog->load(std::memory_order_acquire) >= mOptions.mQueueCapacity) {
+      ++mDropped[inStationID];
+      mCounters.mLost.fetch_add(1, std::memory_order_relaxed);
+      return;
+    }
+    ReportDropped();
+    mBacklog->fetch_add(1, std::memory_order_acq_rel);
+    backlog = mBacklog;
+  }
   kivcore::threads::AsyncCallFromMainThread(
-      [inStationID, inMessage] {
+      [inStationID, inMessage, backlog] {
         // Restored on the way out, also by a throw: a handler may run the
         // pending calls, and with them another delivery, from inside this one.
         struct Marked {
           const Message* mOuter = sDelivering;
-          ~Marked() { sDelivering = mOuter; }
-        } marked;
+          std::atomic<std::size_t>* mBacklog;
+          ~Marked() {
+            sDelivering = mOuter;
+            if (mBacklog != nullptr) mBacklog->fetch_sub(1, std::memory_order_acq_rel);
+          }
+        } marked{sDelivering, backlog.get()};
         sDelivering = inMessage.get();
         StationUtils::BroadcastMessage(inStationID, *inMessage);
       },
       0);
+}
+
+void Node::Impl::ReportDropped() {
+  if (mDropped.empty() || mBacklog->load(std::memory_order_acquire) >= mOptions.mQueueCapacity) return;
+  std::map<ImmutableString, std::uint64_t> dropped;
+  dropped.swap(mDropped);
+  for (const auto& [station, count] : dropped) {
+    auto report = std::make_shared<RemoteLoss>();
+    report->mReason = RemoteLoss::Reason::kMainThreadBehind;
+    report->mCount = count;
+    // Past the bound by one report per station at most.
+    Deliver(station, std::move(report), Bound::kAlways);
+  }
 }
 
 std::pair<std::string, std::string> Node::MakeCurveKeyPair() {

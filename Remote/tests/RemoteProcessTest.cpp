@@ -123,6 +123,32 @@ TEST_F(RemoteProcess, ABurstThroughAFullExportQueueArrivesInOrderAndEveryLossIsR
   EXPECT_EQ(node.GetStats().mLost, lost);
 }
 
+TEST_F(RemoteProcess, AnImporterWhoseMainThreadIsBehindHoldsABoundedBacklogAndReportsTheRest) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  const std::string exporter = Endpoint("flood");
+  Tarn::Remote::NodeOptions options("test-" + std::to_string(::getpid()) + "-behind");
+  options.mQueueCapacity = 50;
+  options.mHeartbeatMilliseconds = 20;  // the I/O thread's round, which reports once there is room
+  Tarn::Remote::Node node(options);
+  std::vector<std::uint64_t> numbers;
+  std::uint64_t behind = 0;
+  std::uint64_t gaps = 0;
+  const Tarn::Registration ticks =
+      Tarn::Subscribe<Tick>(station, [&](const Tick& inTick) { numbers.push_back(inTick.mNumber); });
+  const Tarn::Registration losses = Tarn::Subscribe<RemoteLoss>(station, [&](const RemoteLoss& inLoss) {
+    (inLoss.mReason == RemoteLoss::Reason::kMainThreadBehind ? behind : gaps) += inLoss.mCount;
+  });
+  node.Import(station, exporter);
+  constexpr std::uint64_t kCount = 2000;
+  Peer peer({"burst", exporter, std::to_string(kCount), "100000"});
+  EXPECT_EQ(peer.Wait(), 0);  // the main thread does nothing meanwhile
+  ASSERT_TRUE(PumpUntil([&] { return numbers.size() + behind + gaps == kCount + 1; }))
+      << numbers.size() << " delivered, " << behind << " reported behind, " << gaps << " in gaps";
+  EXPECT_GT(behind, 0u);
+  EXPECT_LE(numbers.size(), kCount / 2);
+  for (std::size_t i = 1; i < numbers.size(); ++i) ASSERT_LT(numbers[i - 1], numbers[i]);
+}
+
 TEST_F(RemoteProcess, AStationSharedBothWaysCarriesEachMessageOnceAndNothingEchoes) {
   const ImmutableString station = ImmutableString::CreateStatic("test.twoway");
   const std::string own = Endpoint("parent");

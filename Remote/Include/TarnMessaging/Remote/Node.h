@@ -65,7 +65,10 @@
 /// messages, ImportersChanged and RemoteLoss reports are handed to the main
 /// thread's queue of pending calls (kivcore's AsyncCallFromMainThread) and
 /// broadcast on the station there, so handlers run on the importer's main
-/// thread, through whatever event-loop integration runs that queue.
+/// thread, through whatever event-loop integration runs that queue. A main
+/// thread that falls behind holds at most NodeOptions::mQueueCapacity of
+/// them: further ones are dropped and reported (kMainThreadBehind) once it
+/// has caught up, before the next one it hears.
 ///
 /// Ownership and lifetime: the node owns its sockets, its thread and the
 /// listeners it attaches to exported stations. The destructor detaches those
@@ -104,7 +107,9 @@ struct NodeOptions {
   /// Where exported stations are published; empty: DefaultEndpoint(mName).
   /// "ipc://PATH" or "tcp://HOST:PORT".
   std::string mEndpoint;
-  /// Encoded messages waiting for the I/O thread; more are dropped.
+  /// Messages waiting, each way: encoded ones for the I/O thread, imported
+  /// ones (and loss reports) for the main thread; more are dropped, counted
+  /// and reported.
   std::size_t mQueueCapacity = 4096;
   /// Messages a socket holds for one peer before it drops (ZeroMQ's
   /// high-water marks): per importer when sending, per exporter when receiving.
@@ -164,6 +169,7 @@ struct RemoteLoss : MessageImpl<RemoteLoss> {
     kUnknownType,     ///< a wire name not registered here (mWireName)
     kUnknownVersion,  ///< a version of mWireName other than this process's
     kMalformed,       ///< bytes that are not a message
+    kMainThreadBehind,  ///< imported here, but the main thread had NodeOptions::mQueueCapacity waiting already
   };
   Reason mReason = Reason::kGap;  ///< why
   std::uint64_t mOrigin = 0;  ///< the sending node; 0 when not even the envelope could be read
