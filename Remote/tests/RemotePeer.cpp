@@ -212,6 +212,7 @@ int Raw(const std::string& inEndpoint) {
   send(encode(tick, 7));                                          // 5 and 6 lost
   send(encode(tick, 7));                                          // again
   send(encode(tick, 6));                                          // late
+  send(encode(tick, 0));                                          // no sequence
   send(encode(tick, 8));
   return 0;
 }

@@ -216,7 +216,7 @@ TEST_F(RemoteProcess, UnknownMalformedRepeatedAndMissingInputIsReportedNeverDeli
   EXPECT_EQ(reports[1].mWireName, "test.tick");
   EXPECT_EQ(reports[5].mCount, 2u);
   const Tarn::Remote::NodeStats stats = node.GetStats();
-  EXPECT_EQ(stats.mDuplicates, 2u);
+  EXPECT_EQ(stats.mDuplicates, 3u);
   EXPECT_EQ(stats.mUnknown, 2u);
   EXPECT_EQ(stats.mMalformed, 3u);
 }

@@ -91,14 +91,20 @@ TEST(WireCodec, FieldsTravelByNameSoPeersOfOtherDefinitionsDecodeWhatBothKnow) {
   EXPECT_TRUE(got.mHasEnvelope);
   EXPECT_EQ(got.mEnvelope.mSequence, 9u);
   EXPECT_EQ(got.mMessage, nullptr);
-  const WireType tooBig{"test.progress", 1, &Progress::StaticMessageID, nullptr,
-                        [](const Tarn::Message&, FieldWriter& ioWriter) {
-                          ioWriter.Begin(1);
-                          ioWriter.Unsigned("mSmall", 256);
-                        },
-                        nullptr};
-  codec->Encode(Envelope{1, 1}, tooBig, Progress(), bytes);
-  EXPECT_EQ(codec->Decode(bytes.data(), bytes.size()).mStatus, DecodeStatus::kMalformed);
+  // One wrong field of each kind: out of range, or of another kind.
+  using Write = void (*)(const Tarn::Message&, FieldWriter&);
+  const Write wrongFields[] = {
+      [](const Tarn::Message&, FieldWriter& ioWriter) { ioWriter.Begin(1); ioWriter.Unsigned("mSmall", 256); },
+      [](const Tarn::Message&, FieldWriter& ioWriter) { ioWriter.Begin(1); ioWriter.Signed("mSmall", -1); },
+      [](const Tarn::Message&, FieldWriter& ioWriter) { ioWriter.Begin(1); ioWriter.Unsigned("mDone", 1u << 31); },
+      [](const Tarn::Message&, FieldWriter& ioWriter) { ioWriter.Begin(1); ioWriter.Signed("mLabel", 5); },
+      [](const Tarn::Message&, FieldWriter& ioWriter) { ioWriter.Begin(1); ioWriter.Text("mFinal", "yes"); },
+      [](const Tarn::Message&, FieldWriter& ioWriter) { ioWriter.Begin(1); ioWriter.Boolean("mRatio", true); }};
+  for (const Write write : wrongFields) {
+    codec->Encode(Envelope{1, 1}, WireType{"test.progress", 1, &Progress::StaticMessageID, nullptr, write, nullptr},
+                  Progress(), bytes);
+    EXPECT_EQ(codec->Decode(bytes.data(), bytes.size()).mStatus, DecodeStatus::kMalformed);
+  }
 
   // Another version, and a name nobody registered here.
   OtherPeer::sVersion = 2;
