@@ -241,6 +241,130 @@ void RemoteStationRow(Receiver& ioReceiver, const std::string& inEndpoint) {
   ::waitpid(pid, nullptr, 0);
 }
 
+// Fan-out: importer processes forked first (each reports on a pipe what it
+// received: count, first and last time), then this process exports and
+// broadcasts kFanOutCount stamps from its main thread, with an export queue
+// that holds them all, so that what an importer misses is its own socket's
+// high-water mark. A slow importer sleeps inSlowMicros in each handler.
+constexpr std::uint64_t kFanOutCount = 100000;
+
+struct Heard {
+  std::uint64_t mReceived = 0;
+  std::uint64_t mFirst = 0;
+  std::uint64_t mLast = 0;
+  double Rate() const { return mLast > mFirst ? mReceived / (static_cast<double>(mLast - mFirst) / 1e9) : 0; }
+};
+
+long ResidentKilobytes() {
+  long pages = 0;
+  long resident = 0;
+  if (std::FILE* statm = std::fopen("/proc/self/statm", "r")) {
+    if (std::fscanf(statm, "%ld %ld", &pages, &resident) != 2) resident = 0;
+    std::fclose(statm);
+  }
+  return resident * (::sysconf(_SC_PAGESIZE) / 1024);
+}
+
+std::vector<Heard> FanOut(const std::string& inEndpoint, const std::vector<int>& inSlowMicros, long& outGrowth) {
+  const auto station = kivcore::utility::ImmutableString::CreateStatic("bench.fanout");
+  std::vector<std::pair<pid_t, int>> children;
+  for (std::size_t i = 0; i < inSlowMicros.size(); ++i) {
+    int pipe[2];
+    if (::pipe(pipe) != 0) break;
+    const int slow = inSlowMicros[i];
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+      ::close(pipe[0]);
+      Pin(1);  // the exporter keeps the first CPU
+      Tarn::Messaging::Initialize();
+      Tarn::StationRegistry::RegisterStation(station, nullptr);
+      Heard heard;
+      {
+        Tarn::Remote::Node node(Tarn::Remote::NodeOptions("tarn-remote-bench-importer-" + std::to_string(::getpid())));
+        const Tarn::Registration stamps = Tarn::Subscribe<Stamp>(station, [&](const Stamp&) {
+          const std::uint64_t now = NowNanos();
+          if (heard.mReceived++ == 0) heard.mFirst = now;
+          heard.mLast = now;
+          // Sleeping, not spinning: both importers share the second CPU, and a
+          // spinning one would measure the CPU taken from the other.
+          if (slow > 0) std::this_thread::sleep_for(std::chrono::microseconds(slow));
+        });
+        node.Import(station, inEndpoint);
+        RunUntil(
+            [&] {
+              return heard.mReceived == kFanOutCount ||
+                     (heard.mReceived > 0 && NowNanos() - heard.mLast > 500000000u);
+            },
+            std::chrono::seconds(60));
+      }
+      Tarn::Messaging::Terminate();
+      (void)::write(pipe[1], &heard, sizeof(heard));
+      ::_exit(0);
+    }
+    ::close(pipe[1]);
+    children.emplace_back(pid, pipe[0]);
+  }
+  Tarn::Messaging::Initialize();
+  Tarn::StationRegistry::RegisterStation(station, nullptr);
+  {
+    Tarn::Remote::NodeOptions options;
+    options.mEndpoint = inEndpoint;
+    options.mQueueCapacity = kFanOutCount;
+    Tarn::Remote::Node node(options);
+    std::uint32_t importers = 0;
+    const Tarn::Registration counted = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
+        station, [&](const Tarn::Remote::ImportersChanged& inChanged) { importers = inChanged.mImporters; });
+    node.Export(station);
+    RunUntil([&] { return importers == children.size(); }, std::chrono::seconds(10));
+    const long before = ResidentKilobytes();
+    long most = before;
+    for (std::uint64_t number = 1; number <= kFanOutCount; ++number) {
+      Stamp stamp;
+      stamp.mNumber = number;
+      stamp.mSent = NowNanos();
+      Tarn::StationUtils::BroadcastMessage(station, stamp);
+      if (number % 4096 == 0) most = std::max(most, ResidentKilobytes());
+    }
+    RunUntil([&] { return node.GetStats().mExported + node.GetStats().mExportDropped == kFanOutCount; },
+             std::chrono::seconds(30));
+    outGrowth = std::max(most, ResidentKilobytes()) - before;
+    std::vector<Heard> heard(children.size());
+    for (std::size_t i = 0; i < children.size(); ++i) {
+      if (::read(children[i].second, &heard[i], sizeof(Heard)) != sizeof(Heard)) heard[i] = Heard();
+      ::close(children[i].second);
+      ::waitpid(children[i].first, nullptr, 0);
+    }
+    Tarn::Messaging::Terminate();
+    return heard;
+  }
+}
+
+void FanOutRows(const std::string& inPid) {
+  int round = 0;
+  const auto endpoint = [&] {
+    return Tarn::Remote::Node::DefaultEndpoint("tarn-remote-bench-fan-" + inPid + "-" + std::to_string(++round));
+  };
+  long growth = 0;
+  std::printf("\nFan-out: %llu stamps broadcast on the exporter's main thread as fast as it goes\n\n"
+              "| importers | per importer: delivered, msg/s | exporter memory growth |\n|---|---|---:|\n",
+              static_cast<unsigned long long>(kFanOutCount));
+  const auto row = [&](const char* inName, const std::vector<Heard>& inHeard) {
+    std::printf("| %s |", inName);
+    for (const Heard& heard : inHeard) {
+      std::printf(" %llu, %.0f;", static_cast<unsigned long long>(heard.mReceived), heard.Rate());
+    }
+    std::printf(" | %ld kB |\n", growth);
+  };
+  const std::vector<Heard> four = FanOut(endpoint(), {0, 0, 0, 0}, growth);
+  row("4 fast", four);
+  const std::vector<Heard> solo = FanOut(endpoint(), {0}, growth);
+  row("1 fast", solo);
+  const std::vector<Heard> mixed = FanOut(endpoint(), {0, 50}, growth);
+  row("1 fast, 1 slow (sleeps 50 µs a message)", mixed);
+  const double kept = solo[0].Rate() > 0 ? 100.0 * mixed[0].Rate() / solo[0].Rate() : 0;
+  std::printf("\nthe fast importer beside the slow one kept %.0f%% of its solo rate (target: at least 90%%)\n", kept);
+}
+
 }  // namespace
 
 int main() {
@@ -269,5 +393,6 @@ int main() {
   std::printf("\nremote station against raw libzmq: p50 +%.1f µs (target within 15), p99 +%.1f µs (within 50), "
               "burst %.0f%% of its rate (at least 40%%) and %.2fM msg/s (at least 1M)\n",
               p50[2] - p50[1], p99[2] - p99[1], rate[1] > 0 ? 100.0 * rate[2] / rate[1] : 0.0, rate[2] / 1e6);
+  FanOutRows(pid);
   return 0;
 }
