@@ -155,7 +155,8 @@ private:
   void Obey(zmq::context_t& ioContext, std::vector<Command>& ioCommands);
   void HearSubscriptions(zmq::socket_t& ioPublisher);
   void Authenticate(zmq::socket_t& ioHandler);
-  bool IsAllowed(const std::string& inAddress) const;
+  bool IsAllowed(const std::string& inAddress, std::string& outUser) const;
+  bool StationAllows(const std::string& inTopic, const std::string& inUser) const;
   void SendSnapshot(zmq::socket_t& ioPublisher, const std::string& inTopic);
   bool Admit(const ImmutableString& inStationID, const Envelope& inEnvelope);
   void AnnounceImporters(const ImmutableString& inStationID, std::uint32_t inImporters);
@@ -187,7 +188,7 @@ private:
 
   struct Counters {
     std::atomic<std::uint64_t> mExported{0}, mExportDropped{0}, mImported{0}, mLost{0}, mUnknown{0},
-        mMalformed{0}, mDuplicates{0}, mImportErrors{0}, mRefusedPeers{0};
+        mMalformed{0}, mDuplicates{0}, mImportErrors{0}, mRefusedPeers{0}, mBehind{0};
   } mCounters;
 
   mutable std::mutex mQueueMutex;
@@ -304,6 +305,7 @@ NodeStats Node::Impl::GetStats() const noexcept {
   stats.mDuplicates = mCounters.mDuplicates.load(std::memory_order_relaxed);
   stats.mImportErrors = mCounters.mImportErrors.load(std::memory_order_relaxed);
   stats.mRefusedPeers = mCounters.mRefusedPeers.load(std::memory_order_relaxed);
+  stats.mMainThreadBehind = mCounters.mBehind.load(std::memory_order_relaxed);
   return stats;
 }
 
@@ -368,6 +370,7 @@ void Node::Impl::Run(std::promise<void>& outBound) noexcept {
     // Every subscription and unsubscription comes up, one per importer, so
     // that importers can be counted.
     publisher.set(zmq::sockopt::xpub_verboser, 1);
+    publisher.set(zmq::sockopt::xpub_manual, 1);
     try {
       publisher.bind(mEndpoint);
       mEndpoint = publisher.get(zmq::sockopt::last_endpoint);  // read by the constructor once told
@@ -549,14 +552,16 @@ void Node::Impl::Authenticate(zmq::socket_t& ioHandler) {
   } while (request.back().more() && request.size() < 16);
   while (request.back().more()) (void)ioHandler.recv(request.back(), zmq::recv_flags::none);
   bool allowed = false;
+  std::string user;  // what the peer's messages carry as their "User-Id"
   if (request.size() >= 7 && request[5].to_string() == "CURVE" && request[6].size() == 32) {
     // The client's long-term public key, proven by the handshake.
     char text[41] = {};
     zmq_z85_encode(text, static_cast<const std::uint8_t*>(request[6].data()), 32);
     const std::vector<std::string>& keys = mOptions.mAllowedCurveKeys;
     allowed = std::find(keys.begin(), keys.end(), std::string(text)) != keys.end();
+    user = std::string("curve:") + text;
   } else if (request.size() >= 6 && request[5].to_string() == "NULL") {
-    allowed = IsAllowed(request[3].to_string());
+    allowed = IsAllowed(request[3].to_string(), user);
   }
   if (!allowed) mCounters.mRefusedPeers.fetch_add(1, std::memory_order_relaxed);
   const std::string version = "1.0";
@@ -567,14 +572,14 @@ void Node::Impl::Authenticate(zmq::socket_t& ioHandler) {
   ioHandler.send(zmq::buffer(requestID), zmq::send_flags::sndmore);
   ioHandler.send(zmq::buffer(code), zmq::send_flags::sndmore);
   ioHandler.send(zmq::buffer(text), zmq::send_flags::sndmore);
-  ioHandler.send(zmq::str_buffer(""), zmq::send_flags::sndmore);
+  ioHandler.send(zmq::buffer(user), zmq::send_flags::sndmore);
   ioHandler.send(zmq::str_buffer(""), zmq::send_flags::none);
 }
 
 // A Unix socket peer's address ends in ":UID:GID:PID", which libzmq reads
 // from the socket (SO_PEERCRED); the kernel vouches for it. A peer without
 // one (over tcp) has nothing to check.
-bool Node::Impl::IsAllowed(const std::string& inAddress) const {
+bool Node::Impl::IsAllowed(const std::string& inAddress, std::string& outUser) const {
   const std::size_t pid = inAddress.rfind(':');
   const std::size_t gid = pid == std::string::npos || pid == 0 ? std::string::npos : inAddress.rfind(':', pid - 1);
   const std::size_t uid = gid == std::string::npos || gid == 0 ? std::string::npos : inAddress.rfind(':', gid - 1);
@@ -582,8 +587,19 @@ bool Node::Impl::IsAllowed(const std::string& inAddress) const {
   const std::string text = inAddress.substr(uid + 1, gid - uid - 1);
   if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos) return false;
   const unsigned long user = std::stoul(text);
+  outUser = text;
   const std::vector<uid_t>& allowed = mAllowedUsers;
   return std::find(allowed.begin(), allowed.end(), static_cast<uid_t>(user)) != allowed.end();
+}
+
+// Whether the user the authentication handler named may hear the topic: a
+// station with an allow list of its own takes only the users on it.
+bool Node::Impl::StationAllows(const std::string& inTopic, const std::string& inUser) const {
+  const auto listed = mOptions.mStationUsers.find(inTopic.substr(0, inTopic.size() - 1));
+  if (listed == mOptions.mStationUsers.end()) return true;
+  if (inUser.empty() || inUser.find_first_not_of("0123456789") != std::string::npos) return false;
+  const uid_t user = static_cast<uid_t>(std::stoul(inUser));
+  return std::find(listed->second.begin(), listed->second.end(), user) != listed->second.end();
 }
 
 void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {
@@ -594,6 +610,23 @@ void Node::Impl::HearSubscriptions(zmq::socket_t& ioPublisher) {
     const char* data = static_cast<const char*>(frame.data());
     const std::string topic(data + 1, frame.size() - 1);
     if (topic.back() != '\0' || (data[0] != 0 && data[0] != 1)) continue;
+    // The publisher takes subscriptions only as told (manual mode), each for
+    // the importer whose frame was read last: one of a user the station
+    // does not allow never reaches its list.
+    std::string user;
+    try {
+      user = frame.gets("User-Id");
+    } catch (const zmq::error_t&) {  // no such property: no user known
+    }
+    if (!StationAllows(topic, user)) {
+      if (data[0] == 1) mCounters.mRefusedPeers.fetch_add(1, std::memory_order_relaxed);
+      continue;
+    }
+    if (data[0] == 1) {
+      ioPublisher.set(zmq::sockopt::subscribe, topic);
+    } else {
+      ioPublisher.set(zmq::sockopt::unsubscribe, topic);
+    }
     // Counted for every topic, exported yet or not: an importer may
     // subscribe before the export command reaches this thread. Topics no
     // importer holds any more are forgotten, so that the map stays bounded
@@ -756,7 +789,7 @@ void Node::Impl::Deliver(const ImmutableString& inStationID, std::shared_ptr<con
   if (inBound == Bound::kBounded) {
     if (mBacklog->load(std::memory_order_acquire) >= mOptions.mQueueCapacity) {
       ++mDropped[inStationID];
-      mCounters.mLost.fetch_add(1, std::memory_order_relaxed);
+      mCounters.mBehind.fetch_add(1, std::memory_order_relaxed);
       return;
     }
     ReportDropped();

@@ -9,7 +9,8 @@
 //   import OWN ENDPOINT [PUBLIC SECRET SERVER]
 //                                   imports test.remote (over CURVE with the
 //                                   keys given); exit status 0 once a tick
-//                                   came, 3 when not live within 500 ms
+//                                   came, 3 when not live within 500 ms, 2
+//                                   when live but no tick came in 500 ms
 //   raw ENDPOINT                    a bare publishing socket sending test.raw
 //                                   input no node would send
 //   serve ENDPOINT TAG              exports test.remote, broadcasts a tick
@@ -169,7 +170,7 @@ int Import(char** inArguments, bool inCurve) {
     node.Import(station, inArguments[1]);
   }
   if (!PumpUntil([&] { return live; }, std::chrono::milliseconds(500))) return 3;
-  return PumpUntil([&] { return ticked; }) ? 0 : 2;
+  return PumpUntil([&] { return ticked; }, std::chrono::milliseconds(500)) ? 0 : 2;
 }
 
 int Raw(const std::string& inEndpoint) {

@@ -1,6 +1,7 @@
 // Stations across processes: this process against a child (RemotePeer.cpp)
 // on the other side of a node, every wait bounded, the child killed if it
 // outlives its test.
+#include "BoundedWait.h"
 #include "RemoteTestMessages.h"
 
 #include <TarnMessaging.h>
@@ -141,11 +142,17 @@ TEST_F(RemoteProcess, AnImporterWhoseMainThreadIsBehindHoldsABoundedBacklogAndRe
   node.Import(station, exporter);
   constexpr std::uint64_t kCount = 2000;
   Peer peer({"burst", exporter, std::to_string(kCount), "100000"});
-  EXPECT_EQ(peer.Wait(), 0);  // the main thread does nothing meanwhile
+  // The main thread does nothing until the node has heard everything.
+  EXPECT_TRUE(tarn_test::WaitUntil([&] {
+    const Tarn::Remote::NodeStats stats = node.GetStats();
+    return stats.mImported + stats.mLost == kCount + 1;
+  }));
+  EXPECT_EQ(peer.Wait(), 0);
   ASSERT_TRUE(PumpUntil([&] { return numbers.size() + behind + gaps == kCount + 1; }))
       << numbers.size() << " delivered, " << behind << " reported behind, " << gaps << " in gaps";
+  EXPECT_LE(numbers.size(), options.mQueueCapacity) << "no more than the bound before the main thread ran";
   EXPECT_GT(behind, 0u);
-  EXPECT_LE(numbers.size(), kCount / 2);
+  EXPECT_EQ(behind, node.GetStats().mMainThreadBehind);
   for (std::size_t i = 1; i < numbers.size(); ++i) ASSERT_LT(numbers[i - 1], numbers[i]);
 }
 
@@ -312,31 +319,41 @@ TEST_F(RemoteProcess, AnImporterThatConnectsGetsTheLatestStateOnceAndOthersNoRep
   EXPECT_EQ(second.GetStats().mImported, 2u);
 }
 
-TEST_F(RemoteProcess, AnImporterOfAnotherUserIsRefused) {
+TEST_F(RemoteProcess, AnImporterOfAnotherUserIsRefusedByTheNodeOrByTheStation) {
   if (::geteuid() != 0) GTEST_SKIP() << "starting a child as another user needs root";
   constexpr uid_t kNobody = 65534;
-  // A directory open to all, so that only the node's own check stands
+  // A directory open to all, so that only the nodes' own checks stand
   // between the other user and the station.
   const std::string directory = "/tmp/tarn-remote-open-" + std::to_string(::getpid());
   ASSERT_EQ(::mkdir(directory.c_str(), 0777), 0);
   ::chmod(directory.c_str(), 0777);
-  const std::string exporter = "ipc://" + directory + "/exporter";
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
   std::uint32_t importers = 0;  // the most at once
   {
-    Tarn::Remote::NodeOptions options;
-    options.mEndpoint = exporter;
-    Tarn::Remote::Node node(options);
-    ::chmod((directory + "/exporter").c_str(), 0777);
-    const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+    // Node A lets in this user only; node B lets nobody in too, but not to
+    // test.remote.
+    Tarn::Remote::NodeOptions onlyUs;
+    onlyUs.mEndpoint = "ipc://" + directory + "/a";
+    Tarn::Remote::NodeOptions perStation;
+    perStation.mEndpoint = "ipc://" + directory + "/b";
+    perStation.mAllowedUsers = {::geteuid(), kNobody};
+    perStation.mStationUsers["test.remote"] = {::geteuid()};
+    Tarn::Remote::Node a(onlyUs);
+    Tarn::Remote::Node b(perStation);
+    for (const char* socket : {"/a", "/b"}) ::chmod((directory + socket).c_str(), 0777);
     const Tarn::Registration counted = Tarn::Subscribe<Tarn::Remote::ImportersChanged>(
         station, [&](const Tarn::Remote::ImportersChanged& inChanged) {
           importers = std::max(importers, inChanged.mImporters);
         });
-    node.Export(station);
-    Peer other({"import", "ipc://" + directory + "/other", exporter}, kNobody);
-    EXPECT_EQ(other.Wait(), 3) << "not live";
-    EXPECT_GT(node.GetStats().mRefusedPeers, 0u);
-    Peer same({"import", "ipc://" + directory + "/same", exporter});
+    a.Export(station);
+    b.Export(station);
+    Peer refusedByNode({"import", "ipc://" + directory + "/other-a", onlyUs.mEndpoint}, kNobody);
+    EXPECT_EQ(refusedByNode.Wait(), 3) << "not live";
+    EXPECT_GT(a.GetStats().mRefusedPeers, 0u);
+    Peer refusedByStation({"import", "ipc://" + directory + "/other-b", perStation.mEndpoint}, kNobody);
+    EXPECT_EQ(refusedByStation.Wait(), 2) << "live, and nothing heard";
+    EXPECT_GT(b.GetStats().mRefusedPeers, 0u);
+    Peer same({"import", "ipc://" + directory + "/same", perStation.mEndpoint});
     ASSERT_TRUE(PumpUntil([&] { return importers > 0; }));
     Tarn::StationUtils::BroadcastMessage(station, Tick());
     EXPECT_EQ(same.Wait(), 0) << "heard";

@@ -86,6 +86,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <string>
 #include <utility>
@@ -129,6 +130,10 @@ struct NodeOptions {
   /// The users whose processes may import from this node, by user ID;
   /// empty: this process's effective user only.
   std::vector<uid_t> mAllowedUsers;
+  /// Per station ID, the users (among mAllowedUsers) that may import it; a
+  /// station not named here may be imported by every allowed user. A peer
+  /// over CURVE has no user ID, and may import only unnamed stations.
+  std::map<std::string, std::vector<uid_t>> mStationUsers;
   /// Whether a peer whose user cannot be known (over tcp, without CURVE)
   /// may import.
   bool mAcceptPeersWithoutCredentials = false;
@@ -151,13 +156,14 @@ struct NodeOptions {
 struct NodeStats {
   std::uint64_t mExported = 0;        ///< messages handed to the socket
   std::uint64_t mExportDropped = 0;   ///< dropped because the export queue was full
-  std::uint64_t mImported = 0;        ///< messages decoded and handed to the main thread
+  std::uint64_t mImported = 0;        ///< messages decoded, then handed to the main thread or dropped
+  std::uint64_t mMainThreadBehind = 0;  ///< of those, dropped: the main thread had the queue capacity waiting
   std::uint64_t mLost = 0;            ///< messages of other nodes found missing by sequence number
   std::uint64_t mUnknown = 0;         ///< refused: unknown wire name or version
   std::uint64_t mMalformed = 0;       ///< refused: bytes that are not a message
   std::uint64_t mDuplicates = 0;      ///< dropped: a sequence number already seen
   std::uint64_t mImportErrors = 0;    ///< imports whose endpoint could not be connected
-  std::uint64_t mRefusedPeers = 0;    ///< connections to this node's endpoint refused: not an allowed user
+  std::uint64_t mRefusedPeers = 0;    ///< connections and subscriptions refused: not an allowed user
 };
 
 /// Reported on a station for every loss an importing node detects, before
