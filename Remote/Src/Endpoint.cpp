@@ -2,7 +2,6 @@
 // user may enter.
 #include <TarnMessaging/Remote/Node.h>
 
-#include "Endpoint.h"
 #include "RemoteContract.h"
 
 #include <sys/stat.h>
@@ -46,7 +45,6 @@ void RequirePrivateDirectory(const std::string& inDirectory) {
 
 }  // namespace
 
-bool IsValidNodeName(const std::string& inName) { return IsValidName(inName); }
 
 std::string Node::DefaultEndpoint(const std::string& inName) {
   TARN_REMOTE_CONTRACT_CHECK(IsValidName(inName), "Tarn::Remote::Node::DefaultEndpoint");

@@ -2,7 +2,6 @@
 // owns every socket; imports decoded there and broadcast on the main thread.
 #include <TarnMessaging/Remote/Node.h>
 
-#include "Endpoint.h"
 #include "RemoteContract.h"
 
 #include <TarnMessaging/Listener.h>
@@ -225,7 +224,7 @@ Node::Impl::Impl(NodeOptions inOptions)
       mCodec(mOptions.mCodec != nullptr ? mOptions.mCodec : std::shared_ptr<const WireCodec>(MakeMsgPackCodec())),
       mOrigin(NewOrigin()) {
   const std::string name = mOptions.mName.empty() ? "tarn-" + std::to_string(::getpid()) : mOptions.mName;
-  TARN_REMOTE_CONTRACT_CHECK(IsValidNodeName(name), "Tarn::Remote::Node::Node");
+  // DefaultEndpoint checks the name: without it, the name is not used.
   mEndpoint = !mOptions.mEndpoint.empty() ? mOptions.mEndpoint : Node::DefaultEndpoint(name);
   mAllowedUsers = mOptions.mAllowedUsers;
   if (mAllowedUsers.empty()) mAllowedUsers.push_back(::geteuid());

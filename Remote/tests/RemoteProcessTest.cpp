@@ -7,6 +7,8 @@
 #include <TarnMessaging.h>
 #include <TarnMessaging/Remote/Node.h>
 
+#include <kivcore/Error.h>
+
 #include <gtest/gtest.h>
 
 #include <poll.h>
@@ -18,6 +20,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <stdexcept>
 #include <string>
 #include <thread>
 #include <vector>
@@ -154,6 +157,25 @@ TEST_F(RemoteProcess, AnImporterWhoseMainThreadIsBehindHoldsABoundedBacklogAndRe
   EXPECT_GT(behind, 0u);
   EXPECT_EQ(behind, node.GetStats().mMainThreadBehind);
   for (std::size_t i = 1; i < numbers.size(); ++i) ASSERT_LT(numbers[i - 1], numbers[i]);
+}
+
+TEST_F(RemoteProcess, MisuseIsReportedAndTheNodeGoesOnAsIfNotCalled) {
+  const ImmutableString station = ImmutableString::CreateStatic("test.remote");
+  std::vector<std::string> reports;
+  const auto previous = kivcore::config::SetErrorHandler(
+      [&](const kivcore::config::ErrorReport& inReport) { reports.push_back(inReport.key); });
+  EXPECT_THROW(Tarn::Remote::Node(Tarn::Remote::NodeOptions("a/b")), std::invalid_argument);
+  Tarn::Remote::Node node(Tarn::Remote::NodeOptions("test-" + std::to_string(::getpid()) + "-misused"));
+  node.Import(station, "http://nowhere");
+  node.Import(ImmutableString(), Endpoint("nobody"));
+  node.Import(station, "tcp://127.0.0.1:1", "not a key");
+  node.Export(ImmutableString());
+  kivcore::config::SetErrorHandler(previous);
+  EXPECT_EQ(reports.size(), 5u);
+  // An endpoint libzmq refuses at once: the first import the I/O thread gets.
+  node.Import(station, "ipc:///" + std::string(200, 'x'));
+  EXPECT_TRUE(tarn_test::WaitUntil([&] { return node.GetStats().mImportErrors > 0; }));
+  EXPECT_EQ(node.GetStats().mImportErrors, 1u);
 }
 
 TEST_F(RemoteProcess, AStationSharedBothWaysCarriesEachMessageOnceAndNothingEchoes) {
