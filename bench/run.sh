@@ -52,6 +52,11 @@ python3 bench/report.py "$BUILD_DIR/bench-results.json" --posting "${extra[@]}" 
   tee "$BUILD_DIR/bench-table.md"
 report_status=${PIPESTATUS[0]}
 set -e
+# Stations across processes, where the remote library is built.
+if [ -x "$BUILD_DIR/bench/tarn-remote-bench" ]; then
+  echo
+  "$BUILD_DIR/bench/tarn-remote-bench" | tee "$BUILD_DIR/bench-remote.md" || status=1
+fi
 if [ "$status" -ne 0 ]; then
   echo "run.sh: the benchmark program failed; see the checks above" >&2
   exit 1

@@ -2,7 +2,8 @@
 # Installs a build into a scratch prefix and builds and runs a small consumer
 # (examples/consumer) against it the two ways the README documents:
 #   1. find_package(TarnMessaging) in a CMake project, with the event-loop
-#      examples linked to each integration the build has (its components);
+#      examples linked to each integration the build has (its components),
+#      and the remote example where the build has Tarn::Remote;
 #   2. pkg-config, as C++17 with LD_LIBRARY_PATH and as C++20 with an rpath
 #      (the .pc files must leave the language level to the consumer), and each
 #      event-loop example through its integration's .pc file.
@@ -52,10 +53,17 @@ for targets in "$libdir"/cmake/TarnMessaging/Tarn*IntegrationTargets.cmake; do
   loops+=("${loop,,}")
 done
 [ ${#components[@]} -gt 0 ] || fail "no integration installed under $libdir/cmake/TarnMessaging"
+# The remote library, where it was built: its example runs both routes too.
+remote=0
+required=("${components[@]}")
+if [ -e "$libdir/cmake/TarnMessaging/TarnRemoteTargets.cmake" ]; then
+  remote=1
+  required+=(Remote)
+fi
 
-step "find_package route (components: ${components[*]})"
+step "find_package route (components: ${required[*]})"
 cmake -S "$consumer" -B "$work/cmake-build" -DCMAKE_PREFIX_PATH="$prefix" -DCMAKE_BUILD_TYPE=Release \
-  -DCMAKE_FIND_PACKAGE_NO_PACKAGE_REGISTRY=ON "-DTARN_COMPONENTS=$(IFS=';'; echo "${components[*]}")" \
+  -DCMAKE_FIND_PACKAGE_NO_PACKAGE_REGISTRY=ON "-DTARN_COMPONENTS=$(IFS=';'; echo "${required[*]}")" \
   -DTARN_LOOP_EXAMPLES="$source_dir/examples" > "$work/cmake.log" || fail "configuring the consumer (see $work/cmake.log)"
 cmake --build "$work/cmake-build" -j 2 >> "$work/cmake.log" || fail "building the consumer (see $work/cmake.log)"
 uses_prefix "$work/cmake-build/tarn-consumer"
@@ -64,6 +72,10 @@ for loop in "${loops[@]}"; do
   uses_prefix "$work/cmake-build/tarn-$loop-loop"
   "$work/cmake-build/tarn-$loop-loop" > "$work/$loop-loop.log" || fail "the find_package $loop example (see $work/$loop-loop.log)"
 done
+if [ "$remote" -eq 1 ]; then
+  uses_prefix "$work/cmake-build/tarn-remote-pair"
+  "$work/cmake-build/tarn-remote-pair" > "$work/remote-pair.log" || fail "the find_package remote example (see $work/remote-pair.log)"
+fi
 
 step "pkg-config route"
 export PKG_CONFIG_PATH=$libdir/pkgconfig
@@ -90,4 +102,11 @@ for i in "${!loops[@]}"; do
   uses_prefix "$work/$loop-loop-pc"
   "$work/$loop-loop-pc" > "$work/$loop-loop-pc.log" || fail "the pkg-config $loop example (see $work/$loop-loop-pc.log)"
 done
+if [ "$remote" -eq 1 ]; then
+  # shellcheck disable=SC2046
+  "$CXX" -std=c++17 "$source_dir/examples/remote_pair.cpp" -o "$work/remote-pair-pc" \
+    $(pkg-config --cflags --libs TarnRemote) -pthread -Wl,-rpath,"$libdir" || fail "building the remote example with pkg-config"
+  uses_prefix "$work/remote-pair-pc"
+  "$work/remote-pair-pc" > "$work/remote-pair-pc.log" || fail "the pkg-config remote example (see $work/remote-pair-pc.log)"
+fi
 step "both routes work"

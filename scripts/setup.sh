@@ -21,6 +21,10 @@ optional=(
   python3           # the benchmark report (bench/report.py)
   gnuplot-nox       # the benchmark chart
   time              # make compile-time (GNU time's CPU seconds)
+  libzmq3-dev       # the remote library (stations across processes), its tests and its fuzz target; with:
+  cppzmq-dev        #   the C++ binding of libzmq, for the remote library
+  libmsgpack-cxx-dev #  the remote library's wire codec (MessagePack)
+  libsystemd-dev    # sd-bus: the D-Bus comparison for the remote library's benchmark rows
 )
 
 installed() {

@@ -3,6 +3,9 @@
 // reading.
 #include "DemoHost.h"
 #include "DemoOptions.h"
+#ifdef TARN_DEMO_REMOTE
+#include "RemoteDemo.h"
+#endif
 #include "SlowHandlers.h"
 #include "Summary.h"
 
@@ -14,6 +17,9 @@
 #include <string>
 
 int main(int argc, char** argv) {
+#ifdef TARN_DEMO_REMOTE
+  if (tarn_demo::IsRemoteDemo(argc, argv)) return tarn_demo::RunRemoteDemo(argc, argv);
+#endif
   tarn_demo::DemoOptions options;
   std::string error;
   switch (tarn_demo::ParseDemoOptions(argc, argv, options, error)) {
