@@ -12,10 +12,6 @@
 #include <boost/function.hpp>
 #include <boost/make_shared.hpp>
 
-#include <gtest/gtest.h>
-
-#include <memory>
-
 namespace {
 
 using kivcore::utility::SmallBlockAllocator;

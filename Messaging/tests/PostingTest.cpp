@@ -9,28 +9,14 @@
 
 #include <TarnMessaging.h>
 
-#include <kivcore/Error.h>
-#include <kivcore/MainThread.h>
-#include <kivcore/SmallBlockAllocator.h>
-
 #include <boost/make_shared.hpp>
-
-#include <gtest/gtest.h>
 
 #include <malloc.h>
 
 #include <algorithm>
-#include <atomic>
-#include <chrono>
-#include <cstdlib>
-#include <functional>
 #include <new>
 #include <stdexcept>
-#include <string>
-#include <thread>
 #include <typeinfo>
-#include <utility>
-#include <vector>
 
 namespace {
 // Allocations left before the heap fails, on every thread or on this one
@@ -284,8 +270,7 @@ TEST(PostingTest, SteadyPostingTakesNothingFromTheHeap) {
 // made while the library is down wait for its next life.
 TEST(PostingTest, ABurstIsReportedOnceAndGivesItsStorageBackOnceRun) {
   Tarn::Messaging::Initialize();
-  std::vector<std::string> reports;
-  const auto handler = kivcore::config::SetErrorHandler([&](const kivcore::config::ErrorReport& inReport) { reports.push_back(inReport.key); });
+  ErrorRecorder errors;
   const std::size_t mark = Threads::SetPendingCallHighWaterMark(10000);
   RecordingListener listener("l");
   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &listener);
@@ -300,10 +285,11 @@ TEST(PostingTest, ABurstIsReportedOnceAndGivesItsStorageBackOnceRun) {
       if (i % 4 == 0) PostMessageToUIThread(Tarn::kStation_StatusBar, PingMessage(), true);
       else PostMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i), true);
     }
-    ASSERT_EQ(reports.size(), static_cast<std::size_t>(burst)) << "not reported once";
+    ASSERT_EQ(errors.Count(), static_cast<std::size_t>(burst)) << "not reported once";
+    const std::string report = errors.Entries().back().key;
     for (const char* part : {"holds 10001 calls", "7500 posts of ", "2500 posts of ", "; 1 other calls"})
-      EXPECT_NE(reports.back().find(part), std::string::npos) << part << " missing from " << reports.back();
-    EXPECT_NE(reports.back().find(Tarn::Tracing::ReadableTypeName(typeid(PingMessage).name()) + station), std::string::npos);
+      EXPECT_NE(report.find(part), std::string::npos) << part << " missing from " << report;
+    EXPECT_NE(report.find(Tarn::Tracing::ReadableTypeName(typeid(PingMessage).name()) + station), std::string::npos);
     EXPECT_GT(gHeapBytes.load() - heap, 40000 * 32);
     FlushPostedMessagesOnUIThread();
     EXPECT_LT(gHeapBytes.load() - heap, 256 * 1024) << "the queue kept the burst's storage";
@@ -322,7 +308,6 @@ TEST(PostingTest, ABurstIsReportedOnceAndGivesItsStorageBackOnceRun) {
   Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
   Tarn::Messaging::Terminate();
   Threads::SetPendingCallHighWaterMark(mark);
-  kivcore::config::SetErrorHandler(handler);
 }
 
 }  // namespace

@@ -8,15 +8,10 @@
 
 #include <TarnMessaging/Subscription.h>
 
-#include <optional>
-#include <thread>
-
 namespace {
 
 using kivcore::utility::ImmutableString;
-using messaging_test::CountedSafeListener;
-using messaging_test::NumberMessage;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 using Tarn::Registration;
 
 // One listener of each kind a registration can hold; every handler runs
