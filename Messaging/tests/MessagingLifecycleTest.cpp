@@ -63,7 +63,7 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   quit = Tarn::Subscribe<NumberMessage>(id, [&, name = std::string("quit")](const NumberMessage& inMessage) {
     Tarn::Messaging::Terminate();
     quit.Reset();
-    log.Record(name + ":" + std::to_string(inMessage.mValue));
+    log.Add(name + ":" + std::to_string(inMessage.mValue));
     mover.Start([&] {
       Tarn::Messaging::Initialize();
       broadcaster.BroadcastMessage(NumberMessage(2));

@@ -61,7 +61,6 @@ public:
   MainThreadGuard() : mAdaptor(kivcore::threads::RegisterCurrentThreadAsMainThread()) {}
   MainThreadGuard(const MainThreadGuard&) = delete;
   MainThreadGuard& operator=(const MainThreadGuard&) = delete;
-  ~MainThreadGuard() { mAdaptor.reset(); }
 
   kivcore::threads::AsyncEventLoopAdaptor& Adaptor() const { return *mAdaptor; }
 
@@ -77,10 +76,34 @@ struct ContractViolation {
   int line = 0;
 };
 
+// An ordered list that any thread may add to and read, each call under the
+// list's own mutex.
+template <typename Entry>
+class LockedList {
+public:
+  void Add(Entry inEntry) {
+    std::lock_guard<std::mutex> lock(mMutex);
+    mEntries.push_back(std::move(inEntry));
+  }
+  std::vector<Entry> Entries() const {
+    std::lock_guard<std::mutex> lock(mMutex);
+    return mEntries;
+  }
+  std::size_t Count() const { return Entries().size(); }
+  void Clear() {
+    std::lock_guard<std::mutex> lock(mMutex);
+    mEntries.clear();
+  }
+
+private:
+  mutable std::mutex mMutex;
+  std::vector<Entry> mEntries;  // guarded by mMutex
+};
+
 // Swaps a process-wide hook (installed with inSet) for one that records what
 // each call was given as an Entry; restores the previous hook when
-// destroyed. The hook records on the reporting thread, under a mutex of its
-// own, so Entries and Count may be read from any thread meanwhile.
+// destroyed. The hook records on the reporting thread, so Entries and Count
+// may be read from any thread meanwhile.
 template <typename Entry, typename Handler, Handler (*inSet)(Handler)>
 class HookRecorder {
 public:
@@ -88,21 +111,11 @@ public:
   HookRecorder& operator=(const HookRecorder&) = delete;
   ~HookRecorder() { inSet(std::move(mPrevious)); }
 
-  std::vector<Entry> Entries() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mEntries;
-  }
-  std::size_t Count() const { return Entries().size(); }
+  std::vector<Entry> Entries() const { return mState->Entries(); }
+  std::size_t Count() const { return mState->Count(); }
 
 protected:
-  struct State {
-    void Add(Entry inEntry) {
-      std::lock_guard<std::mutex> lock(mMutex);
-      mEntries.push_back(std::move(inEntry));
-    }
-    mutable std::mutex mMutex;
-    std::vector<Entry> mEntries;  // guarded by mMutex
-  };
+  using State = LockedList<Entry>;
   // inMakeHook(state) returns the hook to install; it records through state.
   template <typename MakeHook>
   explicit HookRecorder(MakeHook inMakeHook) : mState(std::make_shared<State>()), mPrevious(inSet(inMakeHook(mState))) {}
@@ -213,25 +226,7 @@ inline std::string Describe(const Tarn::Message& inMessage) {
 
 // An ordered record of calls, shared by the listeners of a test; entries are
 // "<listener name>:<Describe(message)>".
-class CallLog {
-public:
-  void Record(std::string inEntry) {
-    std::lock_guard<std::mutex> lock(mMutex);
-    mEntries.push_back(std::move(inEntry));
-  }
-  std::vector<std::string> Entries() const {
-    std::lock_guard<std::mutex> lock(mMutex);
-    return mEntries;
-  }
-  void Clear() {
-    std::lock_guard<std::mutex> lock(mMutex);
-    mEntries.clear();
-  }
-
-private:
-  mutable std::mutex mMutex;
-  std::vector<std::string> mEntries;  // guarded by mMutex
-};
+using CallLog = LockedList<std::string>;
 
 // What every recording listener shares, whatever its base class: a name, an
 // optional log, a call count, an optional action run after the call is
@@ -261,7 +256,7 @@ public:
 protected:
   void RecordCall(const Tarn::Message& inMessage) {
     mProbe->mCalls.fetch_add(1);
-    if (mLog != nullptr) mLog->Record(mName + ":" + Describe(inMessage));
+    if (mLog != nullptr) mLog->Add(mName + ":" + Describe(inMessage));
     if (mAction) mAction(inMessage);
   }
 
