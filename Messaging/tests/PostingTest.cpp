@@ -9,8 +9,6 @@
 
 #include <TarnMessaging.h>
 
-#include <boost/make_shared.hpp>
-
 #include <malloc.h>
 
 #include <algorithm>
@@ -104,30 +102,22 @@ TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
   Tarn::Messaging::Initialize();
   Tarn::Broadcaster broadcaster;
   CallLog log;
-  RecordingListener plain("plain", &log);
-  const auto boostListener = boost::make_shared<RecordingListener>("boost", &log);
-  const auto stdListener = std::make_shared<RecordingListener>("std", &log);
-  const Tarn::ISafeListenerRef safe(new CountedSafeListener("safe", &log));
+  AnyListener listeners[] = {{ListenerKind::kPlainPointer, "plain", &log}, {ListenerKind::kBoostWeak, "boost", &log},
+                             {ListenerKind::kStdWeak, "std", &log}, {ListenerKind::kSafe, "safe", &log}};
   auto heard = [&log] { return log.Entries().size(); };
   for (const bool onStation : {false, true}) {
     Tarn::Broadcaster& target = onStation ? *Tarn::StationRegistry::FindStation(Tarn::kStation_StatusBar) : broadcaster;
-    auto attach = [&](const auto& inListener) {
-      return onStation ? Tarn::Attach(Tarn::kStation_StatusBar, inListener) : Tarn::Attach(broadcaster, inListener);
-    };
-    const std::function<Tarn::Registration()> forms[] = {
-        [&] { return attach(static_cast<Tarn::Listener*>(&plain)); },
-        [&] { return attach(boost::weak_ptr<Tarn::Listener>(boostListener)); },
-        [&] { return attach(std::weak_ptr<Tarn::Listener>(stdListener)); },
-        [&] { return attach(safe); },
-    };
-    for (const auto& form : forms) {
+    for (AnyListener& listener : listeners) {
       for (long long n = 0; n < 100 && !HasFailure(); ++n) {
-        SCOPED_TRACE(std::string(onStation ? "station" : "broadcaster") + " form " + std::to_string(&form - forms) +
+        SCOPED_TRACE(std::string(onStation ? "station" : "broadcaster") + " form " + std::to_string(&listener - listeners) +
                      ", failing after " + std::to_string(n));
         const std::size_t before = heard();
         try {
           gHeapAllocationsLeft.store(n);
-          const Tarn::Registration registration = form();
+          Tarn::Registration registration;
+          listener.WithHandle([&](const auto& inHandle) {
+            registration = onStation ? Tarn::Attach(Tarn::kStation_StatusBar, inHandle) : Tarn::Attach(broadcaster, inHandle);
+          });
           gHeapAllocationsLeft.store(-1);
           target.BroadcastMessage(PingMessage());
           EXPECT_EQ(heard(), before + 1);

@@ -376,6 +376,17 @@ public:
       else inBroadcaster.RemoveListener(inHandle);
     });
   }
+  // Calls inCall with what the overloads for the kind take (a broadcaster's,
+  // Tarn::Attach's); the handle must still own the listener.
+  template <class Call>
+  void WithHandle(Call inCall) {
+    switch (mKind) {
+      case ListenerKind::kPlainPointer: return inCall(static_cast<Tarn::Listener*>(mPlain.get()));
+      case ListenerKind::kBoostWeak: return inCall(boost::weak_ptr<Tarn::Listener>(mBoost));
+      case ListenerKind::kStdWeak: return inCall(std::weak_ptr<Tarn::Listener>(mStd));
+      case ListenerKind::kSafe: return inCall(mSafe);
+    }
+  }
   // Ends the handle's ownership. The listener itself may live on for a
   // delivery in progress (weak and safe kinds); IsDestroyed tells.
   void Destroy() {
@@ -387,17 +398,6 @@ public:
   }
 
 private:
-  // Calls inCall with what the broadcaster's overload for the kind takes.
-  template <class Call>
-  void WithHandle(Call inCall) {
-    switch (mKind) {
-      case ListenerKind::kPlainPointer: return inCall(static_cast<Tarn::Listener*>(mPlain.get()));
-      case ListenerKind::kBoostWeak: return inCall(boost::weak_ptr<Tarn::Listener>(mBoost));
-      case ListenerKind::kStdWeak: return inCall(std::weak_ptr<Tarn::Listener>(mStd));
-      case ListenerKind::kSafe: return inCall(mSafe);
-    }
-  }
-
   const ListenerKind mKind;
   CallRecorder* mRecorder = nullptr;  // the listener's recording part, while owned
   std::unique_ptr<RecordingListener> mPlain;
