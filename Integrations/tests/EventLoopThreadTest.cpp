@@ -8,10 +8,7 @@
 #include <kivcore/Error.h>
 
 #include <atomic>
-#include <chrono>
 #include <stdexcept>
-#include <thread>
-#include <tuple>
 #include <type_traits>
 
 #if TARN_HAVE_QT_INTEGRATION && defined(__SANITIZE_THREAD__)

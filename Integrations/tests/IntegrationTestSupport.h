@@ -14,15 +14,11 @@
 #include <TarnMessaging/Integration/QtEventLoop.h>
 #endif
 
-#include <gtest/gtest.h>
-
 #include "BoundedWait.h"
 
 #include <boost/asio/io_context.hpp>
 
-#include <chrono>
 #include <memory>
-#include <thread>
 #include <tuple>
 
 namespace integration_test {

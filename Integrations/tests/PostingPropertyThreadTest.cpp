@@ -12,11 +12,8 @@
 
 #include <algorithm>
 #include <atomic>
-#include <memory>
 #include <numeric>
 #include <random>
-#include <tuple>
-#include <vector>
 
 namespace {
 

@@ -3,26 +3,18 @@
 // that die during a broadcast, and the storage the registry takes.
 #include "TestSupport.h"
 
-#include <TarnMessaging/Broadcaster.h>
-
-#include <kivcore/SmallBlockAllocator.h>
-
-#include <gtest/gtest.h>
-
 #include <algorithm>
-#include <chrono>
-#include <memory>
 #include <new>
-#include <string>
-#include <vector>
 
 namespace {
 
 using kivcore::utility::SmallBlockAllocator;
-using messaging_test::CallLog;
-using messaging_test::NumberMessage;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 using Log = std::vector<std::string>;
+
+struct Quiet : Tarn::Listener {
+  void ListenToMessage(const Tarn::Message&) override {}
+};
 
 class BroadcasterTest : public ::testing::Test {
 protected:
@@ -206,9 +198,6 @@ TEST_F(BroadcasterTest, DetachingOldestFirstCostsTheSameAtAnyCountAndKeepsTheWal
   }
   EXPECT_EQ(mLog.Entries(), expected);
 
-  struct Quiet : Tarn::Listener {
-    void ListenToMessage(const Tarn::Message&) override {}
-  };
   constexpr std::size_t kDetached = 1000;
   // The quickest of five tries, so that a busy machine does not fail it. Each
   // try detaches the oldest kDetached and attaches them again as the newest.
@@ -234,9 +223,6 @@ TEST_F(BroadcasterTest, DetachingOldestFirstCostsTheSameAtAnyCountAndKeepsTheWal
 // A copy, made or assigned, takes the listen state and none of the
 // original's broadcasters; an assigned listener keeps its own.
 TEST(ListenerCopy, ACopyTakesTheListenStateButNoBroadcaster) {
-  struct Quiet : Tarn::Listener {
-    void ListenToMessage(const Tarn::Message&) override {}
-  };
   Tarn::Broadcaster broadcaster, other;
   Quiet original, assigned;
   broadcaster.AddListener(&original);

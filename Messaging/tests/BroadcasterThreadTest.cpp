@@ -3,23 +3,13 @@
 // a broadcaster and its listeners may die at the same time on two threads.
 #include "TestSupport.h"
 
-#include <TarnMessaging/Broadcaster.h>
 #include <TarnMessaging/Messaging.h>
 
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <chrono>
 #include <optional>
-#include <thread>
-#include <vector>
 
 namespace {
 
-using messaging_test::AnyListener;
-using messaging_test::Latch;
-using messaging_test::NumberMessage;
-using messaging_test::ThreadGroup;
+using namespace messaging_test;
 
 TEST(BroadcasterThreads, NoDeliveryRunsOrStartsAfterARemovalReturned) {
   messaging_test::MainThreadGuard mainThread;

@@ -9,20 +9,14 @@
 #include "DiagnosticsTestSupport.h"
 #include "StationTestSupport.h"
 
-#include <TarnMessaging.h>
-
 #include <boost/make_shared.hpp>
 
-#include <gtest/gtest.h>
-
 #include <csignal>
-#include <optional>
 #include <set>
 
 using kivcore::utility::ImmutableString;
 using kivcore::utility::SmallBlockAllocator;
-using messaging_test::ContractDialogRecorder;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 
 static int sDebuggerQueries = 0;
 static bool sPretendDebugger = false;
@@ -182,7 +176,7 @@ TEST_F(ContractCheckSites, EachReportsItselfAndLeavesNothingBrokenWhetherTheRepo
       } catch (const kivcore::config::Error& error) {
         thrown = error.what();
       }
-      const auto violations = dialog.Violations();
+      const auto violations = dialog.Entries();
       const std::size_t expected = throws ? 1 : site.mReports.size();
       EXPECT_EQ(violations.size(), expected);
       for (std::size_t i = 0; i < expected && i < violations.size(); ++i) {

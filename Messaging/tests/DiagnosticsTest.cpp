@@ -4,10 +4,6 @@
 #include "DiagnosticsTestSupport.h"
 #include "StationTestSupport.h"
 
-#include <TarnMessaging.h>
-
-#include <gtest/gtest.h>
-
 #include <typeinfo>
 
 namespace diagnostics_test {
@@ -39,11 +35,11 @@ TEST(MessageIDCollision, TheSecondTypeIsReportedNamingBothAndNeverTakenForTheFir
   EXPECT_EQ(dialog.Count(), 0u);
   const CollisionYa second;
   ASSERT_EQ(dialog.Count(), 1u);
-  const std::string condition = dialog.Violations()[0].condition;
+  const std::string condition = dialog.Entries()[0].condition;
   EXPECT_NE(condition.find("diagnostics_test::CollisionXf (N16diagnostics_test11CollisionXfE) and "
                            "diagnostics_test::CollisionYa"), std::string::npos) << condition;
   ASSERT_EQ(errors.Count(), 1u);
-  const kivcore::config::ErrorReport report = errors.Reports()[0];
+  const kivcore::config::ErrorReport report = errors.Entries()[0];
   EXPECT_TRUE(report.level == 0 && report.number == 105u && report.code == 25 && report.flag)
       << "not the report a failed contract check makes";
   EXPECT_EQ(second.As<CollisionXf>(), nullptr);
@@ -96,7 +92,7 @@ TEST_P(RelayCycle, IsReportedAndEachListenerHearsEachMessageOnce) {
   EXPECT_EQ(again.Calls(), 2);
   // One report per message, each where the message came back.
   ASSERT_EQ(dialog.Count(), 2u);
-  EXPECT_EQ(dialog.Violations()[0].function, "Tarn::Station::ListenToMessage");
+  EXPECT_EQ(dialog.Entries()[0].function, "Tarn::Station::ListenToMessage");
   EXPECT_EQ(exceptions.Count(), reportThrows ? 2u : 0u);
 }
 
@@ -163,7 +159,7 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
   messaging_test::ErrorRecorder errors;
   RecordingListener listener("listener");
   Utils::AddListener(Tarn::kStation_StatusBar, &listener);
-  EXPECT_TRUE(HasKey(errors.Reports(), 0, "BeforeInitialize", "Tarn::Messaging::Initialize first"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 0, "BeforeInitialize", "Tarn::Messaging::Initialize first"));
 
   Tarn::Messaging::Initialize();
   const ImmutableString station = Registry::RegisterUniqueStation();
@@ -176,17 +172,17 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
     broadcaster.BroadcastMessage(messaging_test::PingMessage());
   });
   EXPECT_EQ(listener.Calls(), 0);
-  EXPECT_TRUE(HasKey(errors.Reports(), 1, "BroadcastOffMainThread", "Tarn::StationUtils::BroadcastMessage"));
-  EXPECT_TRUE(HasKey(errors.Reports(), 2, "BroadcastOffMainThread", "Tarn::Station::BroadcastMessage"));
-  EXPECT_TRUE(HasKey(errors.Reports(), 3, "BroadcastOffMainThread", "Tarn::Broadcaster::BroadcastMessage"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 1, "BroadcastOffMainThread", "Tarn::StationUtils::BroadcastMessage"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 2, "BroadcastOffMainThread", "Tarn::Station::BroadcastMessage"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 3, "BroadcastOffMainThread", "Tarn::Broadcaster::BroadcastMessage"));
 
   const ImmutableString nowhere = Registry::UniqueStationID();
   for (int i = 0; i < 2; ++i) RemoveFromOneSite(nowhere, &listener);
   Utils::SwitchStation(nowhere, station, &listener);
-  EXPECT_TRUE(HasKey(errors.Reports(), 4, "UnregisteredStation", nowhere.c_str()));
-  EXPECT_TRUE(HasKey(errors.Reports(), 5, "UnregisteredStation", "Tarn::StationUtils::RemoveListener"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 4, "UnregisteredStation", nowhere.c_str()));
+  EXPECT_TRUE(HasKey(errors.Entries(), 5, "UnregisteredStation", "Tarn::StationUtils::RemoveListener"));
   Utils::RetainStation(nowhere);
-  EXPECT_TRUE(HasKey(errors.Reports(), 6, "UnregisteredStation", "Tarn::StationUtils::RetainStation"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 6, "UnregisteredStation", "Tarn::StationUtils::RetainStation"));
   EXPECT_EQ(errors.Count(), 7u);
   {
     // A throwing handler changes nothing either.
@@ -200,7 +196,7 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
 
   // A worker's Initialize only counts; the main thread stays where it was.
   station_test::RunOnWorker([] { Tarn::Messaging::Initialize(); });
-  EXPECT_TRUE(HasKey(errors.Reports(), 7, "InitializeOffMainThread", "only counted (2 now)"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 7, "InitializeOffMainThread", "only counted (2 now)"));
   Tarn::Messaging::Terminate();
   Utils::BroadcastMessage(station, messaging_test::PingMessage());
   EXPECT_EQ(listener.Calls(), 1);
@@ -212,9 +208,9 @@ TEST(SilentFailures, AreReportedOncePerCallSiteAndChangeNothing) {
   listener.SetAction([](const Tarn::Message&) { Tarn::Messaging::Terminate(); });
   Utils::PostMessageToUIThread(station, messaging_test::PingMessage(), true);
   Utils::FlushPostedMessagesOnUIThread();
-  EXPECT_TRUE(HasKey(errors.Reports(), 8, "RetainedAtTerminate",
+  EXPECT_TRUE(HasKey(errors.Entries(), 8, "RetainedAtTerminate",
                      "1 station(s) still retained, the first \"" + std::string(station.c_str()) + "\" 1 time(s)"));
-  EXPECT_TRUE(HasKey(errors.Reports(), 9, "ListenersAtTerminate", "1 station(s) with listeners still attached"));
+  EXPECT_TRUE(HasKey(errors.Entries(), 9, "ListenersAtTerminate", "1 station(s) with listeners still attached"));
   EXPECT_EQ(errors.Count(), 10u);
 }
 
@@ -227,7 +223,7 @@ TEST(SilentFailures, SubscriptionsAndEveryKindOfPostOnAnUnregisteredIDAreReporte
   messaging_test::ErrorRecorder errors;
   RecordingListener listener("listener");
   Tarn::Registration registration = Tarn::Subscribe<PingMessage>(Tarn::kStation_StatusBar, [](const PingMessage&) {});
-  EXPECT_TRUE(HasKey(errors.Reports(), 0, "BeforeInitialize", "Tarn::Subscribe on station \"tarn.app.status.bar\""));
+  EXPECT_TRUE(HasKey(errors.Entries(), 0, "BeforeInitialize", "Tarn::Subscribe on station \"tarn.app.status.bar\""));
   Tarn::Messaging::Initialize();
   const ImmutableString nowhere = Registry::UniqueStationID();
   const Tarn::PostCancelToken token;
@@ -242,7 +238,7 @@ TEST(SilentFailures, SubscriptionsAndEveryKindOfPostOnAnUnregisteredIDAreReporte
       {"Tarn::StationUtils::PostMessageAtIdleTime", [&] { Utils::PostMessageAtIdleTime(nowhere, PingMessage()); }}};
   for (std::size_t i = 0; i < std::size(calls); ++i) {
     calls[i].second();
-    EXPECT_TRUE(HasKey(errors.Reports(), i + 1, "UnregisteredStation", calls[i].first)) << i;
+    EXPECT_TRUE(HasKey(errors.Entries(), i + 1, "UnregisteredStation", calls[i].first)) << i;
   }
   EXPECT_FALSE(registration);
   Utils::FlushPostedMessagesOnUIThread();

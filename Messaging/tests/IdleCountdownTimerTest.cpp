@@ -8,9 +8,6 @@
 
 #include <TarnFoundation/TimeStamp.h>
 
-#include <gtest/gtest.h>
-
-#include <memory>
 #include <stdexcept>
 
 namespace {

@@ -6,14 +6,10 @@
 
 #include <boost/function.hpp>
 
-#include <gtest/gtest.h>
-
-#include <memory>
 #include <optional>
 #include <set>
 #include <stdexcept>
 #include <typeinfo>
-#include <vector>
 
 const Tarn::Message& OtherUnitProgress();  // MessageOtherUnit.cpp
 

@@ -6,12 +6,8 @@
 #include <TarnMessaging/Tracing.h>
 
 #include <kivcore/InitializerRegistry.h>
-#include <kivcore/SmallBlockAllocator.h>
 
 #include <sys/wait.h>
-
-#include <cstdio>
-#include <string>
 
 #ifndef TARN_STATIC_DESTRUCTION_PROBE
 #error "TARN_STATIC_DESTRUCTION_PROBE must name the probe program"
@@ -22,8 +18,7 @@ namespace {
 using namespace station_test;
 namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
-using messaging_test::CallLog;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 
 // A "quit" subscription ends the library while the station it hears from is
 // broadcasting: the station once went at once (use after free), a later
@@ -68,7 +63,7 @@ TEST(MessagingLifecycleTest, TerminateFromAHandlerLetsTheBroadcastFinishAndTheLi
   quit = Tarn::Subscribe<NumberMessage>(id, [&, name = std::string("quit")](const NumberMessage& inMessage) {
     Tarn::Messaging::Terminate();
     quit.Reset();
-    log.Record(name + ":" + std::to_string(inMessage.mValue));
+    log.Add(name + ":" + std::to_string(inMessage.mValue));
     mover.Start([&] {
       Tarn::Messaging::Initialize();
       broadcaster.BroadcastMessage(NumberMessage(2));
@@ -193,30 +188,21 @@ TEST(MessagingLifecycleTest, ATerminateWithoutInitializeIsReportedAndChangesNoth
 // The last Terminate made by a static object's destructor reports what it
 // leaves behind, naming no violation whose dialog threw.
 TEST(StaticDestructionTest, StationsAtExitGoWhileTheRegistryLivesAndLateLookupsFindNothing) {
-  auto run = [](const char* inMode, std::string& outOutput) {
+  // The probe's output in inMode; it must exit normally with status 0.
+  auto run = [](const char* inMode) {
+    std::string output;
     FILE* const probe = ::popen((std::string("\"") + TARN_STATIC_DESTRUCTION_PROBE + "\" " + inMode + " 2>&1").c_str(), "r");
-    if (probe == nullptr) return -1;
     char buffer[256];
-    while (std::fgets(buffer, sizeof buffer, probe) != nullptr) outOutput += buffer;
-    return ::pclose(probe);
+    while (probe != nullptr && std::fgets(buffer, sizeof buffer, probe) != nullptr) output += buffer;
+    const int status = probe != nullptr ? ::pclose(probe) : -1;
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << inMode << ": " << status << output;
+    return output;
   };
-  std::string queued, late, unterminated;
-  int status = run("unterminated", unterminated);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-  EXPECT_NE(unterminated.find("Tarn::Messaging::Terminate was not made before the process exited: 1 "),
-            std::string::npos)
-      << unterminated;
-  status = run("queued", queued);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  const std::string unterminated = run("unterminated"), queued = run("queued"), late = run("late");
+  EXPECT_NE(unterminated.find("Tarn::Messaging::Terminate was not made before the process exited: 1 "), std::string::npos) << unterminated;
   EXPECT_EQ(queued, "queued station deleted\n");
-  status = run("late", late);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status << late;
-  EXPECT_NE(late.find("SERIOUS ERROR!  StationRegistry has already been destructed.\nlate lookup found nothing\n"),
-            std::string::npos)
-      << late;
-  std::string violation;
-  status = run("violation", violation);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status << violation;
+  EXPECT_NE(late.find("SERIOUS ERROR!  StationRegistry has already been destructed.\nlate lookup found nothing\n"), std::string::npos) << late;
+  const std::string violation = run("violation");
   EXPECT_EQ(0u, violation.find("the dialog threw\nTarnMessaging: ")) << violation;
   EXPECT_NE(violation.find("still retained"), std::string::npos) << violation;
   EXPECT_EQ(violation.find("inListener"), std::string::npos) << "a thrown-away violation named: " << violation;

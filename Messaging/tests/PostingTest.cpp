@@ -9,28 +9,12 @@
 
 #include <TarnMessaging.h>
 
-#include <kivcore/Error.h>
-#include <kivcore/MainThread.h>
-#include <kivcore/SmallBlockAllocator.h>
-
-#include <boost/make_shared.hpp>
-
-#include <gtest/gtest.h>
-
 #include <malloc.h>
 
 #include <algorithm>
-#include <atomic>
-#include <chrono>
-#include <cstdlib>
-#include <functional>
 #include <new>
 #include <stdexcept>
-#include <string>
-#include <thread>
 #include <typeinfo>
-#include <utility>
-#include <vector>
 
 namespace {
 // Allocations left before the heap fails, on every thread or on this one
@@ -118,30 +102,22 @@ TEST(PostingTest, AnAttachThatRunsOutOfStorageLeavesNothingAttached) {
   Tarn::Messaging::Initialize();
   Tarn::Broadcaster broadcaster;
   CallLog log;
-  RecordingListener plain("plain", &log);
-  const auto boostListener = boost::make_shared<RecordingListener>("boost", &log);
-  const auto stdListener = std::make_shared<RecordingListener>("std", &log);
-  const Tarn::ISafeListenerRef safe(new CountedSafeListener("safe", &log));
+  AnyListener listeners[] = {{ListenerKind::kPlainPointer, "plain", &log}, {ListenerKind::kBoostWeak, "boost", &log},
+                             {ListenerKind::kStdWeak, "std", &log}, {ListenerKind::kSafe, "safe", &log}};
   auto heard = [&log] { return log.Entries().size(); };
   for (const bool onStation : {false, true}) {
     Tarn::Broadcaster& target = onStation ? *Tarn::StationRegistry::FindStation(Tarn::kStation_StatusBar) : broadcaster;
-    auto attach = [&](const auto& inListener) {
-      return onStation ? Tarn::Attach(Tarn::kStation_StatusBar, inListener) : Tarn::Attach(broadcaster, inListener);
-    };
-    const std::function<Tarn::Registration()> forms[] = {
-        [&] { return attach(static_cast<Tarn::Listener*>(&plain)); },
-        [&] { return attach(boost::weak_ptr<Tarn::Listener>(boostListener)); },
-        [&] { return attach(std::weak_ptr<Tarn::Listener>(stdListener)); },
-        [&] { return attach(safe); },
-    };
-    for (const auto& form : forms) {
+    for (AnyListener& listener : listeners) {
       for (long long n = 0; n < 100 && !HasFailure(); ++n) {
-        SCOPED_TRACE(std::string(onStation ? "station" : "broadcaster") + " form " + std::to_string(&form - forms) +
+        SCOPED_TRACE(std::string(onStation ? "station" : "broadcaster") + " form " + std::to_string(&listener - listeners) +
                      ", failing after " + std::to_string(n));
         const std::size_t before = heard();
         try {
           gHeapAllocationsLeft.store(n);
-          const Tarn::Registration registration = form();
+          Tarn::Registration registration;
+          listener.WithHandle([&](const auto& inHandle) {
+            registration = onStation ? Tarn::Attach(Tarn::kStation_StatusBar, inHandle) : Tarn::Attach(broadcaster, inHandle);
+          });
           gHeapAllocationsLeft.store(-1);
           target.BroadcastMessage(PingMessage());
           EXPECT_EQ(heard(), before + 1);
@@ -284,8 +260,7 @@ TEST(PostingTest, SteadyPostingTakesNothingFromTheHeap) {
 // made while the library is down wait for its next life.
 TEST(PostingTest, ABurstIsReportedOnceAndGivesItsStorageBackOnceRun) {
   Tarn::Messaging::Initialize();
-  std::vector<std::string> reports;
-  const auto handler = kivcore::config::SetErrorHandler([&](const kivcore::config::ErrorReport& inReport) { reports.push_back(inReport.key); });
+  ErrorRecorder errors;
   const std::size_t mark = Threads::SetPendingCallHighWaterMark(10000);
   RecordingListener listener("l");
   Tarn::StationUtils::AddListener(Tarn::kStation_StatusBar, &listener);
@@ -294,16 +269,17 @@ TEST(PostingTest, ABurstIsReportedOnceAndGivesItsStorageBackOnceRun) {
     Threads::AsyncCallFromMainThread([] {}, 0);
     FlushPostedMessagesOnUIThread();  // a short run arms the report again
     const long long heap = gHeapBytes.load();
-    const std::size_t chunks = mallinfo2().uordblks;
+    [[maybe_unused]] const std::size_t chunks = mallinfo2().uordblks;  // read only where blocks are pooled
     Threads::AsyncCallFromMainThread([] {}, 0);
     for (int i = 0; i < 40000; ++i) {
       if (i % 4 == 0) PostMessageToUIThread(Tarn::kStation_StatusBar, PingMessage(), true);
       else PostMessageToUIThread(Tarn::kStation_StatusBar, NumberMessage(i), true);
     }
-    ASSERT_EQ(reports.size(), static_cast<std::size_t>(burst)) << "not reported once";
+    ASSERT_EQ(errors.Count(), static_cast<std::size_t>(burst)) << "not reported once";
+    const std::string report = errors.Entries().back().key;
     for (const char* part : {"holds 10001 calls", "7500 posts of ", "2500 posts of ", "; 1 other calls"})
-      EXPECT_NE(reports.back().find(part), std::string::npos) << part << " missing from " << reports.back();
-    EXPECT_NE(reports.back().find(Tarn::Tracing::ReadableTypeName(typeid(PingMessage).name()) + station), std::string::npos);
+      EXPECT_NE(report.find(part), std::string::npos) << part << " missing from " << report;
+    EXPECT_NE(report.find(Tarn::Tracing::ReadableTypeName(typeid(PingMessage).name()) + station), std::string::npos);
     EXPECT_GT(gHeapBytes.load() - heap, 40000 * 32);
     FlushPostedMessagesOnUIThread();
     EXPECT_LT(gHeapBytes.load() - heap, 256 * 1024) << "the queue kept the burst's storage";
@@ -322,7 +298,6 @@ TEST(PostingTest, ABurstIsReportedOnceAndGivesItsStorageBackOnceRun) {
   Tarn::StationUtils::RemoveListener(Tarn::kStation_StatusBar, &listener);
   Tarn::Messaging::Terminate();
   Threads::SetPendingCallHighWaterMark(mark);
-  kivcore::config::SetErrorHandler(handler);
 }
 
 }  // namespace

@@ -3,14 +3,12 @@
 #include "StationTestSupport.h"
 
 #include <regex>
-#include <stdexcept>
 
 namespace {
 
 using namespace station_test;
 namespace Registry = Tarn::StationRegistry;
-using messaging_test::CallLog;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 
 class StationTest : public RegistryTest {};
 
@@ -29,22 +27,14 @@ TEST_F(StationTest, RelayDisposedOrReleasedFromInsideItsOwnBroadcastIsDeletedWhe
     source.AddListener(relay);
     RecordingListener last("last", &log), first("first", &log);
     first.SetAction([&](const Tarn::Message&) {
-      if (byRelease) {
-        Registry::ReleaseStation(relayID);
-      } else {
-        DrainPendingStations();
-      }
+      byRelease ? Registry::ReleaseStation(relayID) : DrainPendingStations();
       EXPECT_EQ(StationLog::Destructions(), 0) << "the relay was deleted under its own broadcast";
     });
     last.SetAction([&](const Tarn::Message&) { EXPECT_EQ(StationLog::Destructions(), 0); });
     relay->AddListener(&last);
     relay->AddListener(&first);
-    if (byRelease) {
-      ASSERT_EQ(Registry::RetainStation(relayID), relay);
-      Registry::DisposeStation(relayID);
-    } else {
-      RunOnWorker([&] { Registry::DisposeStation(relayID); });
-    }
+    ASSERT_TRUE(!byRelease || Registry::RetainStation(relayID) == relay);
+    byRelease ? Registry::DisposeStation(relayID) : RunOnWorker([&] { Registry::DisposeStation(relayID); });
     source.BroadcastMessage(NumberMessage(7));
     EXPECT_EQ(log.Entries(), (std::vector<std::string>{"first:7", "last:7"}));
     EXPECT_EQ(StationLog::Destructions(), 1) << "the relay outlived its broadcast";
@@ -104,7 +94,7 @@ TEST_F(StationTest, AStationWhoseIDWasRegisteredAnewWithAFailingFactoryIsDeleted
   Registry::RegisterStation(id, [](const ImmutableString&) -> Tarn::Station* { throw std::runtime_error("factory"); });
   DrainPendingStations();
   EXPECT_EQ(StationLog::Destructions(), 1);
-  EXPECT_EQ(failures.Messages(), std::vector<std::string>{"factory"});
+  EXPECT_EQ(failures.Entries(), std::vector<std::string>{"factory"});
 }
 
 // A station a worker disposed of waits for a main-thread disposal; the last

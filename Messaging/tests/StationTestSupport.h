@@ -20,20 +20,9 @@
 
 #include <kivcore/kivcore.h>
 
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <chrono>
-#include <condition_variable>
 #include <cstdint>
-#include <functional>
-#include <mutex>
 #include <optional>
 #include <stdexcept>
-#include <string>
-#include <thread>
-#include <utility>
-#include <vector>
 
 namespace station_test {
 

@@ -10,8 +10,7 @@ namespace {
 using namespace station_test;
 namespace Registry = Tarn::StationRegistry;
 namespace Utils = Tarn::StationUtils;
-using messaging_test::PingMessage;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 
 class StationUtilsTest : public RegistryTest {};
 

@@ -8,15 +8,10 @@
 
 #include <TarnMessaging/Subscription.h>
 
-#include <optional>
-#include <thread>
-
 namespace {
 
 using kivcore::utility::ImmutableString;
-using messaging_test::CountedSafeListener;
-using messaging_test::NumberMessage;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 using Tarn::Registration;
 
 // One listener of each kind a registration can hold; every handler runs
@@ -24,33 +19,24 @@ using Tarn::Registration;
 struct Listeners {
   static constexpr int kKinds = 5;
   Listeners() {
-    auto hook = [this](const Tarn::Message&) { Hook(); };
-    for (RecordingListener* listener : {&mPlain, mBoost.get(), mStd.get()}) listener->SetAction(hook);
-    Safe()->SetAction(hook);
+    for (AnyListener& listener : mHeld) listener.SetAction([this](const Tarn::Message&) { Hook(); });
   }
-  CountedSafeListener* Safe() const { return static_cast<CountedSafeListener*>(mSafe.get()); }
   void Hook() const {
     if (mAction) mAction();
   }
 
   template <class Target>
   Registration Attach(Target& ioTarget, int inKind) {
-    if (inKind == 0) return Tarn::Attach(ioTarget, &mPlain);
-    if (inKind == 1) return Tarn::Attach(ioTarget, boost::weak_ptr<Tarn::Listener>(mBoost));
-    if (inKind == 2) return Tarn::Attach(ioTarget, std::weak_ptr<Tarn::Listener>(mStd));
-    if (inKind == 3) return Tarn::Attach(ioTarget, mSafe);
-    return Tarn::Subscribe<NumberMessage>(ioTarget, [this](const NumberMessage&) { ++mTyped, Hook(); });
+    Registration made;
+    if (inKind < 4) mHeld[inKind].WithHandle([&](const auto& inHandle) { made = Tarn::Attach(ioTarget, inHandle); });
+    else made = Tarn::Subscribe<NumberMessage>(ioTarget, [this](const NumberMessage&) { ++mTyped, Hook(); });
+    return made;
   }
-  int Calls(int inKind) const {
-    const int counts[] = {mPlain.Calls(), mBoost->Calls(), mStd->Calls(), Safe()->Calls(), mTyped.load()};
-    return counts[inKind];
-  }
+  int Calls(int inKind) const { return inKind < 4 ? mHeld[inKind].Calls() : mTyped.load(); }
 
   std::function<void()> mAction;
-  RecordingListener mPlain{"plain"};
-  boost::shared_ptr<RecordingListener> mBoost{new RecordingListener("boost")};
-  std::shared_ptr<RecordingListener> mStd = std::make_shared<RecordingListener>("std");
-  Tarn::ISafeListenerRef mSafe{new CountedSafeListener("safe")};
+  AnyListener mHeld[4] = {{ListenerKind::kPlainPointer, "plain"}, {ListenerKind::kBoostWeak, "boost"},
+                          {ListenerKind::kStdWeak, "std"}, {ListenerKind::kSafe, "safe"}};
   std::atomic<int> mTyped{0};
 };
 

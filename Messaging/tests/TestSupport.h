@@ -36,32 +36,18 @@
 #include <boost/shared_ptr.hpp>
 #include <boost/weak_ptr.hpp>
 
-#include <gtest/gtest.h>
-
 #include "BoundedWait.h"
 
 #include <atomic>
-#include <chrono>
-#include <condition_variable>
-#include <cstdio>
-#include <cstdlib>
 #include <exception>
-#include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
-#include <thread>
+#include <type_traits>
 #include <utility>
-#include <vector>
 
 namespace messaging_test {
 
-using tarn_test::kDeadline;
-using tarn_test::Latch;
-using tarn_test::ThreadGroup;
-using tarn_test::WaitUntil;
-using tarn_test::Watchdog;
-namespace detail = tarn_test::detail;
+using namespace tarn_test;  // the bounded waits
 
 // ---------------------------------------------------------------------------
 // Process-wide hooks
@@ -75,7 +61,6 @@ public:
   MainThreadGuard() : mAdaptor(kivcore::threads::RegisterCurrentThreadAsMainThread()) {}
   MainThreadGuard(const MainThreadGuard&) = delete;
   MainThreadGuard& operator=(const MainThreadGuard&) = delete;
-  ~MainThreadGuard() { mAdaptor.reset(); }
 
   kivcore::threads::AsyncEventLoopAdaptor& Adaptor() const { return *mAdaptor; }
 
@@ -91,77 +76,81 @@ struct ContractViolation {
   int line = 0;
 };
 
-// Replaces the contract dialog with one that records every violation and
-// answers inAnswer ("break into the debugger?"). Restores the previous dialog
-// when destroyed. The dialog runs on the reporting thread, which may hold a
-// broadcaster's lock meanwhile: keep the recorder's users off that lock.
-class ContractDialogRecorder {
+// An ordered list that any thread may add to and read, each call under the
+// list's own mutex.
+template <typename Entry>
+class LockedList {
 public:
-  explicit ContractDialogRecorder(bool inAnswer = false)
-      : mState(std::make_shared<State>(inAnswer)),
-        mPrevious(kivcore::debug::SetContractDialogHandler(
-            [state = mState](const char* inCondition, const char* inFile, const char* inFunction, int inLine) {
-              std::lock_guard<std::mutex> lock(state->mMutex);
-              state->mViolations.push_back(ContractViolation{inCondition != nullptr ? inCondition : "",
-                                                             inFile != nullptr ? inFile : "",
-                                                             inFunction != nullptr ? inFunction : "", inLine});
-              return state->mAnswer;
-            })) {}
-  ContractDialogRecorder(const ContractDialogRecorder&) = delete;
-  ContractDialogRecorder& operator=(const ContractDialogRecorder&) = delete;
-  ~ContractDialogRecorder() { kivcore::debug::SetContractDialogHandler(std::move(mPrevious)); }
-
-  std::vector<ContractViolation> Violations() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mViolations;
+  void Add(Entry inEntry) {
+    std::lock_guard<std::mutex> lock(mMutex);
+    mEntries.push_back(std::move(inEntry));
   }
-  std::size_t Count() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mViolations.size();
+  std::vector<Entry> Entries() const {
+    std::lock_guard<std::mutex> lock(mMutex);
+    return mEntries;
+  }
+  std::size_t Count() const { return Entries().size(); }
+  void Clear() {
+    std::lock_guard<std::mutex> lock(mMutex);
+    mEntries.clear();
   }
 
 private:
-  struct State {
-    explicit State(bool inAnswer) : mAnswer(inAnswer) {}
-    mutable std::mutex mMutex;
-    std::vector<ContractViolation> mViolations;  // guarded by mMutex
-    const bool mAnswer;
-  };
-  std::shared_ptr<State> mState;  // shared with the installed handler
-  kivcore::debug::ContractDialogHandler mPrevious;
+  mutable std::mutex mMutex;
+  std::vector<Entry> mEntries;  // guarded by mMutex
+};
+
+// Swaps a process-wide hook (installed with inSet) for one that records what
+// each call was given as an Entry; restores the previous hook when
+// destroyed. The hook records on the reporting thread, so Entries and Count
+// may be read from any thread meanwhile.
+template <typename Entry, typename Handler, Handler (*inSet)(Handler)>
+class HookRecorder {
+public:
+  HookRecorder(const HookRecorder&) = delete;
+  HookRecorder& operator=(const HookRecorder&) = delete;
+  ~HookRecorder() { inSet(std::move(mPrevious)); }
+
+  std::vector<Entry> Entries() const { return mState->Entries(); }
+  std::size_t Count() const { return mState->Count(); }
+
+protected:
+  using State = LockedList<Entry>;
+  // inMakeHook(state) returns the hook to install; it records through state.
+  template <typename MakeHook>
+  explicit HookRecorder(MakeHook inMakeHook) : mState(std::make_shared<State>()), mPrevious(inSet(inMakeHook(mState))) {}
+
+private:
+  std::shared_ptr<State> mState;  // shared with the installed hook
+  Handler mPrevious;
+};
+
+// Replaces the contract dialog with one that records every violation and
+// answers inAnswer ("break into the debugger?"). The dialog runs on the
+// reporting thread, which may hold a broadcaster's lock meanwhile: keep the
+// recorder's users off that lock.
+class ContractDialogRecorder : public HookRecorder<ContractViolation, kivcore::debug::ContractDialogHandler,
+                                                   &kivcore::debug::SetContractDialogHandler> {
+public:
+  explicit ContractDialogRecorder(bool inAnswer = false)
+      : HookRecorder([inAnswer](std::shared_ptr<State> inState) {
+          return [inState, inAnswer](const char* inCondition, const char* inFile, const char* inFunction, int inLine) {
+            inState->Add(ContractViolation{inCondition != nullptr ? inCondition : "", inFile != nullptr ? inFile : "",
+                                           inFunction != nullptr ? inFunction : "", inLine});
+            return inAnswer;
+          };
+        }) {}
 };
 
 // Replaces the error handler with one that records every report and
 // returns, so that ThrowError returns to the operation that reported.
-// Restores the previous handler when destroyed.
-class ErrorRecorder {
+class ErrorRecorder : public HookRecorder<kivcore::config::ErrorReport, kivcore::config::ErrorHandler,
+                                          &kivcore::config::SetErrorHandler> {
 public:
   ErrorRecorder()
-      : mState(std::make_shared<State>()),
-        mPrevious(kivcore::config::SetErrorHandler([state = mState](const kivcore::config::ErrorReport& inReport) {
-          std::lock_guard<std::mutex> lock(state->mMutex);
-          state->mReports.push_back(inReport);
-        })) {}
-  ErrorRecorder(const ErrorRecorder&) = delete;
-  ErrorRecorder& operator=(const ErrorRecorder&) = delete;
-  ~ErrorRecorder() { kivcore::config::SetErrorHandler(std::move(mPrevious)); }
-
-  std::vector<kivcore::config::ErrorReport> Reports() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mReports;
-  }
-  std::size_t Count() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mReports.size();
-  }
-
-private:
-  struct State {
-    mutable std::mutex mMutex;
-    std::vector<kivcore::config::ErrorReport> mReports;  // guarded by mMutex
-  };
-  std::shared_ptr<State> mState;
-  kivcore::config::ErrorHandler mPrevious;
+      : HookRecorder([](std::shared_ptr<State> inState) {
+          return [inState](const kivcore::config::ErrorReport& inReport) { inState->Add(inReport); };
+        }) {}
 };
 
 // Installs the default error handler (ThrowError throws
@@ -180,43 +169,22 @@ private:
 
 // Replaces the error manager's exception handler (what GuardedCall does with
 // an exception a listener raised) with one that records the exception's
-// what() text, or "unknown" for a non-standard exception. Restores the
-// previous handler when destroyed.
-class ExceptionRecorder {
+// what() text, or "unknown" for a non-standard exception.
+class ExceptionRecorder : public HookRecorder<std::string, kivcore::config::ErrorManager::ExceptionHandler,
+                                              &kivcore::config::ErrorManager::SetExceptionHandler> {
 public:
   ExceptionRecorder()
-      : mState(std::make_shared<State>()),
-        mPrevious(kivcore::config::ErrorManager::SetExceptionHandler([state = mState](std::exception_ptr inError) {
-          std::string text = "unknown";
-          try {
-            std::rethrow_exception(inError);
-          } catch (const std::exception& e) {
-            text = e.what();
-          } catch (...) {
-          }
-          std::lock_guard<std::mutex> lock(state->mMutex);
-          state->mMessages.push_back(std::move(text));
-        })) {}
-  ExceptionRecorder(const ExceptionRecorder&) = delete;
-  ExceptionRecorder& operator=(const ExceptionRecorder&) = delete;
-  ~ExceptionRecorder() { kivcore::config::ErrorManager::SetExceptionHandler(std::move(mPrevious)); }
-
-  std::vector<std::string> Messages() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mMessages;
-  }
-  std::size_t Count() const {
-    std::lock_guard<std::mutex> lock(mState->mMutex);
-    return mState->mMessages.size();
-  }
-
-private:
-  struct State {
-    mutable std::mutex mMutex;
-    std::vector<std::string> mMessages;  // guarded by mMutex
-  };
-  std::shared_ptr<State> mState;
-  kivcore::config::ErrorManager::ExceptionHandler mPrevious;
+      : HookRecorder([](std::shared_ptr<State> inState) {
+          return [inState](std::exception_ptr inError) {
+            try {
+              std::rethrow_exception(inError);
+            } catch (const std::exception& e) {
+              inState->Add(e.what());
+            } catch (...) {
+              inState->Add("unknown");
+            }
+          };
+        }) {}
 };
 
 // Lets the next inSucceeding small-block allocations succeed and fails every
@@ -258,25 +226,7 @@ inline std::string Describe(const Tarn::Message& inMessage) {
 
 // An ordered record of calls, shared by the listeners of a test; entries are
 // "<listener name>:<Describe(message)>".
-class CallLog {
-public:
-  void Record(std::string inEntry) {
-    std::lock_guard<std::mutex> lock(mMutex);
-    mEntries.push_back(std::move(inEntry));
-  }
-  std::vector<std::string> Entries() const {
-    std::lock_guard<std::mutex> lock(mMutex);
-    return mEntries;
-  }
-  void Clear() {
-    std::lock_guard<std::mutex> lock(mMutex);
-    mEntries.clear();
-  }
-
-private:
-  mutable std::mutex mMutex;
-  std::vector<std::string> mEntries;  // guarded by mMutex
-};
+using CallLog = LockedList<std::string>;
 
 // What every recording listener shares, whatever its base class: a name, an
 // optional log, a call count, an optional action run after the call is
@@ -306,7 +256,7 @@ public:
 protected:
   void RecordCall(const Tarn::Message& inMessage) {
     mProbe->mCalls.fetch_add(1);
-    if (mLog != nullptr) mLog->Record(mName + ":" + Describe(inMessage));
+    if (mLog != nullptr) mLog->Add(mName + ":" + Describe(inMessage));
     if (mAction) mAction(inMessage);
   }
 
@@ -417,36 +367,24 @@ public:
   void SetAction(CallRecorder::Action inAction) { mRecorder->SetAction(std::move(inAction)); }
 
   void Attach(Tarn::Broadcaster& inBroadcaster) {
-    switch (mKind) {
-      case ListenerKind::kPlainPointer:
-        inBroadcaster.AddListener(mPlain.get());
-        mPlain->DetachInDestructor(inBroadcaster);
-        break;
-      case ListenerKind::kBoostWeak:
-        inBroadcaster.AddListener(boost::weak_ptr<Tarn::Listener>(mBoost));
-        break;
-      case ListenerKind::kStdWeak:
-        inBroadcaster.AddListener(std::weak_ptr<Tarn::Listener>(mStd));
-        break;
-      case ListenerKind::kSafe:
-        inBroadcaster.AddListener(mSafe);
-        break;
-    }
+    WithHandle([&](const auto& inHandle) { inBroadcaster.AddListener(inHandle); });
+    if (mPlain) mPlain->DetachInDestructor(inBroadcaster);
   }
   void Detach(Tarn::Broadcaster& inBroadcaster) {
+    WithHandle([&](const auto& inHandle) {
+      if constexpr (std::is_pointer_v<std::decay_t<decltype(inHandle)>>) inBroadcaster.RemoveListener(inHandle, true);
+      else inBroadcaster.RemoveListener(inHandle);
+    });
+  }
+  // Calls inCall with what the overloads for the kind take (a broadcaster's,
+  // Tarn::Attach's); the handle must still own the listener.
+  template <class Call>
+  void WithHandle(Call inCall) {
     switch (mKind) {
-      case ListenerKind::kPlainPointer:
-        inBroadcaster.RemoveListener(mPlain.get(), true);
-        break;
-      case ListenerKind::kBoostWeak:
-        inBroadcaster.RemoveListener(boost::weak_ptr<Tarn::Listener>(mBoost));
-        break;
-      case ListenerKind::kStdWeak:
-        inBroadcaster.RemoveListener(std::weak_ptr<Tarn::Listener>(mStd));
-        break;
-      case ListenerKind::kSafe:
-        inBroadcaster.RemoveListener(mSafe);
-        break;
+      case ListenerKind::kPlainPointer: return inCall(static_cast<Tarn::Listener*>(mPlain.get()));
+      case ListenerKind::kBoostWeak: return inCall(boost::weak_ptr<Tarn::Listener>(mBoost));
+      case ListenerKind::kStdWeak: return inCall(std::weak_ptr<Tarn::Listener>(mStd));
+      case ListenerKind::kSafe: return inCall(mSafe);
     }
   }
   // Ends the handle's ownership. The listener itself may live on for a

@@ -10,23 +10,13 @@
 #include <TarnMessaging/Subscription.h>
 #include <TarnMessaging/Tracing.h>
 
-#include <gtest/gtest.h>
-
-#include <chrono>
-#include <cstdio>
-#include <cstdlib>
-#include <mutex>
 #include <optional>
 #include <stdexcept>
-#include <thread>
 #include <tuple>
 
 namespace {
 
-using messaging_test::Latch;
-using messaging_test::NumberMessage;
-using messaging_test::PingMessage;
-using messaging_test::RecordingListener;
+using namespace messaging_test;
 using Kind = Tarn::Tracing::ListenerKind;
 using std::chrono::milliseconds;
 
@@ -191,12 +181,12 @@ TEST(Tracing, ARemovalWaitingPastTheThresholdReportsOnceAndGoesOnWaiting) {
     releaser.join();
     remover.join();
     EXPECT_TRUE(removed.load());
-    const std::string text = throwingHandler ? exceptions.Messages().at(0) : recorder->Reports().at(0).key;
+    const std::string text = throwingHandler ? exceptions.Entries().at(0) : recorder->Entries().at(0).key;
     const std::size_t waited = text.find("has waited ");
     EXPECT_GE(std::atoi(text.c_str() + (waited == std::string::npos ? text.size() : waited + 11)), 30) << text;
     if (!throwingHandler) {
       EXPECT_EQ(text.rfind(Tarn::Tracing::kRemovalWaitKey, 0), 0u) << text;
-      const kivcore::config::ErrorReport report = recorder->Reports().at(0);
+      const kivcore::config::ErrorReport report = recorder->Entries().at(0);
       EXPECT_EQ(std::make_tuple(report.level, report.number, report.code, report.flag), std::make_tuple(0, 0u, 0, false));
     }
     for (const std::string& part :
@@ -268,7 +258,7 @@ TEST(Tracing, DestroyingWhatADeliveryStillUsesIsReportedInDebugBuilds) {
   // A main-thread-only object destroyed on a worker.
   auto timer = std::make_unique<Tarn::IdleCountdownTimer>();
   std::thread([&] { timer.reset(); }).join();
-  const std::vector<messaging_test::ContractViolation> violations = dialog.Violations();
+  const std::vector<messaging_test::ContractViolation> violations = dialog.Entries();
   ASSERT_EQ(violations.size(), 4 * kDebugReports);
   EXPECT_EQ(errors.Count(), 1 + 4 * kDebugReports) << "the removal-wait report, and one per violation";
   const char* const expected[] = {"Tarn::Broadcaster::~Broadcaster", "Tarn::Broadcaster::~Broadcaster",

@@ -4,13 +4,10 @@
 #include <kivcore/Error.h>
 #include <kivcore/Guid.h>
 
-#include <gtest/gtest.h>
-
 #include <atomic>
 #include <memory>
 #include <stdexcept>
 #include <string>
-#include <thread>
 
 using namespace kivcore;
 

@@ -2,8 +2,6 @@
 
 #include <kivcore/ImmutableString.h>
 
-#include <gtest/gtest.h>
-
 #include <atomic>
 #include <string>
 #include <string_view>

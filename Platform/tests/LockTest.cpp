@@ -3,8 +3,6 @@
 #include <kivcore/Gate.h>
 #include <kivcore/RecursiveMutex.h>
 
-#include <gtest/gtest.h>
-
 #include <atomic>
 
 using namespace kivcore::threads;

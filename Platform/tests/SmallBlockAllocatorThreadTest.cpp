@@ -2,8 +2,6 @@
 
 #include <kivcore/SmallBlockAllocator.h>
 
-#include <gtest/gtest.h>
-
 #include <pthread.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
@@ -12,12 +10,9 @@
 #include <algorithm>
 #include <atomic>
 #include <cstdint>
-#include <cstdio>
 #include <cstring>
 #include <random>
 #include <set>
-#include <thread>
-#include <vector>
 
 using kivcore::utility::SmallBlockAllocator;
 

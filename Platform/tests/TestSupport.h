@@ -4,10 +4,4 @@
 
 #include "BoundedWait.h"
 
-namespace platform_test {
-
-using tarn_test::kDeadline;
-using tarn_test::Latch;
-using tarn_test::ThreadGroup;
-
-}  // namespace platform_test
+namespace platform_test = tarn_test;
