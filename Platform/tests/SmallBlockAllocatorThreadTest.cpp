@@ -86,6 +86,11 @@ TEST(SmallBlockAllocator, ASystemOutOfMemoryGivesNullInsteadOfACrash) {
     const rlim_t cap = static_cast<rlim_t>(pages) * static_cast<rlim_t>(::sysconf(_SC_PAGESIZE)) + (rlim_t{8} << 20);
     const rlimit limit{cap, cap};
     if (pages == 0 || ::setrlimit(RLIMIT_AS, &limit) != 0) ::_exit(2);
+    // Blocks past the small limit come from the heap: one refused is not counted.
+    const auto before = SmallBlockAllocator::GetStatistics().blocksInUse;
+    std::size_t large = 0;
+    while (large < 4096 && SmallBlockAllocator::Allocate(std::size_t{1} << 20) != nullptr) ++large;
+    if (large == 4096 || SmallBlockAllocator::GetStatistics().blocksInUse != before + large) ::_exit(4);
     for (long made = 0; made < (1L << 24); ++made) {
       if (SmallBlockAllocator::Allocate(48) == nullptr) ::_exit(0);
     }
