@@ -388,7 +388,7 @@ public:
     }
   }
   // Ends the handle's ownership. The listener itself may live on for a
-  // delivery in progress (weak and safe kinds); IsDestroyed tells.
+  // delivery in progress (weak and safe kinds); its recorder's probe tells.
   void Destroy() {
     mRecorder = nullptr;
     mPlain.reset();
