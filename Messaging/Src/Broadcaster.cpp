@@ -272,11 +272,7 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
     // with the lock let go (taken again however the report ends), and the
     // entry is looked up anew after.
     {
-      struct Relock {
-        RecursiveMutex& mMutex;
-        ~Relock() { mMutex.Lock("Broadcaster::RemoveListener1"); }
-      } relock{mMutex};
-      mMutex.Unlock();
+      const kivcore::threads::ScopedUnlock unlocked(mMutex, "Broadcaster::RemoveListener1");
       TARN_CONTRACT_CHECK(noEarlierRemovalWaits, kRemoveListenerName);
     }
     found = mIndex.find(inListener);
@@ -310,10 +306,9 @@ BroadcasterCore::Removed BroadcasterCore::Remove(const ListenerEntry& inListener
       // The entry is gone, so no new delivery of it starts; the running one
       // ends after the delivery on this stack does. The report runs without
       // the lock, as host code must.
-      mMutex.Unlock();
+      const kivcore::threads::ScopedUnlock unlocked(mMutex, "Broadcaster::RemoveListener2");
       TracingState::ReportMisuse("a removal inside a handler never waits for a delivery whose thread waits for that handler",
                                  __FILE__, kRemoveListenerName, __LINE__);
-      mMutex.Lock("Broadcaster::RemoveListener2");
       return Removed::kAtOnce;
     }
   }

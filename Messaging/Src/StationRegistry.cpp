@@ -129,9 +129,8 @@ enum class Sweep {
 // that delivery's end looks for retired stations under the lock. The lock
 // must be held.
 void DeleteUnlocked(Station* inStation) noexcept {
-  sStationRegistryMutex.Unlock();
+  const kivcore::threads::ScopedUnlock unlocked(sStationRegistryMutex, nullptr);
   StationRetirement::Delete(inStation);
-  sStationRegistryMutex.Lock(nullptr);
 }
 
 // Deletes the stations of the list that Sweep names and no broadcast holds,

@@ -97,4 +97,22 @@ private:
   RecursiveMutex& mMutex;
 };
 
+/// The opposite for a scope inside a held lock: lets go of one level of
+/// inMutex on construction and takes it again on destruction (every way out,
+/// an exception included), for code that must not run under the lock (a
+/// host's handler or report, a wait for another thread). The caller must
+/// hold inMutex, and what the lock guards may change meanwhile.
+class ScopedUnlock {
+public:
+  /// Unlocks inMutex; the destructor locks it again, naming the site inLabel.
+  ScopedUnlock(RecursiveMutex& inMutex, const char* inLabel) : mMutex(inMutex), mLabel(inLabel) { mMutex.Unlock(); }
+  ~ScopedUnlock() { mMutex.Lock(mLabel); }
+  ScopedUnlock(const ScopedUnlock&) = delete;
+  ScopedUnlock& operator=(const ScopedUnlock&) = delete;
+
+private:
+  RecursiveMutex& mMutex;
+  const char* mLabel;
+};
+
 }  // namespace kivcore::threads
