@@ -51,13 +51,19 @@ void ReportContractViolation(const std::string& inCondition, const char* inFile,
 // registry's lock; defined with the registry.
 bool IsStationRegistered(const kivcore::utility::ImmutableString& inStationID);
 
+// ReportIfUnregistered's lookup and report, out of line.
+void ReportUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
+                        const char* inOperation) noexcept;
+
 // Reports inOperation on an ID that no station is registered under, when
 // reports are on (a factory that gave no station is the factory's business;
-// the empty ID names no station on purpose). Looks the ID up only then, so
-// that a post's check costs one relaxed load while reports are off. Never
-// throws.
-void ReportIfUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
-                          const char* inOperation) noexcept;
+// the empty ID names no station on purpose). Inline, and looks the ID up
+// only then, so that a post's check costs one relaxed load while reports are
+// off. Never throws.
+inline void ReportIfUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
+                                 const char* inOperation) noexcept {
+  if (ReportsOn()) ReportUnregistered(inStationID, inCallSite, inOperation);
+}
 
 }  // namespace Tarn::Diagnostics::Detail
 

@@ -157,9 +157,9 @@ void ReportSilentFailure(Failure inFailure, const void* inCallSite, const char* 
   }
 }
 
-void ReportIfUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
-                          const char* inOperation) noexcept {
-  if (!ReportsOn() || inStationID.empty()) return;
+void ReportUnregistered(const kivcore::utility::ImmutableString& inStationID, const void* inCallSite,
+                        const char* inOperation) noexcept {
+  if (inStationID.empty()) return;
   try {
     if (IsStationRegistered(inStationID)) return;
   } catch (...) {

@@ -147,9 +147,7 @@ bool PostCancelToken::IsCancelled() const noexcept { return mState->mCancelled.l
 
 void StationUtils::PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
                                          const PostCancelToken& inToken) {
-  if (Diagnostics::Detail::ReportsOn())
-    Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(),
-                                              "Tarn::StationUtils::PostMessageToUIThread");
+  Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::PostMessageToUIThread");
   const std::shared_ptr<CancelState>& state = CancelState::Of(inToken);
   if (state->mCancelled.load(std::memory_order_acquire)) return;
   // Declared before the lock, so that a copy dropped under it is freed after.
@@ -293,15 +291,13 @@ constexpr const char* kCoalescedName = "Tarn::StationUtils::PostCoalescedMessage
 }  // namespace
 
 void StationUtils::PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage) {
-  if (Diagnostics::Detail::ReportsOn())
-    Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kCoalescedName);
+  Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kCoalescedName);
   PostCoalesced(CoalescingKey{inStationID, inMessage.GetMessageID(), CoalesceBy::kMessageType}, inMessage);
 }
 
 void StationUtils::PostCoalescedMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage,
                                                   std::uint64_t inCallerKey) {
-  if (Diagnostics::Detail::ReportsOn())
-    Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kCoalescedName);
+  Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kCoalescedName);
   PostCoalesced(CoalescingKey{inStationID, inCallerKey, CoalesceBy::kCallerKey}, inMessage);
 }
 
@@ -359,9 +355,7 @@ void RunRest(IdleRun& ioRun) {
 }  // namespace
 
 void StationUtils::PostMessageAtIdleTime(const ImmutableString& inStationID, const Message& inMessage) {
-  if (Diagnostics::Detail::ReportsOn())
-    Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(),
-                                              "Tarn::StationUtils::PostMessageAtIdleTime");
+  Diagnostics::Detail::ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::PostMessageAtIdleTime");
   PostedCall call = inMessage.CreateCallback(inStationID);
   IdlePosts& posts = Idle();
   std::lock_guard<std::mutex> lock(posts.mMutex);

@@ -25,22 +25,20 @@ bool IsAlive(const WeakPtr& inListener) {
   return inListener.lock() != nullptr;
 }
 
-void ReportNoStation(const ImmutableString& inStationID, const void* inCallSite, const char* inOperation) noexcept {
-  Diagnostics::Detail::ReportIfUnregistered(inStationID, inCallSite, inOperation);
-}
+using Diagnostics::Detail::ReportIfUnregistered;
 
 void RemoveAt(const ImmutableString& inStationID, Listener* inListener, const void* inCallSite) {
   StationRetainer station(inStationID);
   // The broadcaster checks and ignores a null listener itself.
   if (station) station->RemoveListener(inListener, true);
-  else ReportNoStation(inStationID, inCallSite, kRemoveListenerName);
+  else ReportIfUnregistered(inStationID, inCallSite, kRemoveListenerName);
 }
 
 template <class ListenerRef>
 void AddAt(const ImmutableString& inStationID, const ListenerRef& inListener, const void* inCallSite) {
   StationRetainer station(inStationID);
   if (station) station->AddListener(inListener);
-  else ReportNoStation(inStationID, inCallSite, "Tarn::StationUtils::AddListener");
+  else ReportIfUnregistered(inStationID, inCallSite, "Tarn::StationUtils::AddListener");
 }
 
 void BroadcastAt(const ImmutableString& inStationID, const Message& inMessage, const void* inCallSite) {
@@ -52,7 +50,7 @@ void BroadcastAt(const ImmutableString& inStationID, const Message& inMessage, c
   }
   StationRetainer station(inStationID);
   if (station) station->BroadcastMessage(inMessage);
-  else ReportNoStation(inStationID, inCallSite, "Tarn::StationUtils::BroadcastMessage");
+  else ReportIfUnregistered(inStationID, inCallSite, "Tarn::StationUtils::BroadcastMessage");
 }
 
 }  // namespace
@@ -78,7 +76,7 @@ void RemoveListener(const ImmutableString& inStationID, const boost::weak_ptr<Li
   if (!IsAlive(inListener)) TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   StationRetainer station(inStationID);
   if (station) station->RemoveListener(inListener);
-  else ReportNoStation(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
+  else ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
 }
 
 void RemoveListener(const ImmutableString& inStationID, const std::weak_ptr<Listener>& inListener) {
@@ -86,7 +84,7 @@ void RemoveListener(const ImmutableString& inStationID, const std::weak_ptr<List
   if (!IsAlive(inListener)) TARN_CONTRACT_CHECK(inListener.lock() != NULL, kRemoveListenerName);
   StationRetainer station(inStationID);
   if (station) station->RemoveListener(inListener);
-  else ReportNoStation(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
+  else ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
 }
 
 void RemoveListener(const ImmutableString& inStationID, Listener* inListener) {
@@ -98,7 +96,7 @@ void RemoveListener(const ImmutableString& inStationID, InterfaceRef<ISafeListen
   TARN_CONTRACT_CHECK(inListener != NULL, kRemoveListenerName);
   StationRetainer station(inStationID);
   if (station) station->RemoveListener(inListener);
-  else ReportNoStation(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
+  else ReportIfUnregistered(inStationID, TARN_CALL_SITE(), kRemoveListenerName);
 }
 
 void BroadcastMessage(const ImmutableString& inStationID, const Message& inMessage) {
@@ -116,7 +114,7 @@ bool HasListeners(const ImmutableString& inStationID) {
 
 void RetainStation(const ImmutableString& inStationID) {
   if (StationRegistry::RetainStation(inStationID) == nullptr)
-    ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::RetainStation");
+    ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::RetainStation");
 }
 
 void ReleaseStation(const ImmutableString& inStationID) { StationRegistry::ReleaseStation(inStationID); }
@@ -124,13 +122,13 @@ void ReleaseStation(const ImmutableString& inStationID) { StationRegistry::Relea
 void StartBroadcasting(const ImmutableString& inStationID) {
   StationRetainer station(inStationID);
   if (station) station->StartBroadcasting();
-  else ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::StartBroadcasting");
+  else ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::StartBroadcasting");
 }
 
 void StopBroadcasting(const ImmutableString& inStationID) {
   StationRetainer station(inStationID);
   if (station) station->StopBroadcasting();
-  else ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::StopBroadcasting");
+  else ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::StopBroadcasting");
 }
 
 void SwitchStation(const ImmutableString& inFromStationID, const ImmutableString& inToStationID,
@@ -148,8 +146,7 @@ void SwitchStation(const ImmutableString& inFromStationID, const ImmutableString
 }
 
 void PostMessageToUIThread(const ImmutableString& inStationID, const Message& inMessage, bool inForceAsync) {
-  if (Diagnostics::Detail::ReportsOn())
-    ReportNoStation(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::PostMessageToUIThread");
+  ReportIfUnregistered(inStationID, TARN_CALL_SITE(), "Tarn::StationUtils::PostMessageToUIThread");
   if (!inForceAsync && kivcore::threads::CurrentThreadIsMainThread()) {
     BroadcastMessage(inStationID, inMessage);
     return;
