@@ -123,6 +123,14 @@ enum class Sweep {
   kEverything // at static destruction: every station, busy or not
 };
 
+// After stations left the pending list: whether a retired one remains, and
+// no storage once it is empty, so that a drained registry holds no blocks
+// beyond its records. The registry's lock must be held.
+void Settle(PendingStationList& ioList) noexcept {
+  sHasRetired.store(std::any_of(ioList.begin(), ioList.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
+  if (ioList.empty()) PendingStationList().swap(ioList);
+}
+
 // Deletes a station the registry no longer reaches, letting the registry's
 // lock go (one level of it) meanwhile: the station's detach may wait for a
 // delivery to it on another thread (the main thread may have moved), and
@@ -160,10 +168,7 @@ void DeleteAll(PendingStationList& ioList, Sweep inSweep) {
     ioList.erase(doomed);
     DeleteUnlocked(station);
   }
-  sHasRetired.store(std::any_of(ioList.begin(), ioList.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
-  // An empty list keeps no storage, so that a drained registry holds no
-  // blocks beyond its records.
-  if (ioList.empty()) PendingStationList().swap(ioList);
+  Settle(ioList);
 }
 
 struct PendingStationHolder {
@@ -289,8 +294,7 @@ Station* ReleaseRetiredHold(Station* inStation) noexcept {
   });
   if (held == pending.end() || --held->mCallHolds != 0 || StationRetirement::IsBroadcasting(*inStation)) return nullptr;
   pending.erase(held);
-  sHasRetired.store(std::any_of(pending.begin(), pending.end(), [](const PendingStation& inPending) { return inPending.mRetired; }));
-  if (pending.empty()) PendingStationList().swap(pending);
+  Settle(pending);
   return inStation;
 }
 
