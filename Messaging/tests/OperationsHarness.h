@@ -616,7 +616,8 @@ private:
     mPosts[0].erase(std::remove_if(mPosts[0].begin(), mPosts[0].end(), [&](const Queued& inPost) { return inPost.mKind == 2 && inPost.mKey == inToken; }), mPosts[0].end());
     mCancelled[inToken] = true;
     OnThread(inHelper, [&] { mTokens[inToken].Cancel(); });
-    if (Pick(2) == 0) mTokens[inToken] = Tarn::PostCancelToken(), mCancelled[inToken] = false;
+    // Not after a cancel that threw: the model goes back to before it, and a new token would not.
+    if (!mThrew && Pick(2) == 0) mTokens[inToken] = Tarn::PostCancelToken(), mCancelled[inToken] = false;
   }
 
   // What a main thread does for workers: runs the pending calls (the posts), deletes the stations they disposed of.
